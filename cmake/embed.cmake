@@ -1,0 +1,21 @@
+# Turns every file under DIR into a C++ table of (relative path, bytes), so that
+# `velmor --init` can write the default installation without any outside file.
+# Run as: cmake -DDIR=... -DOUT=... -P embed.cmake
+file(GLOB_RECURSE files RELATIVE "${DIR}" "${DIR}/*")
+list(REMOVE_ITEM files CMakeLists.txt)
+list(SORT files)
+set(body "")
+set(table "")
+set(n 0)
+foreach(rel IN LISTS files)
+  file(READ "${DIR}/${rel}" hex HEX)
+  string(LENGTH "${hex}" hexlen)
+  math(EXPR size "${hexlen} / 2")
+  string(REGEX REPLACE "([0-9a-f][0-9a-f])" "'\\\\x\\1'," bytes "${hex}")
+  string(APPEND body "static const char file_${n}[] = {${bytes} 0};\n")
+  string(APPEND table "  {\"${rel}\", std::string_view(file_${n}, ${size})},\n")
+  math(EXPR n "${n} + 1")
+endforeach()
+file(WRITE "${OUT}.new" "// Generated from the defaults folder; do not edit.\n#include \"core/defaults.h\"\nnamespace velmor {\n${body}\nconst std::vector<DefaultFile>& default_files() {\n  static const std::vector<DefaultFile> files = {\n${table}  };\n  return files;\n}\n}  // namespace velmor\n")
+file(COPY_FILE "${OUT}.new" "${OUT}" ONLY_IF_DIFFERENT)
+file(REMOVE "${OUT}.new")

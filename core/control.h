@@ -1,0 +1,20 @@
+// The control channel: a local datagram socket through which local tools
+// (velmorctl) run internal commands, reload configuration, users and groups,
+// switch log facilities, change a password and read the queues and status.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <string_view>
+
+namespace velmor {
+
+// Creates and binds the socket at paths.control and makes its record. A
+// failure is logged; the suite then runs without a control channel.
+void control_open();
+// Removes the socket path, only when this process made it.
+void control_remove();
+// Handles one command text; every reply datagram goes to `reply`.
+void control_command(std::string_view text, const std::function<void(std::string_view)>& reply);
+
+}  // namespace velmor

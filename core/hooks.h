@@ -1,0 +1,49 @@
+// The core calls into the other subsystems only through these hooks, which
+// each subsystem fills when it starts (core/main.cpp wires them). A hook that
+// no subsystem has filled yet does nothing: the command is accepted and
+// ignored until that subsystem exists.
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+namespace velmor {
+
+struct GroupOptions;
+
+struct SuiteHooks {
+  // Internal command words (control channel, scheduler, administration).
+  std::function<void()> dial;          // "connect"
+  std::function<void()> disconnect;    // "disconnect"
+  std::function<void()> popkick;       // POP3 client fetch check now
+  std::function<void()> smtpkick;      // SMTP client on the outgoing queue now
+  std::function<void()> newskick;      // news fetch for all servers
+  std::function<void()> mailrescan;    // rescan incoming, then outgoing
+  std::function<void()> maildebatch;   // debatch one incoming file now
+  std::function<void()> newsdebatch;
+
+  // Control channel.
+  std::function<int()> reload_users;
+  std::function<int()> reload_groups;
+  // 1 = old password wrong; 2 = changed; 0 = the change failed.
+  std::function<int(std::string_view user, std::string_view old_password,
+                    std::string_view new_password)> change_password;
+  // Each listing line is handed to `send` as one datagram.
+  std::function<void(const std::function<void(std::string_view)>& send)> list_mail_queue;
+  std::function<void(const std::function<void(std::string_view)>& send)> list_news_queue;
+  std::function<std::size_t()> outgoing_mail_count;
+
+  // Connection counts of the mail clients, for the mail transfer sequence.
+  std::function<int()> pop_client_count;
+  std::function<int()> smtp_client_count;
+
+  // The group set every new socket record starts with (none until the
+  // groups are loaded).
+  std::function<std::shared_ptr<const GroupOptions>()> default_group;
+};
+extern SuiteHooks hooks;
+
+}  // namespace velmor

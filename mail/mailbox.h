@@ -1,0 +1,87 @@
+// Local mailboxes. A mailbox is a file of messages, each starting with a
+// "From sender date" separator line, all lines CR LF, bodies in SMTP
+// transmission form ending with a "." line. Beside every mailbox an overview
+// index (<dir>/overview/<box>) lists each message's lengths, dates, flags,
+// unique identifier and main headers, plus its MIME parts, so readers list a
+// mailbox without reading it.
+#pragma once
+
+#include <cstdint>
+#include <ctime>
+#include <list>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace velmor {
+
+class CacheFile;
+
+// Message flags.
+namespace msgflag {
+inline constexpr std::uint32_t answered = 0x08;
+inline constexpr std::uint32_t deleted = 0x10;
+inline constexpr std::uint32_t seen = 0x20;
+inline constexpr std::uint32_t mime = 0x100;
+inline constexpr std::uint32_t receipt_wanted = 0x200;
+inline constexpr std::uint32_t draft = 0x400;
+inline constexpr std::uint32_t flagged = 0x800;
+inline constexpr std::uint32_t recent = 0x1000;
+}  // namespace msgflag
+
+struct MimePart {
+  std::string content_type, description, content_id;
+  std::uint32_t length = 0, lines = 0, body_offset = 0;
+  int encoding = 0;  // 3 base64, 4 quoted-printable, 0 other
+  int level = 1, number = 1;
+};
+
+struct MessageRecord {
+  std::string from, to, subject, reply_to;
+  std::time_t internal_date = 0, sent_date = 0;
+  std::uint64_t total_length = 0;   // including the separator line
+  std::uint64_t length = 0;         // without it
+  std::uint32_t flags = 0;
+  std::uint32_t uid = 0;
+  std::uint64_t header_length = 0;  // offset of the body from the message start
+  std::list<MimePart> parts;
+};
+
+// Mailbox record flags.
+namespace boxflag {
+inline constexpr std::uint32_t in_use = 0x01;  // a POP3/IMAP/web-mail session has it
+inline constexpr std::uint32_t new_mail = 0x1000;
+inline constexpr std::uint32_t delivered = 0x10000;
+}  // namespace boxflag
+
+struct Mailbox {
+  std::string path;
+  std::uint32_t flags = 0;
+  int in_use_by = -1;  // descriptor (or other session id) holding the in-use mark
+  int count = 0, unseen = 0;
+  std::uint32_t next_uid = 1;
+  bool changed = false;
+  std::time_t looked_up = 0, overview_written = 0, loaded = 0;
+  std::list<MessageRecord> messages;
+};
+
+// Delivers one queued message to a local recipient. 1 = dealt with
+// (delivered, forwarded, refused with an error mail, or kept in the queue for
+// a later try); 0 = not handled (the caller treats the user as unknown).
+int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender);
+std::string mailbox_path_for_name(std::string_view home, std::string_view name);
+std::string mailbox_overview_path(std::string_view mailbox_path);
+// The cached record of a mailbox (loading or rebuilding its overview);
+// nullptr when the path is not a regular file.
+Mailbox* mailbox_lookup(const std::string& path);
+// The in-use mark shared by POP3, IMAP and web mail: true when taken.
+bool mailbox_take(Mailbox& box, int owner);
+void mailbox_release(Mailbox& box, int owner);
+// Removes the deleted messages, rewriting the mailbox through a temporary
+// file and a rename. 0 or an errno value (the old mailbox is then intact).
+int mailbox_expunge(Mailbox& box);
+int mailbox_overview_write(Mailbox& box);
+int mailbox_overview_read(Mailbox& box);
+
+}  // namespace velmor

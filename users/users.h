@@ -1,0 +1,47 @@
+// The user database: one flat file of login name, password hash ("$1$"),
+// full name, home directory and group number. Loaded at start-up and on
+// "reload users", written back whole (old file kept as <file>~) after every
+// change. User names compare without regard to case.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace velmor {
+
+struct GroupOptions;
+
+struct UserRecord {
+  std::string login;
+  std::string password_hash;
+  std::string full_name;
+  std::string home;
+  int group = 0;
+};
+
+int user_load(const std::string& path);  // 0; 1 cannot open (table empty); 2 no memory
+int user_save();                          // 0; non-zero when the file could not be written
+// By login name, then dotted full name ("ann.lee"), then initials ("a.lee").
+const UserRecord* user_find(std::string_view key);
+// 0 correct; 1 no such user, no stored hash or no password; 2 wrong.
+int user_check_password(std::string_view name, std::string_view password);
+// 0 added; 1 failed; 3 a field holds a character the file cannot carry
+// (comma, CR, LF or NUL); 4 the login exists already.
+int user_add(std::string_view name, std::string_view password, std::string_view full_name,
+             std::string_view home, int group);
+int user_set_password(std::string_view name, std::string_view password);  // 1 changed; 0 not
+int user_set_home(std::string_view name, std::string_view home);          // 1 changed; 0 not
+int user_set_name(std::string_view name, std::string_view full_name);     // 1 changed; 0 not
+int user_set_group(std::string_view name, int group);                     // 1 changed; 0 not
+int user_remove(std::string_view name);                                   // 0 removed; 1 not found
+std::string user_home(std::string_view name);        // "" when unknown
+std::string user_full_name(std::string_view name);   // "" when unknown
+bool user_exists(std::string_view name);
+// The user's group set; the default group when the name is empty or unknown
+// or its group has no set; nullptr when no groups are loaded at all.
+std::shared_ptr<const GroupOptions> user_group(std::string_view name);
+std::vector<const UserRecord*> user_list();  // in file order
+
+}  // namespace velmor
