@@ -66,9 +66,13 @@ struct Mailbox {
   std::list<MessageRecord> messages;
 };
 
-// Delivers one queued message to a local recipient. 1 = dealt with
-// (delivered, forwarded, refused with an error mail, or kept in the queue for
-// a later try); 0 = not handled (the caller treats the user as unknown).
+// Delivers one queued message to a local recipient.
+//   1 = dealt with (delivered, forwarded, or refused with an error mail);
+//   0 = not handled (the caller treats the user as unknown);
+//   2 = a temporary failure (disk full, mailbox unwritable): nothing was
+//       delivered, the mailbox is as it was, and the queue file must be kept
+//       for a later try.
+inline constexpr int kAppendTemporaryFailure = 2;
 int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender);
 std::string mailbox_path_for_name(std::string_view home, std::string_view name);
 std::string mailbox_overview_path(std::string_view mailbox_path);
