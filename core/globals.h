@@ -64,4 +64,8 @@ struct SuitePaths {
 };
 extern SuitePaths paths;
 
+// This host's name: inet$hostname (with "." and inet$localdomain when that is
+// set too) from the environment, else the system's host name.
+const std::string& host_name();
+
 }  // namespace velmor

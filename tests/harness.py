@@ -1,0 +1,237 @@
+"""End-to-end harness: a private Velmor installation on free loopback ports.
+
+    s = Suite(config={'smtp.sock.max': '2'})
+    s.start()                 # waits until the suite answers
+    smtplib.SMTP('127.0.0.1', s.port('smtp'))
+    s.ctl('listmq')           # -> (returncode, stdout) of velmorctl
+    s.stop()                  # SIGTERM; returns the exit status
+
+Every wait has a time-out; stop() and the test case's tearDown always end the
+daemon, also when a test fails. The daemon's console output is kept in
+<root>/daemon.out for debugging.
+"""
+
+import os
+import re
+import shutil
+import signal
+import socket
+import subprocess
+import tempfile
+import time
+import unittest
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+TOP = os.path.dirname(HERE)
+
+
+def _binary(env_name, name):
+    path = os.environ.get(env_name)
+    if path:
+        return path
+    for build in ('build', 'build-release'):
+        candidate = os.path.join(TOP, build, name)
+        if os.path.exists(candidate):
+            return candidate
+    return os.path.join(TOP, 'build', name)
+
+
+VELMOR_BIN = _binary('VELMOR_BIN', 'velmor')
+VELMORCTL_BIN = _binary('VELMORCTL_BIN', 'velmorctl')
+
+# Keys of the listeners that get a free port; the upstream proxy's port is not
+# one of ours.
+_PORT_KEY = re.compile(r'^%([a-z.]+)\.sock\.port\s*:', re.IGNORECASE)
+_NOT_OURS = {'proxy.external'}
+
+
+def free_port():
+    """A TCP and UDP port on 127.0.0.1 that nobody uses right now."""
+    while True:
+        with socket.socket(socket.AF_INET, socket.SOCK_STREAM) as s:
+            s.bind(('127.0.0.1', 0))
+            port = s.getsockname()[1]
+        try:
+            with socket.socket(socket.AF_INET, socket.SOCK_DGRAM) as u:
+                u.bind(('127.0.0.1', port))
+        except OSError:
+            continue
+        return port
+
+
+def set_keys(path, values):
+    """Rewrites the master file at `path` with `values` (key -> text): a key
+    already in the file has its line and continuation lines replaced, a new
+    key is appended."""
+    with open(path, encoding='utf-8', errors='surrogateescape') as f:
+        lines = f.read().splitlines()
+    wanted = {k.lower(): (k, v) for k, v in values.items()}
+    out, skipping = [], False
+    for line in lines:
+        if line.startswith('%'):
+            key = line[1:].split(':', 1)[0].strip().lower()
+            skipping = key in wanted
+            if skipping:
+                k, v = wanted.pop(key)
+                out.append('%%%s: %s' % (k, v))
+                continue
+        elif skipping and line[:1] not in ('|', ''):
+            continue  # a continuation line of a replaced key
+        else:
+            skipping = False
+        out.append(line)
+    out.extend('%%%s: %s' % (k, v) for k, v in wanted.values())
+    with open(path, 'w', encoding='utf-8', errors='surrogateescape') as f:
+        f.write('\n'.join(out) + '\n')
+
+
+class Suite:
+    """One private installation and its daemon."""
+
+    def __init__(self, config=None, init_args=()):
+        self.root = tempfile.mkdtemp(prefix='velmor-e2e-')
+        self.proc = None
+        self._out = None
+        self.init_output = self._run([VELMOR_BIN, '--root', self.root, '--init'] + list(init_args))
+        self.ports = {}
+        master = self.path('config/master')
+        with open(master, encoding='utf-8', errors='surrogateescape') as f:
+            for line in f:
+                m = _PORT_KEY.match(line)
+                if m and m.group(1).lower() not in _NOT_OURS:
+                    self.ports[m.group(1).lower()] = free_port()
+        values = {'%s.sock.port' % name: str(port) for name, port in self.ports.items()}
+        values.update(config or {})
+        set_keys(master, values)
+
+    @staticmethod
+    def _run(args, timeout=30):
+        r = subprocess.run(args, stdin=subprocess.DEVNULL, stdout=subprocess.PIPE,
+                           stderr=subprocess.STDOUT, timeout=timeout, text=True)
+        if r.returncode != 0:
+            raise RuntimeError('%s failed (%d):\n%s' % (' '.join(args), r.returncode, r.stdout))
+        return r.stdout
+
+    # ---- paths and ports -------------------------------------------------
+    def path(self, relative):
+        return os.path.join(self.root, relative)
+
+    @property
+    def pid_file(self):
+        return self.path('run/velmor.pid')
+
+    def port(self, name):
+        """The port chosen for <name>.sock.port ('smtp', 'pop', 'proxy.http', ...)."""
+        return self.ports[name.lower()]
+
+    def log(self, name):
+        try:
+            with open(self.path('logs/' + name), encoding='utf-8', errors='replace') as f:
+                return f.read()
+        except FileNotFoundError:
+            return ''
+
+    def output(self):
+        """What the daemon printed on its console so far."""
+        try:
+            with open(self.path('daemon.out'), encoding='utf-8', errors='replace') as f:
+                return f.read()
+        except FileNotFoundError:
+            return ''
+
+    # ---- the daemon --------------------------------------------------------
+    def spawn(self, *extra):
+        """Starts the daemon without waiting for it."""
+        self._out = open(self.path('daemon.out'), 'ab')
+        self.proc = subprocess.Popen([VELMOR_BIN, '--root', self.root, '--bind', '127.0.0.1'] + list(extra),
+                                     stdin=subprocess.DEVNULL, stdout=self._out, stderr=subprocess.STDOUT,
+                                     cwd=self.root)
+        return self.proc
+
+    def start(self, timeout=20):
+        """Starts the daemon and waits until it is ready: the pid file is
+        written (after the listeners are open) and, when velmorctl is built,
+        the control channel answers "test"."""
+        self.spawn()
+        deadline = time.monotonic() + timeout
+        while time.monotonic() < deadline:
+            if self.proc.poll() is not None:
+                raise RuntimeError('velmor exited with %d:\n%s' % (self.proc.returncode, self.output()))
+            if os.path.exists(self.pid_file) and self._answers():
+                return self
+            time.sleep(0.05)
+        self.kill()
+        raise RuntimeError('velmor did not become ready:\n' + self.output())
+
+    def _answers(self):
+        if not os.path.exists(VELMORCTL_BIN):
+            return True
+        rc, out = self.ctl('test', timeout=5)
+        return rc == 0 and out.startswith('test:')
+
+    def ctl(self, command, timeout=10):
+        """Runs velmorctl --root R COMMAND -> (returncode, stdout)."""
+        r = subprocess.run([VELMORCTL_BIN, '--root', self.root, command], stdin=subprocess.DEVNULL,
+                           stdout=subprocess.PIPE, stderr=subprocess.STDOUT, timeout=timeout, text=True)
+        return r.returncode, r.stdout
+
+    def signal(self, signum):
+        self.proc.send_signal(signum)
+
+    def wait(self, timeout=20):
+        """Waits for the daemon to end; returns its exit status (negative for a
+        signal). Kills it when it does not end in time."""
+        try:
+            return self.proc.wait(timeout=timeout)
+        except subprocess.TimeoutExpired:
+            self.kill()
+            raise
+
+    def stop(self, timeout=20):
+        """SIGTERM, wait, return the exit status."""
+        if self.proc is None:
+            return None
+        if self.proc.poll() is None:
+            self.proc.send_signal(signal.SIGTERM)
+        try:
+            return self.wait(timeout)
+        finally:
+            self._close_out()
+
+    def kill(self):
+        if self.proc is not None and self.proc.poll() is None:
+            self.proc.kill()
+            try:
+                self.proc.wait(timeout=10)
+            except subprocess.TimeoutExpired:
+                pass
+        self._close_out()
+
+    def _close_out(self):
+        if self._out is not None:
+            self._out.close()
+            self._out = None
+
+    def cleanup(self):
+        """Ends the daemon if it still runs and removes the installation."""
+        self.kill()
+        if os.environ.get('VELMOR_KEEP_ROOT'):
+            print('kept', self.root)
+        else:
+            shutil.rmtree(self.root, ignore_errors=True)
+
+
+class SuiteTestCase(unittest.TestCase):
+    """self.suite is started in setUp with the class's `config` overrides and
+    always ended in tearDown."""
+
+    config = {}
+
+    def setUp(self):
+        self.suite = Suite(config=dict(self.config))
+        self.addCleanup(self.suite.cleanup)
+        self.suite.start()
+
+    def tearDown(self):
+        if self.suite.proc is not None and self.suite.proc.poll() is None:
+            self.suite.stop()
