@@ -79,6 +79,11 @@ int filecache_putc(CacheFile& file, char byte);
 // Writes the window back and fsyncs the file (append and update modes; in
 // write mode the temporary file). 0 or an errno value.
 int filecache_sync(CacheFile& file);
+// Update and append writers: where the next write lands (at most the
+// length), and cutting the file back (a delivery that failed half way).
+// 0 or an errno value.
+int filecache_seek(CacheFile& file, std::uint64_t offset);
+int filecache_truncate(CacheFile& file, std::uint64_t length);
 // Copies `count` bytes (or up to the end) of `source` from `offset` to the end
 // of `destination`. 0 = done, non-zero = failed.
 int filecache_copy(CacheFile& source, std::uint64_t offset, CacheFile& destination, std::uint64_t count);
@@ -90,10 +95,17 @@ int filecache_copy(CacheFile& source, std::uint64_t offset, CacheFile& destinati
 int filecache_close(CacheFile& file);
 // Close and drop the entry from memory when nobody else has it open.
 int filecache_purge(CacheFile& file);
-// Close and delete the file (at the last close when others still hold it).
+// Close and delete the file (a rewrite's new file too); other holders keep
+// reading what they have open.
 int filecache_destroy(CacheFile& file);
-// Deletes a file through the cache (deferred while the file is open).
+// Closes a writer without writing back what it still buffers: a rewrite
+// leaves the old file untouched, a temporary file goes. The entry is dropped.
+int filecache_abandon(CacheFile& file);
+// Deletes a file through the cache. Handles still open on it keep reading
+// what they have; the next open finds the file gone. 0 or an errno value.
 int filecache_delete(const std::string& path);
+// True while a writer has `path` open (a queue file still being received).
+bool filecache_writing(const std::string& path);
 
 bool filecache_at_end(CacheFile& file, std::uint64_t offset);
 std::uint64_t filecache_length(const CacheFile& file);
