@@ -142,6 +142,7 @@ class Suite:
     # ---- the daemon --------------------------------------------------------
     def spawn(self, *extra):
         """Starts the daemon without waiting for it."""
+        self._close_out()
         self._out = open(self.path('daemon.out'), 'ab')
         self.proc = subprocess.Popen([VELMOR_BIN, '--root', self.root, '--bind', '127.0.0.1'] + list(extra),
                                      stdin=subprocess.DEVNULL, stdout=self._out, stderr=subprocess.STDOUT,
@@ -182,10 +183,12 @@ class Suite:
         """Waits for the daemon to end; returns its exit status (negative for a
         signal). Kills it when it does not end in time."""
         try:
-            return self.proc.wait(timeout=timeout)
+            status = self.proc.wait(timeout=timeout)
         except subprocess.TimeoutExpired:
             self.kill()
             raise
+        self._close_out()
+        return status
 
     def stop(self, timeout=20):
         """SIGTERM, wait, return the exit status."""
@@ -193,10 +196,7 @@ class Suite:
             return None
         if self.proc.poll() is None:
             self.proc.send_signal(signal.SIGTERM)
-        try:
-            return self.wait(timeout)
-        finally:
-            self._close_out()
+        return self.wait(timeout)
 
     def kill(self):
         if self.proc is not None and self.proc.poll() is None:
