@@ -7,9 +7,7 @@
 #include "core/config.h"
 
 #include <arpa/inet.h>
-#include <fcntl.h>
 #include <strings.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -18,6 +16,7 @@
 #include <fstream>
 #include <unordered_map>
 
+#include "core/filecache.h"
 #include "core/globals.h"
 #include "core/strfmt.h"
 
@@ -146,31 +145,6 @@ std::string dotted_address(std::uint32_t address_nbo) {
 
 std::string integer_text(const ConfigKeyInfo& k) {
   return strprintf("%d", *static_cast<std::int32_t*>(k.value) / k.multiplier);
-}
-
-// Writes the new master beside the old one, syncs it, keeps the old file as
-// "<path>~" and renames the new one into place: a crash leaves the old file or
-// the new one, never half of one. 0 or an errno value.
-int replace_file(const std::string& path, std::string_view data) {
-  std::string fresh = path + ".new";
-  int fd = ::open(fresh.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0640);
-  if (fd < 0) return errno;
-  int error = 0;
-  while (!data.empty() && !error) {
-    ssize_t n = ::write(fd, data.data(), data.size());
-    if (n < 0 && errno != EINTR) error = errno;
-    if (n > 0) data.remove_prefix(static_cast<std::size_t>(n));
-  }
-  if (!error && ::fsync(fd) != 0) error = errno;
-  if (::close(fd) != 0 && !error) error = errno;
-  if (!error) {
-    std::string backup = path + "~";
-    ::unlink(backup.c_str());
-    if (::link(path.c_str(), backup.c_str()) != 0 && errno != ENOENT) error = errno;
-  }
-  if (!error && ::rename(fresh.c_str(), path.c_str()) != 0) error = errno;
-  if (error) ::unlink(fresh.c_str());
-  return error;
 }
 
 // Applies one key of the master file; unknown keys are ignored.
@@ -360,7 +334,7 @@ int config_save_files(const std::string& template_path, const std::string& maste
     out += '\n';
   }
   if (in.bad()) return EIO;
-  return replace_file(master_path, out);
+  return file_write_atomic(master_path, out, /*backup=*/true, 0640);
 }
 
 }  // namespace velmor
