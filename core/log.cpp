@@ -21,6 +21,7 @@
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/strfmt.h"
+#include "core/textfile.h"
 
 namespace velmor {
 
@@ -168,23 +169,15 @@ void parse_route(std::string_view line) {
 int log_init() {
   log_reset();
   std::string path = text_of(config.file_log_master);
-  CacheFile file = filecache_open(path, FileMode::read);
-  if (!file) {
+  std::optional<std::string> text = read_text_file(path);
+  if (!text) {
     std::printf("couldn't open log config file:'%s'\n", path.c_str());
     std::fflush(stdout);
     return 1;
   }
-  std::string text;
-  for (std::string_view part; !(part = filecache_view(file, text.size())).empty();) text += part;
-  filecache_purge(file);
-
-  std::string_view rest = text;
-  while (!rest.empty()) {
-    std::size_t end = rest.find_first_of("\r\n");
-    std::string_view line = rest.substr(0, end);
-    rest = end == std::string_view::npos ? std::string_view{} : rest.substr(end + 1);
+  for_each_line(*text, [](std::string_view line) {
     if (!line.empty() && line[0] >= '0' && line[0] <= '9') parse_route(line);
-  }
+  });
   if (LogFile* f = route_for(logchan::errors)) error_path = f->path;
   return 0;
 }

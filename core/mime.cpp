@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "core/config.h"
-#include "core/filecache.h"
+#include "core/textfile.h"
 
 namespace velmor {
 
@@ -108,19 +108,12 @@ const MimeMapEntry* by_filetype(int filetype) {
 
 int mime_map_load() {
   mime_map_clear();  // a reload replaces the map
-  CacheFile file = filecache_open(text_of(config.file_mimetypes), FileMode::read);
-  if (!file) return 1;
-  std::string text;
-  for (std::string_view part; !(part = filecache_view(file, text.size())).empty();) text += part;
-  filecache_purge(file);
-  std::string_view rest = text;
-  while (!rest.empty()) {
-    std::size_t end = rest.find_first_of("\r\n");
-    std::string_view line = rest.substr(0, end);
-    rest = end == std::string_view::npos ? std::string_view{} : rest.substr(end + 1);
+  std::optional<std::string> text = read_text_file(text_of(config.file_mimetypes));
+  if (!text) return 1;
+  for_each_line(*text, [](std::string_view line) {
     char c = line.empty() ? 0 : line[0];
     if ((c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z')) parse_line(line);
-  }
+  });
   return 0;
 }
 
