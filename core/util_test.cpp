@@ -1,0 +1,289 @@
+#include "core/util.h"
+
+#include <ftw.h>
+#include <unistd.h>
+
+#include <cstdlib>
+
+#include <gtest/gtest.h>
+
+#include "core/config.h"
+#include "core/filecache.h"
+#include "core/globals.h"
+
+namespace velmor {
+namespace {
+
+std::tm fields(int year, int month, int day, int hour, int minute, int second) {
+  std::tm tm{};
+  tm.tm_year = year - 1900;
+  tm.tm_mon = month - 1;
+  tm.tm_mday = day;
+  tm.tm_hour = hour;
+  tm.tm_min = minute;
+  tm.tm_sec = second;
+  tm.tm_isdst = -1;
+  return tm;
+}
+std::time_t local(int year, int month, int day, int hour, int minute, int second = 0) {
+  std::tm tm = fields(year, month, day, hour, minute, second);
+  return std::mktime(&tm);
+}
+std::time_t utc(int year, int month, int day, int hour, int minute, int second = 0) {
+  std::tm tm = fields(year, month, day, hour, minute, second);
+  return timegm(&tm);
+}
+
+TEST(Compare, IgnoresCaseInTheCLocale) {
+  EXPECT_EQ(str_casecmp("Hello", "hELLO"), 0);
+  EXPECT_EQ(str_casecmp("abc", "ABD"), -1);
+  EXPECT_EQ(str_casecmp("abd", "ABC"), 1);
+  EXPECT_EQ(str_casecmp("ab", "abc"), -1);
+  EXPECT_EQ(str_ncasecmp("abcdef", "ABCxyz", 3), 0);
+  EXPECT_NE(str_ncasecmp("ab", "abc", 3), 0);
+  EXPECT_TRUE(str_istarts_with("Content-Type: x", "content-type:"));
+  EXPECT_FALSE(str_istarts_with("Con", "content"));
+  EXPECT_EQ(str_casestr("aab", "ab"), 1u);
+  EXPECT_EQ(str_casestr("xxBANNED phrase", "banned"), 2u);
+  EXPECT_EQ(str_casestr("short", "longer needle"), std::nullopt);
+  EXPECT_EQ(str_lower("MiXeD-1"), "mixed-1");
+  std::uint32_t word = 0x10;
+  bits_set(word, 0x3, true);
+  bits_set(word, 0x10, false);
+  EXPECT_EQ(word, 0x3u);
+}
+
+TEST(Wildcard, PatternListsAndAwkwardSubjects) {
+  EXPECT_TRUE(wildcard_match("news.example", "*.example"));
+  EXPECT_TRUE(wildcard_match("mail.example", "%.example"));
+  EXPECT_FALSE(wildcard_match("a.b.example", "%.example"));
+  EXPECT_TRUE(wildcard_match("abc", "a#c"));
+  EXPECT_FALSE(wildcard_match("ac", "a#c"));
+  EXPECT_TRUE(wildcard_match("ABC", "abc, xyz"));
+  EXPECT_TRUE(wildcard_match("xyz", " ,abc,,\t xyz  "));
+  EXPECT_FALSE(wildcard_match("abcd", "abc, xyz"));  // the whole subject must match
+  EXPECT_TRUE(wildcard_match("anything at all", "*"));
+  EXPECT_FALSE(wildcard_match("x", ""));
+  EXPECT_FALSE(wildcard_match("", "a"));
+  EXPECT_TRUE(wildcard_match("", "*"));
+  // "*" finds the occurrence that lets the rest match, not just the first.
+  EXPECT_TRUE(wildcard_match("www.mail.example.com", "*.example.com"));
+  EXPECT_TRUE(wildcard_match("banana", "*a"));
+  EXPECT_TRUE(wildcard_match("comp.lang.c", "comp.*"));
+  EXPECT_TRUE(wildcard_match("comp.lang.c", "comp.%.c"));
+  EXPECT_FALSE(wildcard_match("comp.lang.cxx.misc", "comp.%.c"));
+  EXPECT_TRUE(wildcard_match("alt.binaries.x", "alt.%"));  // "%" at the end takes the rest
+  EXPECT_TRUE(wildcard_match("a.b", "#*#"));
+  // A long subject against several stars stays quick.
+  EXPECT_FALSE(wildcard_match(std::string(5000, 'a'), "*a*a*a*a*a*a*b"));
+}
+
+TEST(AccessTimes, WeekdaysAndWindows) {
+  const std::time_t wednesday_0900 = local(2026, 12, 2, 9, 0);
+  const std::time_t wednesday_1730 = local(2026, 12, 2, 17, 30);
+  const std::time_t wednesday_1731 = local(2026, 12, 2, 17, 31);
+  const std::time_t saturday_1000 = local(2026, 12, 5, 10, 0);
+  EXPECT_FALSE(access_granted("no", wednesday_0900));
+  EXPECT_TRUE(access_granted("", wednesday_0900));
+  EXPECT_TRUE(access_granted("Yes", wednesday_0900));
+  EXPECT_TRUE(access_granted("1-5/09:00-17:30", wednesday_0900));
+  EXPECT_TRUE(access_granted("1-5/09:00-17:30", wednesday_1730));
+  EXPECT_FALSE(access_granted("1-5/09:00-17:30", wednesday_1731));
+  EXPECT_FALSE(access_granted("1-5/09:00-17:30", saturday_1000));
+  EXPECT_TRUE(access_granted("1-5/09:00-17:30, 6/09.30~12.00", saturday_1000));
+  EXPECT_FALSE(access_granted("3", wednesday_0900));  // an item without "/" grants nothing
+  EXPECT_FALSE(access_granted("3/09", wednesday_0900));
+  server_now = saturday_1000;
+  EXPECT_TRUE(access_granted("6/10:00-10:00"));
+
+  std::tm tm{};
+  auto at = [&](int h, int m) -> const std::tm& {
+    tm.tm_hour = h;
+    tm.tm_min = m;
+    return tm;
+  };
+  EXPECT_TRUE(time_in_window(at(23, 15), time_of_day(22, 0), time_of_day(6, 0)));
+  EXPECT_TRUE(time_in_window(at(5, 59), time_of_day(22, 0), time_of_day(6, 0)));
+  EXPECT_FALSE(time_in_window(at(12, 0), time_of_day(22, 0), time_of_day(6, 0)));
+  EXPECT_TRUE(time_in_window(at(12, 0), time_of_day(8, 0), time_of_day(8, 0)));
+  EXPECT_TRUE(time_in_window(at(18, 0), time_of_day(9, 0), time_of_day(18, 0)));
+  EXPECT_FALSE(time_in_window(at(18, 1), time_of_day(9, 0), time_of_day(18, 0)));
+}
+
+TEST(Formatting, SizesTimesAndErrors) {
+  EXPECT_EQ(size_text(10240), "  10K");
+  EXPECT_EQ(size_text(9999), "9999 ");
+  EXPECT_EQ(size_text(0), "   0 ");
+  EXPECT_EQ(size_text(10 * 1024 * 1024), "  10M");
+  EXPECT_EQ(size_text(20000ull * 1024 * 1024), "20000M");
+  EXPECT_EQ(number_text(4294967296ull), "4294967296");
+  const std::time_t t = local(2026, 12, 4, 19, 20, 5);
+  EXPECT_EQ(time_text(t), "19:20:05, 04 Dec");
+  EXPECT_EQ(date_text(t), "Fri, 04 Dec 2026 19:20:05");
+  EXPECT_EQ(date_text(t, "  %Y-%m-%d"), "2026-12-04");
+  EXPECT_EQ(error_text(20), "Not a director");
+  EXPECT_EQ(error_text(28), "No space left on device");
+  EXPECT_EQ(error_text(35), "Deadlock condition.");
+  EXPECT_EQ(error_text(999), "999");
+}
+
+TEST(ParseDate, MailNewsAndWebForms) {
+  // Mail headers, with zones.
+  EXPECT_EQ(parse_date("Thu, 04 Dec 2026 19:20:00 +0100"), utc(2026, 12, 4, 18, 20));
+  EXPECT_EQ(parse_date("Tue, 1 Jul 2003 10:52:37 +0200 (CEST)"), utc(2003, 7, 1, 8, 52, 37));
+  EXPECT_EQ(parse_date("4 Dec 2026 19:20 -0500"), utc(2026, 12, 5, 0, 20));
+  EXPECT_EQ(parse_date("  Fri, 04 Dec 26 19:20:00 EST"), utc(2026, 12, 5, 0, 20));
+  // HTTP: RFC 1123, RFC 850 and asctime.
+  EXPECT_EQ(parse_date("Sun, 06 Nov 1994 08:49:37 GMT"), 784111777);
+  EXPECT_EQ(parse_date("Sunday, 06-Nov-94 08:49:37 GMT"), 784111777);
+  EXPECT_EQ(parse_date("Sun Nov  6 08:49:37 1994"), local(1994, 11, 6, 8, 49, 37));
+  // Mailbox separator lines are local time.
+  EXPECT_EQ(parse_date("Thu Dec 04 19:20:00 2026"), local(2026, 12, 4, 19, 20));
+  EXPECT_EQ(parse_date("Dec 04 19:20:00 2026"), local(2026, 12, 4, 19, 20));
+  EXPECT_EQ(parse_date("04-Dec-2026 19:20:00"), local(2026, 12, 4, 19, 20));
+  // Two-digit years around the century.
+  EXPECT_EQ(parse_date("06 Nov 49 08:49:37 GMT"), utc(2049, 11, 6, 8, 49, 37));
+  EXPECT_EQ(parse_date("06 Nov 50 08:49:37 GMT"), utc(1950, 11, 6, 8, 49, 37));
+  EXPECT_EQ(parse_date("06 Nov 00 08:49:37 GMT"), utc(2000, 11, 6, 8, 49, 37));
+  // Not dates.
+  for (const char* bad : {"", "   ", "garbage", "here on", "Thu Foo 04 19:20:00 2026", "04 Dec 2026 1920",
+                          "32 Dec 2026 10:00:00", "04 Dec 2026 25:00:00", "Dec", "04 Dec", "Thu, 04 Dec 2026"}) {
+    EXPECT_EQ(parse_date(bad), kBadDate) << bad;
+  }
+}
+
+TEST(Urls, SplittingAwkwardUrls) {
+  const std::string u = "http://user:pw@Host.Example:8080/a/b?c=d";
+  EXPECT_EQ(url_scheme(u), "http");
+  EXPECT_EQ(url_scheme_code(u), 1);
+  EXPECT_EQ(url_host(u), "Host.Example");
+  EXPECT_EQ(url_port(u), 8080);
+  EXPECT_EQ(url_path(u), "/a/b?c=d");
+  EXPECT_EQ(url_user(u), "user");
+  EXPECT_EQ(url_password(u), "pw");
+
+  EXPECT_EQ(url_scheme_code("FTP://ftp.x.org"), 2);
+  EXPECT_EQ(url_scheme_code("gopher://g"), 3);
+  EXPECT_EQ(url_scheme_code("telnet://t"), 4);
+  EXPECT_EQ(url_scheme_code("wais://w"), 4);
+  EXPECT_EQ(url_scheme_code("https://s"), 0);
+  EXPECT_EQ(url_scheme("mailto:x@y"), std::nullopt);
+  EXPECT_EQ(url_scheme("abcdefghijklmnopqrs://x"), std::nullopt);  // 19 characters
+  EXPECT_EQ(url_path("ftp://ftp.x.org"), "/");
+  EXPECT_EQ(url_port("ftp://ftp.x.org"), 0);
+  EXPECT_EQ(url_user("ftp://ftp.x.org/"), std::nullopt);
+  EXPECT_EQ(url_password("ftp://anonymous@ftp.x.org/"), std::nullopt);
+  EXPECT_EQ(url_user("ftp://anonymous@ftp.x.org/"), "anonymous");
+
+  // Ports outside 1-65535 or with trailing junk are no ports.
+  EXPECT_EQ(url_port("http://h:0/"), 0);
+  EXPECT_EQ(url_port("http://h:65535/"), 65535);
+  EXPECT_EQ(url_port("http://h:65536/"), 0);
+  EXPECT_EQ(url_port("http://h:99999999999999/"), 0);
+  EXPECT_EQ(url_port("http://h:80x/"), 0);
+  EXPECT_EQ(url_port("http://h:/"), 0);
+
+  // An "@" in the path is not a user; a query right after the host is a path.
+  EXPECT_EQ(url_host("http://h/a@b"), "h");
+  EXPECT_EQ(url_user("http://h/a@b"), std::nullopt);
+  EXPECT_EQ(url_host("http://h?q=1"), "h");
+  EXPECT_EQ(url_path("http://h?q=1"), "/?q=1");
+  EXPECT_EQ(url_path("http://h/p HTTP/1.0\r\n"), "/p");
+  EXPECT_EQ(url_path("/local/page.html"), "/local/page.html");
+  EXPECT_EQ(url_host("/local/page.html"), std::nullopt);
+  EXPECT_EQ(url_host("www.example.com:443"), "www.example.com");  // a tunnel's target
+  EXPECT_EQ(url_port("www.example.com:443"), 443);
+  EXPECT_EQ(url_host("http://[::1]:8080/x"), "::1");
+  EXPECT_EQ(url_port("http://[::1]:8080/x"), 8080);
+  EXPECT_EQ(url_host("http://" + std::string(129, 'h') + "/"), std::nullopt);
+  EXPECT_EQ(url_host("http:///path"), std::nullopt);
+  EXPECT_EQ(url_password("ftp://u:" + std::string(65, 'p') + "@h/"), std::nullopt);
+
+  EXPECT_EQ(header_value("Subject:   hello world\r\n"), "hello world");
+  EXPECT_EQ(header_value("no colon"), "");
+  EXPECT_EQ(line_cut("one\r\ntwo"), "one");
+  EXPECT_EQ(trim_blanks(" \t x y \r\n"), "x y");
+}
+
+TEST(Escaping, DecodeEscapeAndHtml) {
+  auto decode = [](std::string s, int expect) {
+    EXPECT_EQ(url_decode(s), expect) << s;
+    return s;
+  };
+  EXPECT_EQ(decode("a%2Bb+c", 0), "a+b c");
+  EXPECT_EQ(decode("100%", 1), "100%");
+  EXPECT_EQ(decode("%4", 1), "%4");
+  EXPECT_EQ(decode("%zz%41", 1), "%zzA");
+  EXPECT_EQ(decode("a+", 0), "a ");  // short texts decode too
+  EXPECT_EQ(decode("+", 0), " ");
+  EXPECT_EQ(decode("x%00y", 2), std::string("x\0y", 3));
+
+  EXPECT_EQ(url_escape("a b/c?"), "a+b/c%3f");
+  EXPECT_EQ(url_escape("\xe9"), "%e9");
+  std::string round = "Caf\xe9 & co/?=+%";
+  std::string escaped = url_escape(round);
+  EXPECT_EQ(url_decode(escaped), 0);
+  EXPECT_EQ(escaped, round);
+
+  EXPECT_EQ(html_escape("<a href=\"x\">Tom & Jerry</a>"), "&lt;a href=&quot;x&quot;&gt;Tom &amp; Jerry&lt;/a&gt;");
+  EXPECT_EQ(html_escape("a b", true), "a&#32;b");
+  EXPECT_EQ(html_escape("a b"), "a b");
+}
+
+TEST(FormFields, QueryStrings) {
+  const char* q = "/cgi?a=1&Name=J%20D+x&empty=&flag&b=2";
+  EXPECT_EQ(form_value(q, "name"), "J D x");
+  EXPECT_EQ(form_value(q, "empty"), "");
+  EXPECT_EQ(form_value(q, "flag"), std::nullopt);
+  EXPECT_EQ(form_value(q, "missing"), std::nullopt);
+  EXPECT_EQ(form_value(q, "b"), "2");
+  EXPECT_EQ(form_value("x=1&y=2", "y"), "2");  // no "?": the whole text
+  EXPECT_EQ(form_value("ya=1&a=2", "a"), "2");  // a field name, not a tail of one
+  EXPECT_EQ(form_value("v=" + std::string(600, 'z'), "v")->size(), 510u);
+  EXPECT_EQ(form_text("a%20b+c&rest"), "a b c");
+  EXPECT_EQ(form_text(std::string(300, 'q')).size(), 254u);
+}
+
+TEST(FormFields, PostedBodiesInFiles) {
+  char tmpl[] = "/tmp/velmor-form-XXXXXX";
+  ASSERT_NE(::mkdtemp(tmpl), nullptr);
+  paths.tmp_dir = tmpl;
+  config.cache_big = 4 * 1024;  // small windows, so values cross them
+  ASSERT_EQ(filecache_init(), 0);
+
+  std::string long_value, long_escaped;
+  for (int i = 0; i < 20000; ++i) {
+    char c = static_cast<char>("a &%\r\n"[i % 6]);
+    long_value += c;
+    long_escaped += url_escape(std::string(1, c));
+  }
+  CacheFile body = filecache_open("", FileMode::temporary);
+  ASSERT_TRUE(body);
+  ASSERT_EQ(filecache_puts(body, "to=a%40b&subject=Hi+there&bad=%zz&text=" + long_escaped + "&end=1"), 0);
+  EXPECT_EQ(form_file_offset(body, "to"), 3);
+  EXPECT_EQ(form_file_offset(body, "TEXT"), 39);
+  EXPECT_EQ(form_file_offset(body, "o"), -1);
+  EXPECT_EQ(form_file_value(body, "subject"), "Hi there");
+  EXPECT_EQ(form_file_value(body, "bad"), std::nullopt);
+  EXPECT_EQ(form_file_value(body, "end"), "1");
+  EXPECT_EQ(form_file_value(body, "nothing"), std::nullopt);
+
+  CacheFile copy = filecache_open("", FileMode::temporary);
+  ASSERT_EQ(form_file_copy(body, "text", copy), 0);
+  std::string got(filecache_length(copy), '\0');
+  filecache_read(copy, got.data(), 0, got.size());
+  EXPECT_EQ(got, long_value);
+  EXPECT_EQ(form_file_copy(body, "nothing", copy), 1);
+
+  CacheFile page = filecache_open("", FileMode::temporary);
+  ASSERT_EQ(html_escape_to(page, "<b>\"&\"</b>"), 0);
+  EXPECT_EQ(filecache_view(page, 0), "&lt;b&gt;&quot;&amp;&quot;&lt;/b&gt;");
+  filecache_close(body);
+  filecache_close(copy);
+  filecache_close(page);
+  config.cache_big = 0;
+  ::nftw(tmpl, [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 8, FTW_DEPTH | FTW_PHYS);
+}
+
+}  // namespace
+}  // namespace velmor
