@@ -34,11 +34,6 @@
 
 namespace velmor {
 
-// The logger writes its files through this cache; until it is linked in
-// beside it, the cache's own log lines are dropped.
-[[gnu::weak]] void log_message(std::string_view text, std::string_view value, std::uint32_t facility);
-[[gnu::weak]] int log_write(std::string_view text, int channel, int flags);
-
 namespace {
 
 constexpr std::uint64_t kMinBuffer = 1024;
@@ -198,7 +193,7 @@ void debug(const std::string& text) {
   static bool busy = false;
   if (busy) return;
   busy = true;
-  if (log_message) log_message(text, {}, logfac::fcache);
+  log_message(text, {}, logfac::fcache);
   busy = false;
 }
 
@@ -786,10 +781,9 @@ void filecache_shutdown() {
   Cache& c = cache();
   while (free_oldest_unused()) {
   }
-  if (log_write)
-    log_write(strprintf("File cache: %llu hits, %llu misses, %llu disk reads, %llu bytes held",
-                      static_cast<unsigned long long>(c.hits), static_cast<unsigned long long>(c.misses),
-                      static_cast<unsigned long long>(c.disk_reads), static_cast<unsigned long long>(g_memory)),
+  using ull = unsigned long long;
+  log_write(strprintf("File cache: %llu hits, %llu misses, %llu disk reads, %llu bytes held", ull{c.hits},
+                      ull{c.misses}, ull{c.disk_reads}, ull{g_memory}),
             logchan::fcache_stats);
 }
 
