@@ -371,7 +371,9 @@ bool is_writer(const CacheFile& file) {
 
 std::string hidden_name(const std::string& path) {
   std::string_view dir = path_dir(path);
-  std::string leaf = "." + std::string(path_leaf(path)) + ".new";
+  std::string leaf = ".";
+  leaf += path_leaf(path);
+  leaf += ".new";
   return dir.empty() ? leaf : path_join(dir, leaf);
 }
 
