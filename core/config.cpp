@@ -7,7 +7,6 @@
 #include "core/config.h"
 
 #include <arpa/inet.h>
-#include <strings.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -19,6 +18,7 @@
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/strfmt.h"
+#include "core/util.h"
 
 namespace velmor {
 
@@ -30,17 +30,6 @@ std::string_view skip_blanks(std::string_view s) {
   std::size_t i = 0;
   while (i < s.size() && is_blank(s[i])) ++i;
   return s.substr(i);
-}
-
-std::string lowered(std::string_view s) {
-  std::string out(s);
-  for (char& c : out)
-    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
-  return out;
-}
-
-bool iequals(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
 }
 
 // atoi without its undefined behaviour on overflow: leading white space, a
@@ -63,17 +52,18 @@ std::int64_t leading_number(std::string_view s) {
 const ConfigKeyInfo* find_key(std::string_view key) {
   static const std::unordered_map<std::string, const ConfigKeyInfo*> index = [] {
     std::unordered_map<std::string, const ConfigKeyInfo*> m;
-    for (const auto& k : config_keys()) m.emplace(lowered(k.name), &k);
+    for (const auto& k : config_keys()) m.emplace(str_lower(k.name), &k);
     return m;
   }();
-  auto it = index.find(lowered(key));
+  auto it = index.find(str_lower(key));
   return it == index.end() ? nullptr : it->second;
 }
 
 bool parse_boolean(std::string_view value) {
   // Trailing blanks are not part of the word ("no " is still no).
   while (!value.empty() && is_blank(value.back())) value.remove_suffix(1);
-  return !(iequals(value, "0") || iequals(value, "no") || iequals(value, "false") || iequals(value, "off"));
+  return !(str_iequals(value, "0") || str_iequals(value, "no") || str_iequals(value, "false") ||
+           str_iequals(value, "off"));
 }
 
 std::int32_t parse_time_of_day(std::string_view value) {
@@ -110,8 +100,8 @@ std::optional<AddressEntry> parse_address_item(std::string_view item) {
          item[word_end] != '\r' && item[word_end] != '\n')
     ++word_end;
   std::string_view word = item.substr(0, word_end);
-  if (iequals(word, "all") || word == "*") return AddressEntry{0, 0};
-  if (iequals(word, "none")) return AddressEntry{0, 0xffffffffu};
+  if (str_iequals(word, "all") || word == "*") return AddressEntry{0, 0};
+  if (str_iequals(word, "none")) return AddressEntry{0, 0xffffffffu};
   auto address = parse_dotted(word);
   if (!address) return std::nullopt;
   AddressEntry entry{*address, 0xffffffffu};

@@ -5,7 +5,6 @@
 #include "core/log.h"
 
 #include <fcntl.h>
-#include <strings.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -22,6 +21,7 @@
 #include "core/globals.h"
 #include "core/strfmt.h"
 #include "core/textfile.h"
+#include "core/util.h"
 
 namespace velmor {
 
@@ -239,10 +239,8 @@ void log_header_summary(int number, std::string_view header_text) {
     rest = end == std::string_view::npos ? std::string_view{} : rest.substr(end + 1);
     if (!line.empty() && line.back() == '\r') line.remove_suffix(1);
     if (line.empty()) break;  // the end of the header block
-    auto starts = [&](std::string_view name) {
-      return line.size() >= name.size() && strncasecmp(line.data(), name.data(), name.size()) == 0;
-    };
-    if (starts("From:") || starts("To:") || starts("Message-ID:") || line.substr(0, 8) == "Subject:") {
+    if (str_istarts_with(line, "From:") || str_istarts_with(line, "To:") ||
+        str_istarts_with(line, "Message-ID:") || line.substr(0, 8) == "Subject:") {
       std::string out = strprintf("%d - ", number);
       out += line;
       if (out.size() > 254) out.resize(254);

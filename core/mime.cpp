@@ -3,13 +3,12 @@
 // walks from the head and the first match wins.
 #include "core/mime.h"
 
-#include <strings.h>
-
 #include <cstdlib>
 #include <vector>
 
 #include "core/config.h"
 #include "core/textfile.h"
+#include "core/util.h"
 
 namespace velmor {
 
@@ -64,10 +63,6 @@ std::string_view undotted(std::string_view ext) {
   return ext;
 }
 
-bool iequals(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
-}
-
 // Calls `match` on each blank-separated word of the entry's extension text.
 template <class Pred>
 bool any_extension(const MimeMapEntry& e, Pred match) {
@@ -95,7 +90,7 @@ const MimeMapEntry* by_name(std::string_view name) {
     return any_extension(e, [&](std::string_view ext) {
       std::string_view word = undotted(ext);
       if (name.size() <= word.size() || name[name.size() - word.size() - 1] != '.') return false;
-      return iequals(name.substr(name.size() - word.size()), word);
+      return str_iequals(name.substr(name.size() - word.size()), word);
     });
   });
 }
@@ -122,7 +117,7 @@ void mime_map_clear() { entries.clear(); }
 std::string mime_type_for_extension(std::string_view text) {
   std::string_view key = undotted(text);
   auto e = key.empty() ? nullptr : find([&](const MimeMapEntry& m) {
-    return any_extension(m, [&](std::string_view ext) { return iequals(undotted(ext), key); });
+    return any_extension(m, [&](std::string_view ext) { return str_iequals(undotted(ext), key); });
   });
   return std::string(e ? std::string_view(e->type) : kDefaultType);
 }
@@ -133,7 +128,7 @@ std::string mime_type_for_filetype(int filetype) {
 }
 
 int filetype_for_mime_type(std::string_view type) {
-  auto e = find([&](const MimeMapEntry& m) { return iequals(m.type, type); });
+  auto e = find([&](const MimeMapEntry& m) { return str_iequals(m.type, type); });
   return e ? e->filetype : kFiletypeData;
 }
 
