@@ -33,7 +33,7 @@ constexpr std::size_t kHeadroom = 128;
 
 struct LogFile {
   std::string path;
-  std::string buffer;        // pending text; capacity reserved on first use
+  std::string buffer;        // pending text, at most buffer_size bytes
   std::size_t buffer_size = 1024;
   std::time_t flush_interval = 0;  // seconds; 0 = no timed flush
   std::int64_t max_size = 0;       // bytes; 0 = no limit
@@ -142,7 +142,10 @@ void parse_route(std::string_view line) {
     if (i > start) fields.emplace_back(line.substr(start, i - start));
   }
   if (fields.size() < 2) return;
-  auto number = [&](std::size_t n) { return n < fields.size() ? std::atoll(fields[n].c_str()) : 0LL; };
+  // Numbers are kept within sensible bounds, so no setting can overflow.
+  auto number = [&](std::size_t n) {
+    return n < fields.size() ? std::clamp(std::strtoll(fields[n].c_str(), nullptr, 10), 0LL, 1LL << 30) : 0LL;
+  };
   const std::string& path = fields[1];
   LogFile* file = nullptr;
   for (auto& f : files)
@@ -153,8 +156,8 @@ void parse_route(std::string_view line) {
     f->path = path;
     long long size = number(2);
     f->buffer_size = size > 0 ? static_cast<std::size_t>(size) : 1024;
-    f->flush_interval = static_cast<std::time_t>(std::max(0LL, number(3))) * 60;
-    f->max_size = std::max(0LL, number(4)) * 1024;
+    f->flush_interval = static_cast<std::time_t>(number(3)) * 60;
+    f->max_size = number(4) * 1024;
     f->keep = static_cast<int>(std::clamp(number(5), 0LL, 1000LL));
     f->next_flush = server_now;
     make_parent_dirs(path);
@@ -198,7 +201,6 @@ int log_write(std::string_view text, int channel, int flags) {
     return 0;
   }
   if (text.data() == nullptr) return 0;
-  if (f->buffer.capacity() < f->buffer_size) f->buffer.reserve(f->buffer_size);
   const bool buffered = !(flags & kLogUnbuffered);
   if (!f->buffer.empty() && (!buffered || f->buffer.size() + text.size() + kHeadroom > f->buffer_size)) flush(*f);
 
