@@ -24,6 +24,7 @@
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/mime.h"
+#include "core/sockets.h"
 #include "core/strfmt.h"
 
 namespace velmor {
@@ -264,9 +265,7 @@ std::int64_t monotonic_ms() {
 // Waits for socket readiness, or for a signal, until the next tick.
 void wait_until(std::int64_t tick) {
   std::int64_t ms = std::max<std::int64_t>(0, tick - monotonic_ms());
-  // sockets: dispatcher(static_cast<int>(ms)) replaces this sleep.
-  timespec ts{static_cast<time_t>(ms / 1000), static_cast<long>(ms % 1000) * 1000000L};
-  nanosleep(&ts, nullptr);  // a signal ends it early
+  dispatcher(static_cast<int>(ms));  // a signal ends the wait early
 }
 
 // Every half second; each poll returns quickly.
@@ -276,7 +275,7 @@ void tick() {
   log_poll();
   // scheduler: schedule_poll();
   // child processes: process_poll();
-  // sockets: sockets_check_timeouts();
+  sockets_check_timeouts();
 }
 
 void poll() {
@@ -304,7 +303,8 @@ void shutdown_suite() {
   log_message("Shutting down");
   if (pid_file_written) ::unlink(paths.pid_file.c_str());
   // control channel: control_remove();
-  // sockets: log_message("Shutting down sockets"); sockets_close_all();
+  log_message("Shutting down sockets");
+  sockets_close_all();
   log_message("Shutting down filecache");
   filecache_shutdown();
   log_message("Shutting down logger");
@@ -370,7 +370,12 @@ int start_and_run() {
   // scheduler: "Loading scheduler task entries", schedule_load().
   // users: "Loading user database", "Loading user group options".
   // mail: "Initialising mail system", mail_init().
-  // sockets: "Starting listening sockets", sockets_init().
+  log_message("Starting listening sockets");
+  if (sockets_init() != 0) {
+    log_message("Socket initialisation failed - see logs for more info");
+    sockets_close_all();
+    return 1;
+  }
 
   log_message("Suite started: ", kVersion);
   progress_code = 0;

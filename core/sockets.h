@@ -16,6 +16,7 @@
 #include <string>
 #include <string_view>
 
+#include "core/config.h"
 #include "core/filecache.h"
 
 namespace velmor {
@@ -126,38 +127,68 @@ struct SocketRecord {
   template <class T>
   T& session_as() { return static_cast<T&>(*session); }
   bool closed = false;  // released; the record is freed after the dispatcher pass
+
+  // Kept by the dispatcher; services leave these alone.
+  struct Dispatch {
+    bool watched = false;          // registered with epoll
+    std::uint32_t events = 0;      // the readiness interest registered
+    std::uint32_t generation = 0;  // tells a reused descriptor from its predecessor
+    int counted_service = 0;       // the counter this record raised (0 = none)
+    bool peer_eof = false;         // the peer finished sending: no more reads
+    bool lookup_ended = false;     // record_lookup_complete() was called ...
+    bool lookup_ok = false;        // ... with this result
+    std::time_t accept_paused_until = 0;  // listeners: out of descriptors
+  } dispatch;
 };
 
 // What a service plugs in. Handlers return 0 to keep the connection and
 // non-zero to have it closed; they may also close it themselves.
 struct ServiceHandlers {
   // A new connection of this service was accepted (peer_addr is set).
-  std::function<int(SocketRecord&)> accept;
+  std::function<int(SocketRecord&)> accept{};
   // n > 0 bytes were just received into read_buf (already counted in its
   // size). Datagram records are called with n == 0 and receive themselves.
-  std::function<int(SocketRecord&, long n)> read;
-  // The socket is writable and the record has output pending or want_write.
-  std::function<int(SocketRecord&)> write;
+  std::function<int(SocketRecord&, long n)> read{};
+  // The socket was writable: the dispatcher has already sent what it took of
+  // write_buf. Called while output is pending or want_write is set, and once
+  // more when write_buf has just drained, so a service that paused for room
+  // (or streams a file) continues here.
+  std::function<int(SocketRecord&)> write{};
   // The peer closed (n == 0) or a receive failed (n == -1). Unset: close.
-  std::function<int(SocketRecord&, long n)> peer_closed;
-  std::function<void(SocketRecord&)> connect_failed;
-  std::function<void(SocketRecord&)> connect_done;  // state 10 -> 20
-  std::function<void(SocketRecord&)> lookup_failed;
-  std::function<void(SocketRecord&)> lookup_done;
+  std::function<int(SocketRecord&, long n)> peer_closed{};
+  std::function<void(SocketRecord&)> connect_failed{};
+  std::function<void(SocketRecord&)> connect_done{};  // state 10 -> 20
+  std::function<void(SocketRecord&)> lookup_failed{};
+  std::function<void(SocketRecord&)> lookup_done{};
   // The per-service release when the record closes (files, locks, counts).
-  std::function<void(SocketRecord&)> release;
+  std::function<void(SocketRecord&)> release{};
   // Seconds of inactivity after which the record is closed (0 = never).
-  std::function<int()> idle_timeout;
+  // Unset: the service's sock.timeout key (120 s for the HTTP proxy).
+  std::function<int()> idle_timeout{};
+  // The record was idle too long. Unset: socket_close.
+  std::function<void(SocketRecord&)> timed_out{};
+  // Simultaneous connections allowed. Unset: the service's sock.max key.
+  std::function<int()> max_connections{};
+  // Set by services that open their own sockets (several listeners, datagram
+  // sockets): listeners_open calls it in the service's place in the order
+  // instead of opening the standard listener. 0 = done.
+  std::function<int()> open_sockets{};
 };
 void register_service(int service, ServiceHandlers handlers);
 const ServiceHandlers* service_handlers(int service);
 
-// Set up the table and open every listener of a registered, enabled service,
-// then the control channel. 0 = done; non-zero = a listener failed.
+// Sets up the table, raises the descriptor limit, completes admin.email and
+// opens every listener of a registered, enabled service, then the control
+// channel. 0 = done; non-zero = a listener failed.
 int sockets_init();
 int listeners_open();
-// Opens one listener (protocol 6 TCP, 17 UDP). 0; 1 socket or bind failure.
+// Opens one listener (protocol 6 TCP, 17 UDP) on paths.bind_address (every
+// address when empty). A TCP port of 0 takes an ephemeral port; a UDP port of
+// 0 stays unbound. 0; 1 socket or bind failure; -1 option failure.
 int listener_open(int port, int service, int protocol, int* descriptor_out = nullptr);
+// Accepting on a service: the run-time switch tested at every accept (set
+// from the sock.enabled keys by sockets_init).
+void service_switch(int service, bool on);
 
 // One pass: wait up to `timeout_ms` for readiness and deliver every event.
 void dispatcher(int timeout_ms);
@@ -166,8 +197,13 @@ void dispatcher(int timeout_ms);
 void sockets_check_timeouts();
 
 SocketRecord* record_for(int fd);
-// Makes the record for a descriptor (with I/O buffers unless a datagram).
+// Makes the record for a descriptor (with I/O buffers unless a datagram or
+// listener) and watches the descriptor. Every record other than listeners and
+// datagram records counts as a connection of `service`. nullptr on failure.
 SocketRecord* record_create(int fd, int service, int state);
+// The resolver's end of a host lookup for a record in state 80: the
+// dispatcher calls the service's lookup_done or lookup_failed on its next pass.
+void record_lookup_complete(SocketRecord& record, bool ok);
 // Sends from the front of write_buf; the unsent rest stays at its front.
 // Returns bytes sent (0 when the socket is full) or -1 on a real error.
 long socket_send(SocketRecord& record);
@@ -186,9 +222,20 @@ int socket_datagram();
 // Every descriptor of the suite is non-blocking and close-on-exec.
 int socket_options(int fd);
 
-// Connection counters for the status displays and limits.
+// Connection counters for the status displays and limits: the records of
+// `service` open now (never below 0).
 int connection_count(int service);
 std::uint64_t accepted_total();
+std::uint64_t service_bytes_received(int service);
+// Number of records (of every kind) in the table.
+std::size_t record_count();
+
+// The common use of a service's peer address lists at accept: a peer in
+// `allow` is accepted with no further test; otherwise one in `block` is
+// refused; otherwise one in `auth` must identify itself.
+enum class PeerRule { allowed, blocked, must_auth, ordinary };
+PeerRule peer_rule(std::uint32_t peer_nbo, const AddressList& allow, const AddressList& block,
+                   const AddressList* auth = nullptr);
 
 // Strips telnet option negotiation from the front of read_buf, answering it
 // into write_buf. 1 when data remains.
