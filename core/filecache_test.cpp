@@ -124,11 +124,17 @@ TEST_F(FileCacheTest, ReadersShareOneEntryAndSeeChangesOnDisk) {
   EXPECT_EQ(walk(c), "version two\n");
   filecache_close(c);
 
-  // Replaced by another file (another inode) and by a longer text.
+  // Replaced by another file (another inode) while a reader holds the old
+  // one: the next open gets the new file, the holder keeps the old, and the
+  // old entry goes at its last close.
   put(at("g"), "three");
-  ASSERT_EQ(file_rename(at("g"), at("f")), 0);
+  CacheFile held = filecache_open(at("f"), FileMode::read);
+  ASSERT_EQ(::rename(at("g").c_str(), at("f").c_str()), 0);
   CacheFile d = filecache_open(at("f"), FileMode::read);
   EXPECT_EQ(walk(d), "three");
+  EXPECT_EQ(filecache_users(d), 1);
+  EXPECT_EQ(walk(held), "version two\n");
+  filecache_close(held);
   filecache_close(d);
   ASSERT_EQ(::unlink(at("f").c_str()), 0);
   EXPECT_FALSE(filecache_open(at("f"), FileMode::read));
