@@ -18,6 +18,7 @@
 #include <string>
 #include <string_view>
 
+#include "core/commands.h"
 #include "core/config.h"
 #include "core/defaults.h"
 #include "core/filecache.h"
@@ -270,7 +271,7 @@ void wait_until(std::int64_t tick) {
 
 // Every half second; each poll returns quickly.
 void tick() {
-  // transfer: if (mail_transfer_state) mail_transfer_poll();
+  if (mail_transfer_state) mail_transfer_poll();
   // mail: mail_poll();
   log_poll();
   // scheduler: schedule_poll();

@@ -1,0 +1,109 @@
+#include "core/commands.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "core/globals.h"
+#include "core/hooks.h"
+
+namespace velmor {
+namespace {
+
+class CommandsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    hooks = SuiteHooks{};
+    mail_transfer_state = 0;
+    link_up = 0;
+    server_now = 1000;
+    auto note = [this](const char* what) { return [this, what] { calls.push_back(what); }; };
+    hooks.dial = note("dial");
+    hooks.disconnect = note("disconnect");
+    hooks.popkick = note("popkick");
+    hooks.smtpkick = note("smtpkick");
+    hooks.newskick = note("newskick");
+    hooks.mailrescan = note("mailrescan");
+    hooks.maildebatch = note("maildebatch");
+    hooks.newsdebatch = note("newsdebatch");
+    hooks.pop_client_count = [this] { return pop_clients; };
+    hooks.smtp_client_count = [this] { return smtp_clients; };
+  }
+  void TearDown() override {
+    hooks = SuiteHooks{};
+    mail_transfer_state = 0;
+    link_up = 0;
+  }
+  std::vector<std::string> calls;
+  int pop_clients = 0;
+  int smtp_clients = 0;
+};
+
+TEST_F(CommandsTest, WordsReachTheirSubsystems) {
+  for (const char* word : {"POPKICK", "smtpkick", "NewsKick", "mailrescan", "maildebatch", "newsdebatch",
+                           "disconnect"})
+    EXPECT_EQ(internal_command(word), 1) << word;
+  EXPECT_EQ(calls, (std::vector<std::string>{"popkick", "smtpkick", "newskick", "mailrescan", "maildebatch",
+                                             "newsdebatch", "disconnect"}));
+  EXPECT_EQ(internal_command("smtp"), 0);
+  EXPECT_EQ(internal_command("connect now"), 0);
+
+  mail_transfer_state = 3;
+  calls.clear();
+  EXPECT_EQ(internal_command("Connect"), 1);
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, std::vector<std::string>{"dial"});
+  EXPECT_EQ(internal_command("mailtransfer"), 1);
+  EXPECT_EQ(mail_transfer_state, 4);
+
+  // A subsystem that is not running has no hook: the word is still known.
+  hooks = SuiteHooks{};
+  EXPECT_EQ(internal_command("newskick"), 1);
+}
+
+TEST_F(CommandsTest, TransferWithTheLinkUpStartsAtOnce) {
+  link_up = 1;
+  internal_command("mailtransfer");
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, (std::vector<std::string>{"popkick", "smtpkick"}));
+}
+
+TEST_F(CommandsTest, DialUpTransferRunsToTheEnd) {
+  internal_command("mailtransfer");
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 1);
+  mail_transfer_poll();  // dialling: the resolver proves the link
+  EXPECT_EQ(mail_transfer_state, 1);
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 2);
+  mail_transfer_poll();  // the clients have not connected yet
+  EXPECT_EQ(mail_transfer_state, 2);
+  smtp_clients = 1;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 3);
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 3);
+  smtp_clients = 0;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, (std::vector<std::string>{"dial", "popkick", "smtpkick", "disconnect"}));
+}
+
+TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  server_now += 59;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 2);
+  server_now += 1;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls.back(), "disconnect");
+}
+
+}  // namespace
+}  // namespace velmor
