@@ -27,6 +27,9 @@ struct OutgoingEntry {
   std::string recipients;  // joined by ", "
   std::time_t mtime = 0;
   std::int64_t size = 0;
+  // Descriptor of the connection sending this file (-1 none): a rescan never
+  // drops an entry that a live connection holds.
+  int holder = -1;
 };
 
 int mail_init();   // start-up: counters, alias and reject tables, queue scans
@@ -53,6 +56,9 @@ std::string mail_primary_domain();
 // Writes an error mail about `file` (may be empty) to `to` (or the file's
 // sender) into the incoming queue.
 void mail_send_error(std::string_view text, std::string_view to, const std::string& file);
+// The same for a message refused by size or content: only its header is
+// attached, so the report itself never breaks the limit it reports.
+void mail_send_refusal(std::string_view text, std::string_view to, const std::string& file);
 std::string mail_message_id(std::string_view header_name = "Message-ID:");
 // Moves a queue file aside to the oddments folder, logging the reason.
 void mail_move_to_oddments(const std::string& path, std::string_view reason);

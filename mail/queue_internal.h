@@ -1,0 +1,82 @@
+// Pieces shared by the queue, debatch and the SMTP server; not for other
+// subsystems.
+#pragma once
+
+#include <cstdint>
+#include <ctime>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "core/filecache.h"
+
+namespace velmor {
+
+// filecache_copy's count for "up to the end of the file".
+inline constexpr std::uint64_t kToEnd = ~std::uint64_t{0};
+
+// Reads one line (without its CR LF) starting at `offset` and moves `offset`
+// past its line end. Lines longer than `max` are cut (the rest is skipped).
+// False at the end of the file.
+bool queue_read_line(CacheFile& file, std::uint64_t& offset, std::string& line, std::size_t max = 4096);
+
+// The envelope of a queue file.
+struct QueueEnvelope {
+  std::string first_line;
+  std::string sender;   // empty for the null sender
+  bool has_sender_bracket = false;
+  bool fetched = false;  // a message fetched by the POP3 client ("POP...")
+  std::vector<std::string> recipients;
+  bool has_data = false;          // the envelope ends with a DATA line
+  std::uint64_t data_offset = 0;  // where the DATA line starts
+  std::uint64_t body_offset = 0;  // the byte after the DATA line
+};
+QueueEnvelope queue_read_envelope(CacheFile& file);
+
+// True when any needle occurs in the file (case-insensitive), searched block
+// by block as the cache loads it.
+bool file_contains(CacheFile& file, const std::vector<std::string>& needles);
+
+// How an error mail went.
+enum class ErrorMail {
+  sent,      // written safely into the incoming queue
+  skipped,   // nobody to send it to (the null sender, no address)
+  moved,     // the file was moved to oddments instead (loop, no queue file)
+  failed,    // the error mail could not be written
+};
+// With `headers_only`, only the header of the failed message is attached
+// (for refusals by size or content, which the whole message would repeat).
+ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file,
+                          bool headers_only = false);
+
+// Throws away an unfinished queue file (and the name reserved for it).
+void queue_file_discard(CacheFile& file);
+
+// Text made safe as message lines: CR LF line ends, dot-stuffed.
+std::string mail_body_lines(std::string_view text);
+
+// Start-up of the queue itself: name counters from `now`, unfinished
+// hidden files removed.
+void queue_init(std::time_t now);
+// Takes the head of the incoming list.
+std::optional<std::string> queue_pop_incoming();
+// The "listmq" listing, one datagram per call of `send`.
+void queue_list(const std::function<void(std::string_view)>& send);
+
+// Noted whenever an SMTP connection receives data (the quiet period before
+// debatching runs from the last traffic).
+void mail_note_traffic();
+
+// Debatches one incoming file (the whole processing of one message).
+void debatch_file(const std::string& path);
+// A file left queued after a temporary failure is tried again after this
+// many seconds.
+inline constexpr int kRetrySeconds = 60;
+void queue_retry_later();
+
+// The SMTP server (service 20).
+void smtp_server_register();
+
+}  // namespace velmor
