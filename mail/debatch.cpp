@@ -1,0 +1,491 @@
+// Debatching: one incoming file is checked against the sender's group
+// limits, every recipient is resolved through the alias table, local
+// recipients get the message in their mailbox and outside ones a file of the
+// outgoing queue. The incoming file is deleted only when every copy made of
+// it is safely on disk; otherwise it stays for a later try (nothing was
+// delivered yet) or goes to the oddments folder with its reason.
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <ctime>
+#include <memory>
+
+#include "core/config.h"
+#include "core/globals.h"
+#include "core/hooks.h"
+#include "core/log.h"
+#include "core/strfmt.h"
+#include "core/textfile.h"
+#include "core/util.h"
+#include "mail/alias.h"
+#include "mail/mailbox.h"
+#include "mail/queue.h"
+#include "mail/queue_internal.h"
+#include "mail/queue_text.h"
+#include "users/groups.h"
+#include "users/users.h"
+
+namespace velmor {
+
+namespace {
+
+std::time_t g_last_traffic = 0;
+std::time_t g_retry_at = 0;  // rescan for files left after a temporary failure
+bool g_debatch_pending = false;
+
+// A message that has passed this many relays is looping.
+constexpr int kMaxReceived = 30;
+
+class Debatch final : public AliasSink {
+ public:
+  Debatch(const std::string& path, CacheFile& file, const QueueEnvelope& env)
+      : path_(path), file_(file), env_(env) {}
+
+  const std::string& path_;
+  CacheFile& file_;
+  const QueueEnvelope& env_;
+  std::shared_ptr<const GroupOptions> sender_group;  // a local sender's group
+  bool sender_local = false;
+
+  int copies = 0;           // copies safely made (mailboxes, files, error mails)
+  std::string failure;      // the first reason the file cannot simply be deleted
+  bool only_temporary = true;
+  bool moved = false;       // an error mail moved the file to oddments
+  std::string trace;        // the mail-log record
+
+  void fail(std::string reason, bool temporary = false) {
+    if (failure.empty()) failure = std::move(reason);
+    if (!temporary) only_temporary = false;
+  }
+
+  // An error mail about this message; its outcome counts like any copy.
+  void error(std::string_view text, std::string_view to, bool headers_only = false) {
+    switch (send_error_mail(text, to, path_, headers_only)) {
+      case ErrorMail::sent: ++copies; break;
+      case ErrorMail::skipped: break;
+      case ErrorMail::moved: moved = true; break;
+      case ErrorMail::failed: fail("Error mail could not be written"); break;
+    }
+  }
+
+  std::string redirect_or_sender(std::string_view key) const {
+    if (sender_group && sender_group->has(key) && !sender_group->text(key).empty())
+      return sender_group->text(key);
+    return {};  // empty: send_error_mail uses the file's sender
+  }
+
+  // ---- AliasSink ----
+  std::string local_user(std::string_view address) override {
+    return mail_local_user(address).value_or(std::string());
+  }
+  bool user_exists(std::string_view user) override { return velmor::user_exists(user); }
+
+  bool deliver_local(std::string_view user, std::string_view to_address) override {
+    if (moved) return true;
+    int rc = mailbox_append(path_, to_address.empty() ? user : to_address, env_.sender);
+    // Delivery may have moved the file aside (a mailbox it cannot open).
+    if (file_size(path_) < 0) moved = true;
+    if (rc == 1) {
+      ++copies;
+      return true;
+    }
+    if (rc == kAppendTemporaryFailure) {
+      fail(strprintf("Temporary failure delivering to `%.*s'", static_cast<int>(user.size()), user.data()),
+           true);
+      return true;
+    }
+    return false;
+  }
+
+  void deliver_remote(std::string_view address) override {
+    if (moved) return;
+    std::string_view domain = address_domain(address);
+    if (!domain.empty() && config.smtp_direct && wildcard_match(domain, *config.smtp_direct)) {
+      send_direct(address);
+      return;
+    }
+    if (!outgoing_) {
+      std::string name = queue_new_outgoing_name();
+      if (!name.empty()) outgoing_ = filecache_open(name, FileMode::write);
+      if (!outgoing_) {
+        log_write("Mail add RCPT TO: Couldn't open outgoing mail file", logchan::errors);
+        fail("Outgoing mail file could not be created");
+        return;
+      }
+      write_out(outgoing_, "MAIL FROM:<" + outgoing_sender() + ">\r\n");
+    }
+    write_out(outgoing_, "RCPT TO:<" + std::string(address) + ">\r\n");
+  }
+
+  bool deliver_file(std::string_view target) override {
+    if (moved) return true;
+    CacheFile archive = filecache_open(std::string(target), FileMode::append);
+    int rc = archive ? filecache_copy(file_, env_.body_offset, archive, kToEnd) : 1;
+    if (rc == 0) rc = filecache_sync(archive);
+    int close_rc = archive ? filecache_close(archive) : 0;
+    if (rc != 0 || close_rc != 0) {
+      log_write(strprintf("Mail alias: can't append to %.*s", static_cast<int>(target.size()), target.data()),
+                logchan::errors);
+      fail("Archive file could not be written");
+      return false;
+    }
+    ++copies;
+    return true;
+  }
+
+  bool read_list(std::string_view target, std::vector<std::string>& lines) override {
+    std::string list_path(target);
+    if (!list_path.empty() && list_path.front() == '$') list_path.erase(0, 1);
+    std::optional<std::string> text = read_text_file(list_path);
+    if (!text) return false;
+    for_each_line(*text, [&](std::string_view line) { lines.emplace_back(line.substr(0, 128)); });
+    return true;
+  }
+
+  // Group mail ("+N") is for senders whose group may override the mail
+  // limits: the permission to reach a whole group.
+  bool deliver_group(int number) override {
+    if (!sender_local || !sender_group || !(sender_group->mail_flags & gflag::mail_override)) {
+      error(strprintf("You do not have the permission to email group %d\r\n", number), {});
+      return false;
+    }
+    for (const UserRecord* u : user_list())
+      if (u->group == number) deliver_local(u->login, u->login);
+    return true;
+  }
+
+  void loop_report() override {
+    error("Aliasing loop whilst processing the following article\r\n", text_of(config.admin_email));
+  }
+
+  std::tm local_time() override {
+    std::time_t now = server_now ? server_now : std::time(nullptr);
+    std::tm tm{};
+    localtime_r(&now, &tm);
+    return tm;
+  }
+
+  // ---- the outgoing file ----
+  // Writes the message (from the DATA line) behind the envelope, syncs it and
+  // puts it in the outgoing list.
+  void finish_outgoing() {
+    if (!outgoing_) return;
+    if (moved) {
+      filecache_destroy(outgoing_);
+      return;
+    }
+    if (filecache_copy(file_, env_.data_offset, outgoing_, kToEnd) != 0) write_failed_ = true;
+    std::string name = filecache_path(outgoing_);
+    if (write_failed_) {
+      filecache_destroy(outgoing_);
+      fail("Outgoing mail file could not be written");
+      return;
+    }
+    if (filecache_close(outgoing_) != 0) {
+      fail("Outgoing mail file could not be written");
+      return;
+    }
+    ++copies;
+    queue_add_outgoing(name);
+  }
+
+ private:
+  std::string outgoing_sender() const {
+    if (config.mail_from_force && !config.mail_from_force->empty()) return *config.mail_from_force;
+    return env_.sender;
+  }
+
+  void write_out(CacheFile& f, std::string_view text) {
+    if (filecache_write(f, text) != 0) write_failed_ = true;
+  }
+
+  void send_direct(std::string_view address) {
+    if (!env_.has_sender_bracket) {
+      error("Invalid address", {});
+      return;
+    }
+    std::string name = queue_new_outgoing_name();
+    CacheFile out = name.empty() ? CacheFile() : filecache_open(name, FileMode::write);
+    if (!out) {
+      error("Outgoing file could not be created.\r\nThis is either due to a system error, or the outgoing queue is "
+            "full.\r\nPlease try resending later.\r\n",
+            {});
+      return;
+    }
+    int rc = filecache_write(out, "MAIL FROM:<" + outgoing_sender() + ">\r\nRCPT TO:<" + std::string(address) + ">\r\n");
+    if (rc == 0) rc = filecache_copy(file_, env_.data_offset, out, kToEnd);
+    if (rc != 0) {
+      filecache_destroy(out);
+      fail("Outgoing mail file could not be written");
+      return;
+    }
+    if (filecache_close(out) != 0) {
+      fail("Outgoing mail file could not be written");
+      return;
+    }
+    ++copies;
+    queue_add_outgoing(name);
+  }
+
+  CacheFile outgoing_;
+  bool write_failed_ = false;
+};
+
+int count_received(CacheFile& file, std::uint64_t offset) {
+  int count = 0;
+  std::string line;
+  while (count <= kMaxReceived && queue_read_line(file, offset, line, 64)) {
+    if (line.empty() || line == ".") break;
+    if (str_istarts_with(line, "Received:")) ++count;
+  }
+  return count;
+}
+
+// The first word of a header value that holds an '@', without its brackets.
+std::string first_address(std::string_view value) {
+  std::size_t pos = 0;
+  while (pos < value.size()) {
+    std::size_t start = value.find_first_not_of(" \t,<>()\"';:", pos);
+    if (start == std::string_view::npos) break;
+    std::size_t end = value.find_first_of(" \t,<>()\"';:", start);
+    std::string_view word = value.substr(start, end == std::string_view::npos ? std::string_view::npos : end - start);
+    if (word.find('@') != std::string_view::npos) return std::string(word.substr(0, kMaxAddress));
+    if (end == std::string_view::npos) break;
+    pos = end;
+  }
+  return {};
+}
+
+// The sender's group limits on the whole message. True when the message was
+// refused (and the refusal reported).
+bool refused_by_group(Debatch& d, const GroupOptions& group, std::string_view who, std::uint64_t size) {
+  if (group.mail_flags & gflag::mail_override) return false;
+  std::uint32_t limit = group.size("mail.msg.size");
+  if (limit && size > limit) {
+    log_write(strprintf("[Mail] Oversize article [%s]:%.*s", size_text(size).c_str(), static_cast<int>(who.size()),
+                        who.data()),
+              logchan::filter);
+    std::string to = group.has("mail.large.redirect") ? group.text("mail.large.redirect") : std::string();
+    d.error(strprintf("The following email was greater than the %ukB length limit, at %llukB\r\n", limit / 1024,
+                      static_cast<unsigned long long>(size / 1024)),
+            to, true);
+    return true;
+  }
+  const std::string& filter = group.text("mail.filter");
+  if (!filter.empty() && mail_filter_match(filter, d.path_)) {
+    log_write(strprintf("[Mail] Banned word/phrase found: %.*s", static_cast<int>(who.size()), who.data()),
+              logchan::filter);
+    std::string to = group.has("mail.filter.redirect") ? group.text("mail.filter.redirect") : std::string();
+    d.error("The following email contained a forbidden phrase\r\n\r\n", to, true);
+    return true;
+  }
+  return false;
+}
+
+// Fetched messages are delivered by the address in one of the pop.headers
+// header lines, when one is present. True when that delivered it.
+bool pop_header_filter(Debatch& d) {
+  std::string list = str_lower(text_of(config.pop_headers));
+  log_message("filtering:", list, logfac::maildebatch);
+  if (!d.env_.has_data) {
+    log_message("filtering:bad file, no DATA", {}, logfac::maildebatch);
+    return false;
+  }
+  std::size_t pos = 0;
+  while (pos < list.size()) {
+    std::size_t start = list.find_first_not_of(" \t,", pos);
+    if (start == std::string::npos) break;
+    std::size_t end = list.find_first_of(" \t,", start);
+    std::string name = list.substr(start, std::min<std::size_t>(end == std::string::npos ? list.size() - start
+                                                                                         : end - start,
+                                                                60));
+    pos = end == std::string::npos ? list.size() : end;
+    std::uint64_t offset = d.env_.body_offset;
+    std::string line;
+    while (queue_read_line(d.file_, offset, line, 1024)) {
+      if (line.empty()) break;
+      std::size_t colon = line.find(':');
+      if (colon == std::string::npos || str_lower(trim_blanks(std::string_view(line).substr(0, colon))) != name)
+        continue;
+      std::string address = first_address(std::string_view(line).substr(colon + 1));
+      if (address.empty()) return false;
+      d.trace += " " + address;
+      std::optional<std::string> user = mail_local_user(address);
+      if (user) {
+        std::shared_ptr<const GroupOptions> group = user_group(*user);
+        if (group && refused_by_group(d, *group, *user, filecache_length(d.file_))) return true;
+      }
+      bool taken = alias_resolve(alias_table(), user ? *user : address, d);
+      if (!taken && user && user_exists(*user)) taken = d.deliver_local(*user, address);
+      return taken;
+    }
+  }
+  return false;
+}
+
+}  // namespace
+
+void debatch_file(const std::string& path) {
+  CacheFile file = filecache_open(path, FileMode::read);
+  if (!file) {
+    if (file_size(path) >= 0) mail_move_to_oddments(path, "Mail debatch - Bad rewrite open");
+    return;
+  }
+  std::uint64_t size = filecache_length(file);
+  if (size < 30) {
+    filecache_close(file);
+    mail_move_to_oddments(path, "Article was too short");
+    return;
+  }
+  QueueEnvelope env = queue_read_envelope(file);
+  Debatch d(path, file, env);
+  auto to_oddments = [&](std::string_view reason) {
+    filecache_close(file);
+    mail_move_to_oddments(path, reason);
+  };
+  if (env.recipients.empty() && !env.has_data && env.data_offset == 0) {
+    to_oddments("Bad debatch read - unexpected end of file");
+    return;
+  }
+  if (env.recipients.empty()) {
+    to_oddments("No recipients");
+    return;
+  }
+  if (!env.has_data || filecache_at_end(file, env.body_offset)) {
+    to_oddments("Bad read in debatch - no message body");
+    return;
+  }
+  if (count_received(file, env.body_offset) > kMaxReceived) {
+    to_oddments("Too many Received headers - mail loop");
+    return;
+  }
+
+  std::string sender_user;
+  if (env.fetched) {
+    log_message("Article was POPed", {}, logfac::house);
+  } else {
+    std::optional<std::string> user = mail_local_user(env.sender);
+    d.sender_local = user.has_value();
+    if (user) sender_user = *user;
+    d.sender_group = user_group(sender_user);
+    if (d.sender_group && refused_by_group(d, *d.sender_group, user ? sender_user : env.sender, size)) {
+      filecache_close(file);
+      if (d.moved) return;
+      if (d.failure.empty()) {
+        filecache_delete(path);
+      } else {
+        mail_move_to_oddments(path, d.failure);
+      }
+      return;
+    }
+  }
+
+  d.trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
+                      env.sender.c_str());
+  bool override = d.sender_group && (d.sender_group->mail_flags & gflag::mail_override);
+  bool first = true;
+  for (const std::string& address : env.recipients) {
+    if (d.moved) break;
+    if (!env.fetched) d.trace += " " + address;
+    if (d.sender_local && d.sender_group && !override) {
+      const std::string& block = d.sender_group->text("mail.address.send.block");
+      const std::string& allow = d.sender_group->text("mail.address.send.allow");
+      if (!block.empty() && wildcard_match(address, block) && !(!allow.empty() && wildcard_match(address, allow))) {
+        log_write("[Mail] Blocked recipient [" + address + "] for: " + env.sender, logchan::filter);
+        std::string redirect = d.redirect_or_sender("mail.block.redirect");
+        log_message("Recipient address forbidden, mail redirect to ", redirect.empty() ? env.sender : redirect,
+                    logfac::house);
+        d.error("The following email was sent to a forbidden user\r\n", redirect);
+        continue;
+      }
+    }
+    if (env.fetched && first) {
+      first = false;
+      if (pop_header_filter(d)) break;
+    }
+    std::optional<std::string> local = mail_local_user(address);
+    if (local) {
+      if (alias_resolve(alias_table(), *local, d)) continue;
+      if (user_exists(*local) && d.deliver_local(*local, address)) continue;
+      d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
+    } else if (!alias_resolve(alias_table(), address, d)) {
+      d.deliver_remote(address);
+    }
+  }
+  d.finish_outgoing();
+  log_write(d.trace, logchan::mail_trace, kLogNoStamp);
+  filecache_close(file);
+
+  if (d.moved) return;
+  if (d.failure.empty()) {
+    filecache_delete(path);
+  } else if (d.copies == 0 && d.only_temporary) {
+    log_write("Mail debatch: " + d.failure + " - " + path + " left in the queue for a later try", logchan::errors);
+    queue_retry_later();
+  } else {
+    mail_move_to_oddments(path, d.failure);
+  }
+}
+
+// ---- start-up and the poll ------------------------------------------------
+
+void mail_note_traffic() { g_last_traffic = server_now; }
+void queue_retry_later() { g_retry_at = server_now + kRetrySeconds; }
+
+int mail_init() {
+  std::time_t now = server_now ? server_now : std::time(nullptr);
+  queue_init(now);
+  g_last_traffic = now;
+  g_retry_at = 0;
+  g_debatch_pending = false;
+  log_message("    Loading mail alias entries", {}, logfac::house);
+  alias_load();
+  log_message("    Loading SMTP reject entries", {}, logfac::house);
+  smtp_reject_load();
+  log_message("    Scanning incoming mail queue", {}, logfac::house);
+  queue_scan_incoming();
+  log_message("    Scanning outgoing mail queue", {}, logfac::house);
+  queue_scan_outgoing();
+
+  hooks.mailrescan = [] {
+    queue_scan_outgoing();
+    queue_scan_incoming();
+  };
+  hooks.maildebatch = [] { mail_debatch_one(); };
+  hooks.list_mail_queue = queue_list;
+  hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
+  smtp_server_register();
+  return 0;
+}
+
+void mail_debatch_one() {
+  std::size_t left = queue_incoming().size();
+  std::optional<std::string> path = queue_pop_incoming();
+  if (!path) {
+    log_message("Debatching mail - no articles in queue", {}, logfac::house);
+    g_debatch_pending = false;
+    return;
+  }
+  log_message("Debatching mail - articles left in queue: ", std::to_string(left), logfac::house);
+  debatch_file(*path);
+  g_debatch_pending = !queue_incoming().empty();
+}
+
+void mail_poll() {
+  if (g_retry_at && server_now >= g_retry_at) {
+    g_retry_at = 0;
+    queue_scan_incoming();
+  }
+  if (!queue_incoming().empty() && config.mail_debatch_time > 0 &&
+      server_now - g_last_traffic > config.mail_debatch_time)
+    g_debatch_pending = true;
+  // A batch per poll, bounded in time: a busy queue neither waits one
+  // message per tick nor holds up the connections.
+  auto start = std::chrono::steady_clock::now();
+  while (g_debatch_pending) {
+    mail_debatch_one();
+    if (std::chrono::steady_clock::now() - start > std::chrono::milliseconds(100)) break;
+  }
+}
+
+}  // namespace velmor
