@@ -1,6 +1,7 @@
 #include "core/util.h"
 
 #include <ftw.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -10,6 +11,7 @@
 #include "core/config.h"
 #include "core/filecache.h"
 #include "core/globals.h"
+#include "core/process.h"
 
 namespace velmor {
 namespace {
@@ -282,6 +284,46 @@ TEST(FormFields, PostedBodiesInFiles) {
   filecache_close(copy);
   filecache_close(page);
   config.cache_big = 0;
+  ::nftw(tmpl, [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 8, FTW_DEPTH | FTW_PHYS);
+}
+
+TEST(UserChangeNote, AppendsPrivatelyAndRunsTheHook) {
+  char tmpl[] = "/tmp/velmor-hook-XXXXXX";
+  ASSERT_NE(::mkdtemp(tmpl), nullptr);
+  const std::string dir = tmpl;
+  // A stand-in for the command the hook runs, found on the PATH.
+  const std::string script = dir + "/Filer_Run";
+  FILE* f = std::fopen(script.c_str(), "w");
+  ASSERT_NE(f, nullptr);
+  std::fprintf(f, "#!/bin/sh\necho \"$@\" > %s/ran.new && mv %s/ran.new %s/ran\n", tmpl, tmpl, tmpl);
+  std::fclose(f);
+  ::chmod(script.c_str(), 0755);
+  const std::string old_path = std::getenv("PATH") ? std::getenv("PATH") : "";
+  ::setenv("PATH", (dir + ":" + old_path).c_str(), 1);
+
+  config.file_user_changes = dir + "/changes";
+  user_change_note("add fred");
+  config.file_user_exec = "hook";
+  user_change_note("change\r\nbob");
+  std::string ran = dir + "/ran";
+  for (int i = 0; i < 500 && !file_is_regular(ran); ++i) {
+    process_poll();
+    ::usleep(10000);
+  }
+  process_poll();
+  CacheFile changes = filecache_open(dir + "/changes", FileMode::read);
+  EXPECT_EQ(filecache_view(changes, 0), "add fred\nchange  bob\n");
+  filecache_close(changes);
+  struct stat st{};
+  ASSERT_EQ(::stat((dir + "/changes").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  CacheFile out = filecache_open(ran, FileMode::read);
+  EXPECT_EQ(filecache_view(out, 0), "hook " + dir + "/changes\n");
+  filecache_close(out);
+
+  ::setenv("PATH", old_path.c_str(), 1);
+  config.file_user_changes.reset();
+  config.file_user_exec.reset();
   ::nftw(tmpl, [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 8, FTW_DEPTH | FTW_PHYS);
 }
 
