@@ -20,11 +20,14 @@
 
 #include "core/commands.h"
 #include "core/config.h"
+#include "core/control.h"
 #include "core/defaults.h"
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/mime.h"
+#include "core/process.h"
+#include "core/scheduler.h"
 #include "core/sockets.h"
 #include "core/strfmt.h"
 
@@ -274,8 +277,8 @@ void tick() {
   if (mail_transfer_state) mail_transfer_poll();
   // mail: mail_poll();
   log_poll();
-  // scheduler: schedule_poll();
-  // child processes: process_poll();
+  schedule_poll();
+  process_poll();
   sockets_check_timeouts();
 }
 
@@ -303,7 +306,7 @@ void poll() {
 void shutdown_suite() {
   log_message("Shutting down");
   if (pid_file_written) ::unlink(paths.pid_file.c_str());
-  // control channel: control_remove();
+  control_remove();
   log_message("Shutting down sockets");
   sockets_close_all();
   log_message("Shutting down filecache");
@@ -368,7 +371,11 @@ int start_and_run() {
                                 &config.news_dir_outgoing, &config.proxy_cache_dir})
     if (!text_of(*dir).empty()) make_path(text_of(*dir));
 
-  // scheduler: "Loading scheduler task entries", schedule_load().
+  log_message("Loading scheduler task entries");
+  if (int rc = schedule_load(); rc != 0) {
+    std::printf("Scheduler init failed\n");
+    return rc;
+  }
   // users: "Loading user database", "Loading user group options".
   // mail: "Initialising mail system", mail_init().
   log_message("Starting listening sockets");

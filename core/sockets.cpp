@@ -20,6 +20,7 @@
 #include <map>
 #include <vector>
 
+#include "core/control.h"
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
@@ -650,6 +651,7 @@ int listeners_open() {
     return h && h->open_sockets ? h->open_sockets() : 0;
   };
   if (open_own(svc::dns | kDatagram) != 0) return 1;
+  control_open();
   return open_own(svc::multiport) != 0 ? 1 : 0;
 }
 

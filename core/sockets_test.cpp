@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "core/config.h"
+#include "core/control.h"
 #include "core/globals.h"
 
 namespace velmor {
@@ -359,8 +360,9 @@ TEST(Lookup, TheEndOfALookupReachesTheService) {
   sockets_close_all();
 }
 
-// Thousands of idle connections, most on descriptors above 1024.
-TEST(ManyConnections, TwoThousandIdleClients) {
+// Thousands of idle connections, most on descriptors above 1024, and the
+// control channel still answers within one pass.
+TEST(ManyConnections, TwoThousandIdleClientsAndTheControlChannelAnswers) {
   rlimit lim{};
   getrlimit(RLIMIT_NOFILE, &lim);
   if (lim.rlim_max < 4500) GTEST_SKIP() << "descriptor limit too low";
@@ -369,6 +371,9 @@ TEST(ManyConnections, TwoThousandIdleClients) {
 
   server_now = std::time(nullptr);
   paths.bind_address = "127.0.0.1";
+  char dir[] = "/tmp/velmor-sockets-XXXXXX";
+  ASSERT_NE(mkdtemp(dir), nullptr);
+  paths.control = std::string(dir) + "/control";
   ServiceHandlers h;
   h.max_connections = [] { return 5000; };
   h.accept = [](SocketRecord& r) { return r.write_buf.append("+\r\n") ? 0 : 1; };
@@ -376,6 +381,7 @@ TEST(ManyConnections, TwoThousandIdleClients) {
   int listen_fd = -1;
   ASSERT_EQ(listener_open(0, svc::pop, 6, &listen_fd), 0);
   int port = bound_port(listen_fd);
+  control_open();
 
   std::vector<int> clients;
   for (int i = 0; i < 2000; ++i) {
@@ -390,9 +396,26 @@ TEST(ManyConnections, TwoThousandIdleClients) {
   ASSERT_TRUE(pump([&] { return connection_count(svc::pop) == 2000; }, 10000));
   EXPECT_GT(clients.back(), 1024);
 
+  int ctl = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un self{};
+  self.sun_family = AF_UNIX;
+  ASSERT_EQ(::bind(ctl, reinterpret_cast<sockaddr*>(&self), sizeof(sa_family_t)), 0);
+  sockaddr_un to{};
+  to.sun_family = AF_UNIX;
+  std::snprintf(to.sun_path, sizeof to.sun_path, "%s", paths.control.c_str());
+  ASSERT_EQ(::sendto(ctl, "test\n", 5, 0, reinterpret_cast<sockaddr*>(&to), sizeof to), 5);
+  dispatcher(1000);
+  char buf[64] = {};
+  ASSERT_GT(::recv(ctl, buf, sizeof buf - 1, MSG_DONTWAIT), 5);
+  EXPECT_EQ(std::string(buf), "test:" + std::to_string(server_now) + "\n");
+
   for (int fd : clients) ::close(fd);
   ASSERT_TRUE(pump([&] { return connection_count(svc::pop) == 0; }, 10000));
+  ::close(ctl);
   sockets_close_all();
+  control_remove();
+  EXPECT_EQ(::access(paths.control.c_str(), F_OK), -1);
+  ::rmdir(dir);
 }
 
 TEST(Telnet, NegotiationIsAnsweredAndStripped) {

@@ -1,0 +1,254 @@
+// The control channel: a local datagram socket. Each request is one datagram
+// of command text; replies go back to the sender's own bound address. Replies
+// never wait: a client that stops reading loses its replies, not the suite.
+#include "core/control.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <vector>
+
+#include "core/commands.h"
+#include "core/config.h"
+#include "core/globals.h"
+#include "core/hooks.h"
+#include "core/log.h"
+#include "core/sockets.h"
+#include "core/strfmt.h"
+#include "core/util.h"
+
+namespace velmor {
+
+namespace {
+
+constexpr std::size_t kMaxRequest = 250;
+constexpr std::size_t kMaxWord = 62;
+
+struct ControlSocket {
+  dev_t dev = 0;  // the socket file this process made
+  ino_t ino = 0;
+  bool made = false;
+};
+ControlSocket& control() {
+  static ControlSocket c;
+  return c;
+}
+
+bool make_address(const std::string& path, sockaddr_un& a, socklen_t& len) {
+  a = sockaddr_un{};
+  a.sun_family = AF_UNIX;
+  if (path.empty() || path.size() >= sizeof a.sun_path) return false;
+  std::memcpy(a.sun_path, path.data(), path.size());
+  len = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + path.size() + 1);
+  return true;
+}
+
+// A socket file left by a crashed suite answers nobody; one that a running
+// suite still serves is left alone (bind then fails and says so).
+void remove_stale_socket(const std::string& path) {
+  struct stat st{};
+  if (lstat(path.c_str(), &st) != 0 || !S_ISSOCK(st.st_mode)) return;
+  sockaddr_un a;
+  socklen_t len;
+  if (!make_address(path, a, len)) return;
+  int probe = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  if (probe < 0) return;
+  bool alive = ::connect(probe, reinterpret_cast<sockaddr*>(&a), len) == 0;
+  int error = errno;
+  ::close(probe);
+  if (!alive && error == ECONNREFUSED) unlink(path.c_str());
+}
+
+std::time_t last_send_failure_log = -1;
+
+// Sends one reply datagram without waiting. A failure is logged, at most
+// once a second, so a client that never reads cannot flood the log.
+void send_reply(int fd, const sockaddr_un& to, socklen_t to_len, std::string_view text,
+                const char* failure_text) {
+  if (to_len <= sizeof(sa_family_t)) return;  // an unbound sender cannot be answered
+  if (::sendto(fd, text.data(), text.size(), MSG_DONTWAIT | MSG_NOSIGNAL,
+               reinterpret_cast<const sockaddr*>(&to), to_len) >= 0)
+    return;
+  if (failure_text && last_send_failure_log != server_now) {
+    last_send_failure_log = server_now;
+    log_message(failure_text, std::strerror(errno));
+  }
+}
+
+// "log WORD" / "nolog WORD": switches one facility of the main log.
+void switch_facility(std::string_view text) {
+  static const struct {
+    const char* word;
+    std::uint32_t bit;
+  } kFacilities[] = {
+      {"house", logfac::house},         {"smtp", logfac::smtp},
+      {"pop", logfac::pop},             {"imap", logfac::imap},
+      {"maildebatch", logfac::maildebatch}, {"newsfetch", logfac::newsfetch},
+      {"newsserver", logfac::newsserver}, {"newsdebatch", logfac::newsdebatch},
+      {"web", logfac::web},             {"proxy", logfac::proxy},
+      {"dns", logfac::dns},             {"fcache", logfac::fcache},
+      {"schedule", logfac::schedule},   {"dialler", logfac::dialler},
+      {"utils", logfac::utils},
+  };
+  const bool on = text[0] == 'l' || text[0] == 'L';
+  const std::size_t word_len = on ? 3 : 5;
+  if (text.size() <= word_len || text[word_len] != ' ') return;
+  std::string_view name = text.substr(word_len + 1);
+  for (const auto& f : kFacilities) {
+    std::size_t n = std::strlen(f.word);
+    if (name.size() >= n && str_ncasecmp(name, f.word, n) == 0) {
+      bits_set(log_mask, f.bit, on);
+      return;
+    }
+  }
+}
+
+// "change pass USER OLD NEW" -> "1" old password wrong, "2" changed, "0" the
+// change failed. The text is never logged.
+std::string change_password(std::string_view text) {
+  std::vector<std::string_view> words;
+  std::string_view rest = text.substr(11);
+  while (!rest.empty()) {
+    std::size_t start = rest.find_first_not_of(' ');
+    if (start == std::string_view::npos) break;
+    rest.remove_prefix(start);
+    std::size_t end = rest.find(' ');
+    words.push_back(rest.substr(0, end));
+    rest = end == std::string_view::npos ? std::string_view() : rest.substr(end);
+  }
+  // Without a user database nothing can vouch for the old password.
+  if (words.size() < 3 || !hooks.change_password) return "1";
+  if (words[0].size() > kMaxWord || words[1].size() > kMaxWord) return "1";
+  if (words[2].size() > kMaxWord) return "0";  // never cut a new password silently
+  return std::to_string(hooks.change_password(words[0], words[1], words[2]));
+}
+
+std::string status_text() {
+  int web = connection_count(svc::web) + connection_count(svc::web_internal);
+  int proxy = connection_count(svc::proxy) + connection_count(svc::cache_request) +
+              connection_count(svc::telnet) + connection_count(svc::multiport);
+  long mail = hooks.outgoing_mail_count ? static_cast<long>(hooks.outgoing_mail_count()) : 0;
+  return strprintf("is:%d\nmq:%ld\nnq:%d\nwf:%d\npf:%d\n", static_cast<int>(status_bits), mail, 0, web, proxy);
+}
+
+// Receives and answers the waiting requests; level-triggered readiness
+// brings the dispatcher back for the rest after a bounded batch.
+int control_read(SocketRecord& record, long) {
+  for (int batch = 0; batch < 256; ++batch) {
+    char buf[kMaxRequest + 2];
+    sockaddr_un from{};
+    socklen_t from_len = sizeof from;
+    ssize_t n = ::recvfrom(record.fd, buf, sizeof buf, MSG_DONTWAIT | MSG_TRUNC,
+                           reinterpret_cast<sockaddr*>(&from), &from_len);
+    if (n < 0) return 0;
+    if (static_cast<std::size_t>(n) > kMaxRequest) {
+      // Acting on part of a command (a cut password, say) would be worse
+      // than ignoring it.
+      log_message("Control request too long, ignored");
+      continue;
+    }
+    std::string_view text(buf, static_cast<std::size_t>(n));
+    text = text.substr(0, text.find('\0'));
+    control_command(text, [&](std::string_view reply) {
+      bool pass = str_istarts_with(text, "change pass");
+      send_reply(record.fd, from, from_len, reply,
+                 pass ? "domain send failed (change pass) " : "domain send failed");
+    });
+  }
+  return 0;
+}
+
+}  // namespace
+
+void control_command(std::string_view text, const std::function<void(std::string_view)>& reply) {
+  while (!text.empty() && (text.back() == '\r' || text.back() == '\n')) text.remove_suffix(1);
+  if (text.empty()) return;
+  // Tested before the internal words, so that its text never reaches a log.
+  if (str_istarts_with(text, "change pass")) {
+    reply(change_password(text));
+    return;
+  }
+  if (internal_command(text)) return;
+  if (str_iequals(text, "reload config")) {
+    config_load();
+  } else if (str_iequals(text, "reload users")) {
+    if (hooks.reload_users) hooks.reload_users();
+  } else if (str_iequals(text, "reload groups")) {
+    if (hooks.reload_groups) hooks.reload_groups();
+  } else if (str_iequals(text, "clear mqcng")) {
+    status_bits &= ~status::mail_queue_changed;
+  } else if (str_iequals(text, "clear nqcng")) {
+    status_bits &= ~status::news_queue_changed;
+  } else if (str_istarts_with(text, "log") || str_istarts_with(text, "nolog")) {
+    switch_facility(text);
+  } else if (str_iequals(text, "listmq")) {
+    reply("start mq\n");
+    if (hooks.list_mail_queue) hooks.list_mail_queue(reply);
+    reply("end mq\n");
+  } else if (str_iequals(text, "listnq")) {
+    reply("start mq\n");
+    if (hooks.list_news_queue) hooks.list_news_queue(reply);
+    reply("end nq\n");
+  } else if (str_iequals(text, "status")) {
+    reply(status_text());
+  } else if (str_iequals(text, "test")) {
+    reply(strprintf("test:%ld\n", static_cast<long>(server_now)));
+  }
+}
+
+void control_open() {
+  auto& c = control();
+  const std::string& path = paths.control;
+  sockaddr_un a;
+  socklen_t len;
+  if (!make_address(path, a, len)) {
+    log_write("Control socket path too long: " + path, logchan::errors);
+    log_message("Control socket path too long: ", path);
+    return;
+  }
+  int fd = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+  if (fd < 0) {
+    log_write("UDP socket create for UNIX domain failed", logchan::errors);
+    log_message("UDP socket create for UNIX domain failed");
+    return;
+  }
+  remove_stale_socket(path);
+  // The socket file is born with mode 0660: nobody else may steer the suite.
+  mode_t old_mask = umask(0117);
+  int bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), len);
+  int error = errno;
+  umask(old_mask);
+  if (bound != 0) {
+    log_write("bind() for UNIX domain failed", logchan::errors);
+    log_message("bind() for UNIX domain failed:", std::to_string(error));
+    ::close(fd);
+    return;
+  }
+  chmod(path.c_str(), 0660);
+  struct stat st{};
+  if (stat(path.c_str(), &st) == 0) {
+    c.dev = st.st_dev;
+    c.ino = st.st_ino;
+    c.made = true;
+  }
+  if (!service_handlers(svc::control | kDatagram))
+    register_service(svc::control | kDatagram, ServiceHandlers{.read = control_read});
+  if (!record_create(fd, svc::control | kDatagram, sockstate::initial)) {
+    ::close(fd);
+  }
+}
+
+void control_remove() {
+  auto& c = control();
+  if (!c.made) return;
+  struct stat st{};
+  if (stat(paths.control.c_str(), &st) == 0 && st.st_dev == c.dev && st.st_ino == c.ino)
+    unlink(paths.control.c_str());
+  c.made = false;
+}
+
+}  // namespace velmor

@@ -1,0 +1,161 @@
+"""The control channel, through velmorctl and through plain datagram sockets."""
+
+import os
+import socket
+import stat
+import subprocess
+import time
+import unittest
+
+from harness import Suite, SuiteTestCase, VELMORCTL_BIN
+
+
+def client(timeout=3.0):
+    """A datagram socket bound to a fresh abstract address, so replies reach it."""
+    s = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+    s.bind('')  # autobind
+    s.settimeout(timeout)
+    return s
+
+
+def wait_for(predicate, timeout=5.0):
+    deadline = time.monotonic() + timeout
+    while time.monotonic() < deadline:
+        if predicate():
+            return True
+        time.sleep(0.05)
+    return predicate()
+
+
+class ControlChannelTest(SuiteTestCase):
+
+    def control(self):
+        return self.suite.path('run/control')
+
+    def ask(self, text, sock=None):
+        s = sock or client()
+        try:
+            s.sendto(text.encode(), self.control())
+            return s.recv(65536).decode()
+        finally:
+            if sock is None:
+                s.close()
+
+    def silent(self, text):
+        """Sends `text` and confirms that no reply comes back."""
+        with client(timeout=0.5) as s:
+            s.sendto(text.encode(), self.control())
+            with self.assertRaises(socket.timeout):
+                s.recv(65536)
+
+    def test_test_and_status_answer(self):
+        rc, out = self.suite.ctl('test')
+        self.assertEqual(rc, 0)
+        self.assertRegex(out, r'^test:\d+\n$')
+        self.assertLess(abs(int(out[5:]) - time.time()), 5)
+        for word in ('status', 'STATUS', 'Status'):
+            rc, out = self.suite.ctl(word)
+            self.assertEqual(rc, 0)
+            self.assertRegex(out, r'^is:\d+\nmq:\d+\nnq:0\nwf:\d+\npf:\d+\n$')
+        # A trailing CR LF is ignored; anything more makes another command.
+        self.assertTrue(self.ask('test\r\n').startswith('test:'))
+        self.silent('status now')
+        self.silent('tests')
+        self.silent('')
+
+    def test_queue_listings_end_with_their_end_lines(self):
+        rc, out = self.suite.ctl('listmq')
+        self.assertEqual(rc, 0)
+        self.assertTrue(out.startswith('start mq\n'), out)
+        self.assertTrue(out.endswith('end mq\n'), out)
+        rc, out = self.suite.ctl('listnq')
+        self.assertEqual(rc, 0)
+        self.assertEqual(out, 'start mq\nend nq\n')
+
+    def test_log_facilities_switch(self):
+        # Internal command words are logged under the general facility.
+        self.assertEqual(self.suite.ctl('nolog house')[0], 0)
+        self.suite.ctl('popkick')
+        self.assertEqual(self.suite.ctl('test')[0], 0)  # requests are served in order
+        self.assertNotIn('popkick', self.suite.log('main'))
+        self.suite.ctl('log housekeeping')  # compared by the keyword's length
+        self.suite.ctl('smtpkick')
+        self.assertTrue(wait_for(lambda: 'smtpkick' in self.suite.log('main')))
+        # Without the blank nothing is switched.
+        self.suite.ctl('nologhouse')
+        self.suite.ctl('newskick')
+        self.assertTrue(wait_for(lambda: 'newskick' in self.suite.log('main')))
+
+    def test_password_change_with_a_wrong_password_is_refused_and_never_logged(self):
+        rc, out = self.suite.ctl('change pass demo not-the-password Sekrit-New-42')
+        self.assertEqual(out, '1\n')
+        self.assertNotEqual(rc, 0)
+        self.assertEqual(self.ask('change pass'), '1')  # words missing
+        self.assertEqual(self.ask('change pass demo %s new' % ('x' * 70)), '1')
+        self.assertEqual(self.ask('test'), self.ask('test'))  # still serving
+        for name in ('main', 'errors'):
+            self.assertNotIn('Sekrit-New-42', self.suite.log(name))
+            self.assertNotIn('not-the-password', self.suite.log(name))
+
+    def test_a_client_that_never_reads_cannot_hold_up_the_others(self):
+        greedy = client(timeout=20)
+        for _ in range(5000):
+            greedy.sendto(b'test', self.control())
+        start = time.monotonic()
+        reply = self.ask('test')
+        self.assertTrue(reply.startswith('test:'))
+        self.assertLess(time.monotonic() - start, 2.0)
+        greedy.close()
+        self.assertEqual(self.suite.ctl('status')[0], 0)
+        self.assertIsNone(self.suite.proc.poll())
+
+    def test_socket_is_private_and_velmorctl_fails_without_an_answer(self):
+        mode = os.stat(self.control()).st_mode
+        self.assertTrue(stat.S_ISSOCK(mode))
+        self.assertEqual(stat.S_IMODE(mode), 0o660)
+        # Nobody at the path.
+        missing = self.suite.path('run/nobody')
+        r = subprocess.run([VELMORCTL_BIN, '--control', missing, 'test'], capture_output=True, timeout=10)
+        self.assertNotEqual(r.returncode, 0)
+        # Someone at the path who never answers.
+        silent = self.suite.path('run/silent')
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as s:
+            s.bind(silent)
+            r = subprocess.run([VELMORCTL_BIN, '--control', silent, 'status'], capture_output=True, timeout=10)
+            self.assertNotEqual(r.returncode, 0)
+            self.assertEqual(s.recv(100), b'status')
+            # A command without a reply does not wait for one.
+            r = subprocess.run([VELMORCTL_BIN, '--control', silent, 'reload', 'users'],
+                               capture_output=True, timeout=10)
+            self.assertEqual(r.returncode, 0)
+            self.assertEqual(s.recv(100), b'reload users')
+        r = subprocess.run([VELMORCTL_BIN], capture_output=True, timeout=10)
+        self.assertEqual(r.returncode, 2)
+
+
+class ControlSocketLifetimeTest(unittest.TestCase):
+
+    def test_a_stale_socket_is_replaced_and_a_foreign_file_is_left_at_shutdown(self):
+        suite = Suite()
+        self.addCleanup(suite.cleanup)
+        path = suite.path('run/control')
+        os.makedirs(os.path.dirname(path), exist_ok=True)
+        # What a crash leaves behind: a socket file nobody serves.
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as s:
+            s.bind(path)
+        suite.start()
+        self.assertEqual(suite.ctl('test')[0], 0)
+        # The suite removes only the socket it made.
+        os.unlink(path)
+        with open(path, 'w') as f:
+            f.write('not a socket\n')
+        self.assertEqual(suite.stop(), 0)
+        self.assertTrue(os.path.isfile(path))
+        os.unlink(path)
+        suite.start()
+        self.assertEqual(suite.stop(), 0)
+        self.assertFalse(os.path.exists(path))
+
+
+if __name__ == '__main__':
+    unittest.main()
