@@ -162,6 +162,18 @@ int control_read(SocketRecord& record, long) {
   return 0;
 }
 
+// The subsystem sends its whole listing; without one the queue is empty,
+// and the listing says so.
+void list_queue(const std::function<void(const std::function<void(std::string_view)>&)>& lister,
+                std::string_view end_line, const std::function<void(std::string_view)>& reply) {
+  if (lister) {
+    lister(reply);
+    return;
+  }
+  reply("start mq\n");
+  reply(end_line);
+}
+
 }  // namespace
 
 void control_command(std::string_view text, const std::function<void(std::string_view)>& reply) {
@@ -186,13 +198,9 @@ void control_command(std::string_view text, const std::function<void(std::string
   } else if (str_istarts_with(text, "log") || str_istarts_with(text, "nolog")) {
     switch_facility(text);
   } else if (str_iequals(text, "listmq")) {
-    reply("start mq\n");
-    if (hooks.list_mail_queue) hooks.list_mail_queue(reply);
-    reply("end mq\n");
+    list_queue(hooks.list_mail_queue, "end mq\n", reply);
   } else if (str_iequals(text, "listnq")) {
-    reply("start mq\n");
-    if (hooks.list_news_queue) hooks.list_news_queue(reply);
-    reply("end nq\n");
+    list_queue(hooks.list_news_queue, "end nq\n", reply);
   } else if (str_iequals(text, "status")) {
     reply(status_text());
   } else if (str_iequals(text, "test")) {

@@ -31,7 +31,8 @@ struct SuiteHooks {
   // 1 = old password wrong; 2 = changed; 0 = the change failed.
   std::function<int(std::string_view user, std::string_view old_password,
                     std::string_view new_password)> change_password;
-  // Each listing line is handed to `send` as one datagram.
+  // The whole listing, from its "start mq" line to its "end mq" ("end nq")
+  // line; each datagram is handed to `send`.
   std::function<void(const std::function<void(std::string_view)>& send)> list_mail_queue;
   std::function<void(const std::function<void(std::string_view)>& send)> list_news_queue;
   std::function<std::size_t()> outgoing_mail_count;

@@ -66,7 +66,9 @@ class ControlChannelTest(SuiteTestCase):
     def test_queue_listings_end_with_their_end_lines(self):
         rc, out = self.suite.ctl('listmq')
         self.assertEqual(rc, 0)
+        self.assertEqual(out.count('start mq\n'), 1, out)
         self.assertTrue(out.startswith('start mq\n'), out)
+        self.assertEqual(out.count('end mq\n'), 1, out)
         self.assertTrue(out.endswith('end mq\n'), out)
         rc, out = self.suite.ctl('listnq')
         self.assertEqual(rc, 0)
