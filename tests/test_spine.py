@@ -8,7 +8,7 @@ import tempfile
 import time
 import unittest
 
-from harness import Suite, VELMOR_BIN
+from harness import Suite, SuiteTestCase, VELMOR_BIN
 
 STARTUP_CONSOLE = [
     'Velmor Server Suite starting...',
@@ -133,6 +133,23 @@ class StartAndStop(unittest.TestCase):
         self.assertEqual(r.stdout.splitlines()[-2:], [
             "couldn't open log config file:'config/logs'", 'logger init failed'])
         self.assertFalse(os.path.exists(self.suite.pid_file))
+
+
+class InternalCommands(SuiteTestCase):
+    def wait_for_log(self, text, timeout=10):
+        deadline = time.monotonic() + timeout
+        while text not in self.suite.log('main'):
+            self.assertLess(time.monotonic(), deadline, self.suite.log('main'))
+            time.sleep(0.05)
+
+    def test_words_are_logged_and_a_transfer_dials_while_the_link_is_down(self):
+        for word in ('NEWSKICK', 'mailtransfer'):
+            self.assertEqual(self.suite.ctl(word)[0], 0)
+        self.wait_for_log('Internal command: mailtransfer')
+        self.wait_for_log('Mail transfer - connecting...')
+        lines = log_texts(self.suite.log('main'))
+        self.assertIn('Internal command: NEWSKICK', lines)
+        self.assertNotIn('Mail transfer - connected, and starting transfer', lines)
 
 
 class Init(unittest.TestCase):
