@@ -371,18 +371,22 @@ int start_and_run() {
                                 &config.news_dir_outgoing, &config.proxy_cache_dir})
     if (!text_of(*dir).empty()) make_path(text_of(*dir));
 
-  log_message("Loading scheduler task entries");
-  if (int rc = schedule_load(); rc != 0) {
-    std::printf("Scheduler init failed\n");
+  // From here on a failing step writes out what the logger holds first.
+  auto fail = [](const char* console, int rc) {
+    if (console) std::printf("%s\n", console);
+    log_flush_all();
     return rc;
-  }
+  };
+
+  log_message("Loading scheduler task entries");
+  if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // users: "Loading user database", "Loading user group options".
   // mail: "Initialising mail system", mail_init().
   log_message("Starting listening sockets");
   if (sockets_init() != 0) {
     log_message("Socket initialisation failed - see logs for more info");
     sockets_close_all();
-    return 1;
+    return fail("Socket initialisation failed - see logs for more info", 1);
   }
 
   log_message("Suite started: ", kVersion);
