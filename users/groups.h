@@ -32,29 +32,45 @@ inline constexpr std::uint32_t misc_execcmds = 0x02, misc_ftpsu = 0x04, misc_con
 
 struct GroupOptions {
   int number = 0;
-  // One value per option of the table, in table order (unset when absent);
-  // sizes are held in bytes. Read them through the accessors below.
+  // By option index: the text of string, permission and list options (unset
+  // when absent) and the size options in kilobytes as written. A set made
+  // with no options reads as all unset. Read them through the accessors.
   std::vector<std::optional<std::string>> values;
-  std::vector<std::uint32_t> sizes;
+  std::vector<std::uint64_t> sizes_kb;
   std::uint32_t mail_flags = 0, news_flags = 0, proxy_flags = 0, web_flags = 0, misc_flags = 0;
 
   // The value of a string/permission/list option ("" when unset).
   const std::string& text(std::string_view key) const;
   bool has(std::string_view key) const;    // a string option is set
-  std::uint32_t size(std::string_view key) const;  // bytes, 0 = no limit
+  // Bytes, 0 = no limit; a limit past 4 GiB reads as 0xffffffff.
+  std::uint32_t size(std::string_view key) const;
+  bool flag(std::string_view key) const;   // a flag option is on
   // The permission rule for a permission option at `now` (server_now when 0).
+  // A key that is not a permission option refuses.
   bool permits(std::string_view key, std::time_t now = 0) const;
 };
 
-int groups_load(const std::string& path);  // 0; 1 cannot open; 2 no memory
-int groups_save();                          // 0 or non-zero on a failed write
-// With a value: sets the key (unknown keys ignored). Without: the written form.
-void group_option(GroupOptions& set, std::string_view key, std::string_view value);
+// Replaces the list with the file's sets. A missing file leaves no sets at
+// all (no default group). 0; 1 cannot open; 2 no memory.
+int groups_load(const std::string& path);
+// Writes the list to the file it was loaded from (temporary name, fsync,
+// rename; the old file kept as <file>~). 0, or an errno value when the file
+// could not be written, the old file then left as it was.
+int groups_save();
+// With a value: sets the key. False for an unknown key or a value holding a
+// CR, LF or NUL (which the file cannot carry); the set is then unchanged.
+// Leading blanks and tabs of the value are dropped, as the file reader does.
+bool group_option(GroupOptions& set, std::string_view key, std::string_view value);
+// Without: the written form (string, size in kilobytes, "yes"/"no"; "" for an
+// unset string); nothing for an unknown key.
 std::optional<std::string> group_option(const GroupOptions& set, std::string_view key);
 void group_copy(const GroupOptions& from, GroupOptions& to);
 std::shared_ptr<const GroupOptions> group_find(int number);  // nullptr when none
 std::shared_ptr<const GroupOptions> group_default();         // first set, or nullptr
 const std::vector<std::shared_ptr<GroupOptions>>& group_list();
+// The kind of an option (string for an unknown key).
 GroupOptionKind group_option_kind(std::string_view key);
+// Every option key in the order the file is written.
+const std::vector<std::string_view>& group_option_keys();
 
 }  // namespace velmor

@@ -2,6 +2,12 @@
 // full name, home directory and group number. Loaded at start-up and on
 // "reload users", written back whole (old file kept as <file>~) after every
 // change. User names compare without regard to case.
+//
+// Every change is saved before it is reported: when the file cannot be
+// written the table is put back as it was, the change log gets no record and
+// the call fails (user_last_error() then says why). A record pointer from
+// user_find() or user_list() stays valid until that user is removed or the
+// table is reloaded.
 #pragma once
 
 #include <memory>
@@ -22,7 +28,10 @@ struct UserRecord {
 };
 
 int user_load(const std::string& path);  // 0; 1 cannot open (table empty); 2 no memory
-int user_save();                          // 0; non-zero when the file could not be written
+// Writes the whole table to the file it was loaded from (temporary name,
+// fsync, rename; the old file kept as <file>~; mode 0600). 0; an errno value
+// when the file could not be written, the old file then left as it was.
+int user_save();
 // By login name, then dotted full name ("ann.lee"), then initials ("a.lee").
 const UserRecord* user_find(std::string_view key);
 // 0 correct; 1 no such user, no stored hash or no password; 2 wrong.
@@ -35,7 +44,9 @@ int user_set_password(std::string_view name, std::string_view password);  // 1 c
 int user_set_home(std::string_view name, std::string_view home);          // 1 changed; 0 not
 int user_set_name(std::string_view name, std::string_view full_name);     // 1 changed; 0 not
 int user_set_group(std::string_view name, int group);                     // 1 changed; 0 not
-int user_remove(std::string_view name);                                   // 0 removed; 1 not found
+int user_remove(std::string_view name);  // 0 removed; 1 not found; 2 not saved
+// Why the last change that failed was refused ("the full name holds a comma").
+const std::string& user_last_error();
 std::string user_home(std::string_view name);        // "" when unknown
 std::string user_full_name(std::string_view name);   // "" when unknown
 bool user_exists(std::string_view name);
@@ -43,5 +54,8 @@ bool user_exists(std::string_view name);
 // or its group has no set; nullptr when no groups are loaded at all.
 std::shared_ptr<const GroupOptions> user_group(std::string_view name);
 std::vector<const UserRecord*> user_list();  // in file order
+// A fresh password of `length` letters and digits (no look-alikes such as 0
+// and O) from the kernel's random source.
+std::string random_password(std::size_t length = 12);
 
 }  // namespace velmor

@@ -1,0 +1,259 @@
+#include "users/users.h"
+
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "core/config.h"
+#include "users/groups.h"
+
+namespace velmor {
+namespace {
+
+namespace fs = std::filesystem;
+
+std::string read_file(const fs::path& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+void write_file(const fs::path& path, const std::string& text) {
+  std::ofstream(path, std::ios::binary) << text;
+}
+
+unsigned mode_of(const fs::path& path) {
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0) return 0;
+  return st.st_mode & 0777;
+}
+
+class UsersTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = ::testing::TempDir() + "users_test.XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
+    dir_ = pattern;
+    config.file_user_changes = (dir_ / "changes").string();
+    config.file_user_exec.reset();
+  }
+  void TearDown() override {
+    config.file_user_changes.reset();
+    user_load("");
+    groups_load("");
+    fs::remove_all(dir_);
+  }
+  fs::path users_file() const { return dir_ / "users"; }
+  std::string changes() const { return read_file(dir_ / "changes"); }
+  // Loads a user file with the given lines.
+  void load(const std::string& text) {
+    write_file(users_file(), text);
+    ASSERT_EQ(user_load(users_file().string()), 0);
+  }
+
+  fs::path dir_;
+};
+
+// Hashes made with `openssl passwd -1`.
+constexpr const char* kSecretHash = "$1$7d1ZKX5F$d2aGUoNjVu30rj26rho90/";        // secret
+constexpr const char* kBlankHash = "$1$lx0omuBq$5dEG8AEfdfUeLe/sxn9BC1";         // "pass word"
+constexpr const char* kCommaHash = "$1$12345678$jpmCCWoVmG5qrbTcR4nUg0";         // "longer password with, comma"
+constexpr const char* kShortSaltHash = "$1$xy$3P7miAef5gn2ShGTkWpsn1";            // hunter2
+
+TEST_F(UsersTest, ReadsTheFileAsWrittenAndSavesItBackUnchanged) {
+  std::string long_name(3000, 'x');
+  load(std::string("| a comment\n") + " indented,ignored\n" + "nocomma\n" + "\n" +
+       "alice," + kSecretHash + ",Alice Liddell,/home/alice,3\r\n" +
+       "bob," + kBlankHash + "\n" +  // only a login and a hash
+       "carol," + kCommaHash + "," + long_name + ",/home/carol,-2\n" +
+       "dave,,Dave,/home/dave,x\n");
+  ASSERT_EQ(user_list().size(), 4u);
+
+  const UserRecord* alice = user_find("alice");
+  ASSERT_NE(alice, nullptr);
+  EXPECT_EQ(alice->full_name, "Alice Liddell");
+  EXPECT_EQ(alice->home, "/home/alice");  // the CR of a CR LF line is not part of it
+  EXPECT_EQ(alice->group, 3);
+  const UserRecord* bob = user_find("bob");
+  ASSERT_NE(bob, nullptr);
+  EXPECT_EQ(bob->full_name, "");
+  EXPECT_EQ(bob->home, "");
+  EXPECT_EQ(bob->group, 0);
+  EXPECT_EQ(user_find("carol")->full_name, long_name);  // lines of any length
+  EXPECT_EQ(user_find("carol")->group, -2);
+  EXPECT_EQ(user_find("dave")->group, 0);
+  EXPECT_EQ(user_find("indented"), nullptr);
+  EXPECT_EQ(user_find("nocomma"), nullptr);
+
+  std::string before = read_file(users_file());
+  ASSERT_EQ(user_save(), 0);
+  std::string first = read_file(users_file());
+  EXPECT_EQ(read_file(dir_.string() + "/users~"), before);
+  EXPECT_EQ(mode_of(users_file()), 0600u);
+
+  ASSERT_EQ(user_load(users_file().string()), 0);
+  ASSERT_EQ(user_save(), 0);
+  EXPECT_EQ(read_file(users_file()), first);  // stable: no reordering on each save
+  ASSERT_EQ(user_list().size(), 4u);
+  EXPECT_EQ(user_find("carol")->full_name, long_name);
+  EXPECT_EQ(user_find("alice")->password_hash, kSecretHash);
+}
+
+TEST_F(UsersTest, FindsByLoginDottedFullNameAndInitials) {
+  load(std::string("eve,") + kSecretHash + ",Eve Ray Moss,/home/eve,0\n" +
+       "Ann," + kSecretHash + ",Ann Lee,/home/ann,0\n" +
+       "nameless," + kSecretHash + ",,/home/x,0\n");
+  EXPECT_EQ(user_find("eve")->login, "eve");
+  EXPECT_EQ(user_find("EVE")->login, "eve");
+  EXPECT_EQ(user_find("ann")->login, "Ann");
+  EXPECT_EQ(user_find("eve.ray.moss")->login, "eve");
+  EXPECT_EQ(user_find("Eve.Ray.Moss")->login, "eve");
+  EXPECT_EQ(user_find("e.r.moss")->login, "eve");
+  EXPECT_EQ(user_find("a.lee")->login, "Ann");
+  EXPECT_EQ(user_find("ann.lee")->login, "Ann");
+  EXPECT_EQ(user_find("ray.moss"), nullptr);
+  EXPECT_EQ(user_find("moss"), nullptr);
+  EXPECT_EQ(user_find(""), nullptr);  // never the user without a full name
+  EXPECT_TRUE(user_exists("A.LEE"));
+  EXPECT_EQ(user_home("e.r.moss"), "/home/eve");
+  EXPECT_EQ(user_full_name("nobody"), "");
+}
+
+TEST_F(UsersTest, ChecksPasswordsAgainstCryptHashes) {
+  load(std::string("alice,") + kSecretHash + ",,,0\n" + "bob," + kBlankHash + ",,,0\n" +
+       "carol," + kCommaHash + ",,,0\n" + "dan," + kShortSaltHash + ",,,0\n" + "nohash,,,,0\n");
+  EXPECT_EQ(user_check_password("alice", "secret"), 0);
+  EXPECT_EQ(user_check_password("ALICE", "secret"), 0);
+  EXPECT_EQ(user_check_password("bob", "pass word"), 0);
+  EXPECT_EQ(user_check_password("carol", "longer password with, comma"), 0);
+  EXPECT_EQ(user_check_password("dan", "hunter2"), 0);
+
+  EXPECT_EQ(user_check_password("alice", "Secret"), 2);
+  EXPECT_EQ(user_check_password("alice", "secret "), 2);
+  EXPECT_EQ(user_check_password("bob", "secret"), 2);
+  EXPECT_EQ(user_check_password("alice", ""), 1);
+  EXPECT_EQ(user_check_password("nobody", "secret"), 1);
+  EXPECT_EQ(user_check_password("nohash", ""), 1);
+  EXPECT_EQ(user_check_password("nohash", "anything"), 1);
+}
+
+TEST_F(UsersTest, EveryChangeIsSavedAndLogged) {
+  load("");
+  ASSERT_EQ(user_add("alice", "first", "Alice Liddell", "/home/alice", 1), 0);
+  ASSERT_EQ(user_add("bob", "first", "", "/home/bob", 0), 0);
+  const std::string hash = user_find("alice")->password_hash;
+  EXPECT_EQ(hash.substr(0, 3), "$1$");
+  EXPECT_EQ(hash.find('$', 3), 8u);  // five salt characters
+  EXPECT_NE(hash.substr(3, 5), user_find("bob")->password_hash.substr(3, 5));
+  EXPECT_EQ(user_check_password("alice", "first"), 0);
+
+  EXPECT_EQ(user_set_password("ALICE", "second"), 1);
+  EXPECT_EQ(user_set_home("alice", "/srv/alice"), 1);
+  EXPECT_EQ(user_set_name("alice", "Alice L"), 1);
+  EXPECT_EQ(user_set_group("alice", 4), 1);
+  EXPECT_EQ(user_remove("BOB"), 0);
+  EXPECT_EQ(user_set_password("bob", "x"), 0);
+  EXPECT_EQ(user_remove("bob"), 1);
+
+  std::string log = changes();
+  std::string expected = "add:alice," + hash + ",Alice Liddell,/home/alice,1\n";
+  ASSERT_EQ(log.substr(0, expected.size()), expected);
+  EXPECT_NE(log.find("\nadd:bob,$1$"), std::string::npos);
+  EXPECT_NE(log.find("\npass:alice,second\ndir:alice,/srv/alice\nname:alice,Alice L\n"
+                     "group:alice,4\nremove:bob\n"),
+            std::string::npos);
+  EXPECT_EQ(mode_of(dir_ / "changes"), 0600u);
+
+  // What was saved is what reloads.
+  ASSERT_EQ(user_load(users_file().string()), 0);
+  ASSERT_EQ(user_list().size(), 1u);
+  const UserRecord* alice = user_find("alice");
+  EXPECT_EQ(alice->home, "/srv/alice");
+  EXPECT_EQ(alice->full_name, "Alice L");
+  EXPECT_EQ(alice->group, 4);
+  EXPECT_EQ(user_check_password("alice", "second"), 0);
+  EXPECT_EQ(user_check_password("alice", "first"), 2);
+  EXPECT_EQ(mode_of(users_file()), 0600u);
+  EXPECT_EQ(mode_of(dir_.string() + "/users~"), 0600u);
+}
+
+TEST_F(UsersTest, RefusesWhatTheFileCannotCarryAndLeavesItUnchanged) {
+  load(std::string("alice,") + kSecretHash + ",Alice,/home/alice,0\n");
+  ASSERT_EQ(user_save(), 0);
+  const std::string before = read_file(users_file());
+
+  EXPECT_EQ(user_add("bob", "pw", "Bob, Jr", "/home/bob", 0), 3);
+  EXPECT_NE(user_last_error().find("comma"), std::string::npos);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", "/home/b\nob", 0), 3);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string("/home/b\0b", 9), 0), 3);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string(256, 'h'), 0), 3);
+  EXPECT_EQ(user_add("b,ob", "pw", "", "", 0), 3);
+  EXPECT_EQ(user_add("bo b", "pw", "", "", 0), 3);
+  EXPECT_EQ(user_add("|bob", "pw", "", "", 0), 3);
+  EXPECT_EQ(user_add("", "pw", "", "", 0), 3);
+  EXPECT_EQ(user_add("bob", "pw\nadd:evil,x", "", "", 0), 3);
+  EXPECT_EQ(user_add("Alice", "pw", "", "", 0), 4);  // the same user in another case
+  EXPECT_EQ(user_set_name("alice", "A, B"), 0);
+  EXPECT_EQ(user_set_home("alice", "/x\r"), 0);
+  EXPECT_EQ(user_set_password("alice", "a\rb"), 0);
+
+  EXPECT_EQ(read_file(users_file()), before);
+  EXPECT_FALSE(fs::exists(dir_ / "changes"));
+  EXPECT_EQ(user_list().size(), 1u);
+  EXPECT_EQ(user_find("alice")->full_name, "Alice");
+  EXPECT_EQ(user_check_password("alice", "secret"), 0);
+}
+
+// Every change fails to save under a file-size limit and leaves the table as
+// it was (run in a child process).
+bool changes_fail_past_limit(std::size_t limit_bytes) {
+  std::signal(SIGXFSZ, SIG_IGN);
+  rlimit limit{static_cast<rlim_t>(limit_bytes), static_cast<rlim_t>(limit_bytes)};
+  if (::setrlimit(RLIMIT_FSIZE, &limit) != 0) return false;
+  return user_add("bob", "pw", std::string(500, 'b'), "/home/bob", 0) == 1 &&
+         user_find("bob") == nullptr && user_set_name("alice", std::string(500, 'a')) == 0 &&
+         user_find("alice")->full_name == "Alice" &&
+         user_last_error().find("could not be written") != std::string::npos;
+}
+
+TEST_F(UsersTest, AFailedWriteKeepsTheOldFileAndTheTable) {
+  load(std::string("alice,") + kSecretHash + ",Alice,/home/alice,0\n");
+  const std::string before = read_file(users_file());
+  // In a child whose file-size limit is below what the change would write:
+  // the write fails, the old file stays and the table is as it was.
+  EXPECT_EXIT(std::exit(changes_fail_past_limit(before.size() + 16) ? 0 : 1),
+              ::testing::ExitedWithCode(0), "");
+  EXPECT_EQ(read_file(users_file()), before);
+  EXPECT_FALSE(fs::exists(dir_ / "changes"));
+}
+
+TEST_F(UsersTest, GroupOfAUser) {
+  write_file(dir_ / "groups", "#0\n%group.name: default\n#5\n%group.name: staff\n");
+  load(std::string("alice,") + kSecretHash + ",Alice,/home/alice,5\n" + "bob,x,Bob,/home/bob,7\n");
+  // No groups loaded: nobody has a set, so every service refuses.
+  EXPECT_EQ(user_group("alice"), nullptr);
+  ASSERT_EQ(groups_load((dir_ / "groups").string()), 0);
+  EXPECT_EQ(user_group("alice")->text("group.name"), "staff");
+  EXPECT_EQ(user_group("ALICE")->number, 5);
+  EXPECT_EQ(user_group("bob")->text("group.name"), "default");  // group 7 has no set
+  EXPECT_EQ(user_group("stranger")->number, 0);
+  EXPECT_EQ(user_group("")->number, 0);
+}
+
+TEST(RandomPassword, HasTheAskedLengthAndDiffers) {
+  std::string a = random_password(12), b = random_password(12);
+  EXPECT_EQ(a.size(), 12u);
+  EXPECT_NE(a, b);
+  EXPECT_EQ(a.find_first_not_of("abcdefghijkmnpqrstuvwxyzABCDEFGHJKLMNPQRSTUVWXYZ23456789"),
+            std::string::npos);
+}
+
+}  // namespace
+}  // namespace velmor
