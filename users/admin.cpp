@@ -86,42 +86,42 @@ struct Request {
   int group = 0;
 };
 
-// Options of the daemon that take a value; they are skipped here.
-bool daemon_option_with_value(std::string_view arg) {
-  return arg == "--root" || arg == "--pid-file" || arg == "--control" || arg == "--bind";
+Request& request() {
+  static Request r;
+  return r;
 }
 
-// The request, or an error text.
-std::optional<std::string> parse(int argc, char** argv, Request& req) {
-  for (int i = 1; i < argc; ++i) {
-    std::string_view arg = argv[i];
-    auto value = [&]() -> const char* { return i + 1 < argc ? argv[++i] : nullptr; };
-    Request::Action action = arg == "--adduser"  ? Request::Action::add
-                             : arg == "--passwd" ? Request::Action::passwd
-                             : arg == "--deluser" ? Request::Action::remove
-                                                  : Request::Action::none;
-    if (action != Request::Action::none) {
-      if (req.action != Request::Action::none) return "give only one of --adduser, --passwd, --deluser";
-      const char* name = value();
-      if (!name) return strprintf("%s needs a user name", argv[i]);
-      req.action = action;
-      req.name = name;
-    } else if (arg == "--password" || arg == "--full-name" || arg == "--home" || arg == "--group") {
-      const char* text = value();
-      if (!text) return strprintf("%.*s needs a value", static_cast<int>(arg.size()), arg.data());
-      if (arg == "--password") req.password = text;
-      if (arg == "--full-name") req.full_name = text;
-      if (arg == "--home") req.home = text;
-      if (arg == "--group") {
-        std::string_view g = text;
-        auto [end, ec] = std::from_chars(g.data(), g.data() + g.size(), req.group);
-        if (ec != std::errc() || end != g.data() + g.size()) return "--group needs a number";
-      }
-    } else if (daemon_option_with_value(arg)) {
-      ++i;
-    }
+// Fills `req` from one option and its value; an error text when it is wrong.
+std::optional<std::string> take_option(std::string_view option, const char* value, Request& req) {
+  if (!value) return strprintf("%.*s needs a value", static_cast<int>(option.size()), option.data());
+  Request::Action action = option == "--adduser"  ? Request::Action::add
+                           : option == "--passwd" ? Request::Action::passwd
+                           : option == "--deluser" ? Request::Action::remove
+                                                   : Request::Action::none;
+  if (action != Request::Action::none) {
+    if (req.action != Request::Action::none) return "give only one of --adduser, --passwd, --deluser";
+    req.action = action;
+    req.name = value;
+  } else if (option == "--password") {
+    req.password = value;
+  } else if (option == "--full-name") {
+    req.full_name = value;
+  } else if (option == "--home") {
+    req.home = value;
+  } else {
+    std::string_view g = value;
+    auto [end, ec] = std::from_chars(g.data(), g.data() + g.size(), req.group);
+    if (ec != std::errc() || end != g.data() + g.size()) return "--group needs a number";
   }
   return std::nullopt;
+}
+
+bool is_user_option(std::string_view arg) {
+  for (std::string_view o : {"--adduser", "--passwd", "--deluser", "--password", "--full-name",
+                             "--home", "--group"}) {
+    if (arg == o) return true;
+  }
+  return false;
 }
 
 // Reads one line from the terminal without echo, after a prompt on stderr.
@@ -168,12 +168,9 @@ std::optional<std::string> new_password(const Request& req, std::string& error) 
   return line;
 }
 
-std::string absolute(const std::string& path) {
-  if (!path.empty() && path[0] == '/') return path;
-  char* cwd = ::getcwd(nullptr, 0);
-  std::string out = cwd ? path_join(cwd, path) : path;
-  std::free(cwd);
-  return out;
+// A configured path: relative ones are under the installation folder.
+std::string in_root(const std::string& path) {
+  return !path.empty() && path[0] == '/' ? path : path_join(paths.root, path);
 }
 
 // Tells a running daemon to reload the user file: a datagram to the control
@@ -222,10 +219,35 @@ int users_init() {
   return 0;
 }
 
-int users_command_line(int argc, char** argv) {
-  Request req;
-  if (auto error = parse(argc, argv, req)) return fail(*error);
-  if (req.action == Request::Action::none) return -1;
+int users_command_options(int& argc, char** argv) {
+  Request& req = request();
+  int kept = 1;
+  bool any = false;
+  for (int i = 1; i < argc; ++i) {
+    std::string_view arg = argv[i];
+    if (!is_user_option(arg)) {
+      argv[kept++] = argv[i];
+      continue;
+    }
+    any = true;
+    const char* value = i + 1 < argc ? argv[++i] : nullptr;
+    if (auto error = take_option(arg, value, req)) {
+      fail(*error);
+      return 2;
+    }
+  }
+  argc = kept;
+  argv[kept] = nullptr;
+  if (!any) return 0;
+  if (req.action == Request::Action::none) {
+    fail("--password, --full-name, --home and --group go with --adduser or --passwd");
+    return 2;
+  }
+  return 1;
+}
+
+int users_command_run() {
+  const Request& req = request();
   if (config_load() != 0) return 1;
   if (::chdir(paths.root.c_str()) != 0) {
     return fail(strprintf("cannot enter %s: %s", paths.root.c_str(), std::strerror(errno)));
@@ -240,7 +262,7 @@ int users_command_line(int argc, char** argv) {
   const UserRecord* user = user_find(req.name);
   switch (req.action) {
     case Request::Action::add: {
-      std::string home = absolute(req.home.value_or(path_join(absolute("home"), req.name)));
+      std::string home = in_root(req.home.value_or(path_join("home", req.name)));
       auto password = new_password(req, error);
       if (!password) return fail(error);
       if (password->empty()) return fail("the password is empty");
@@ -270,11 +292,18 @@ int users_command_line(int argc, char** argv) {
     case Request::Action::none:
       break;
   }
-  if (tell_daemon("reload users")) std::printf("The running suite reloads the user database\n");
+  if (tell_daemon("reload users")) {
+    std::printf("The running suite reloads the user database\n");
+  } else {
+    std::printf("No suite runs at %s: it reads the change when it starts\n", paths.control.c_str());
+  }
   return 0;
 }
 
-int users_make_demo(const std::string& users_file, const std::string& root) {
+int users_make_demo() {
+  config_load_file(paths.master());
+  const std::string& configured = text_of(config.file_user_dbase);
+  std::string users_file = in_root(configured.empty() ? "config/users" : configured);
   int rc = user_load(users_file);
   if (rc != 0 && !(rc == 1 && file_missing(users_file))) {
     std::printf("Couldn't read the user file %s\n", users_file.c_str());
@@ -286,7 +315,7 @@ int users_make_demo(const std::string& users_file, const std::string& root) {
     std::printf("No random source for the demo password\n");
     return 1;
   }
-  std::string home = path_join(absolute(root), "home/demo");
+  std::string home = in_root("home/demo");
   if (user_add("demo", password, "Demo User", home, 0) != 0) {
     std::printf("Couldn't add the demo user: %s\n", user_last_error().c_str());
     return 1;

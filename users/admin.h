@@ -21,13 +21,19 @@ int users_init();
 //   velmor [--root DIR] --deluser NAME
 // The password is read from standard input when not given (asked twice
 // without echo on a terminal). The user file is changed in place, and a
-// running daemon is told to reload it. -1 when argv holds none of these
-// options; otherwise the exit status.
-int users_command_line(int argc, char** argv);
+// running daemon is told to reload it.
+//
+// users_command_options takes these options out of argv, so the daemon's own
+// parser never sees them: 0 none given; 1 a command waits for
+// users_command_run(); 2 bad options (told on stderr).
+int users_command_options(int& argc, char** argv);
+// Runs the waiting command once `paths` is set. The exit status.
+int users_command_run();
 
-// The demo user of a new installation: when the user file holds no user at
-// all, adds "demo" with a random password, home `<root>/home/demo` (absolute)
-// and group 0, and prints the login and password. 0, or 1 on a failure.
-int users_make_demo(const std::string& users_file, const std::string& root);
+// The demo user of a new installation under paths.root: when the user file
+// (file.user.dbase of the master file) holds no user at all, adds "demo" with
+// a random password, home <root>/home/demo and group 0, and prints the login
+// and password. 0, or 1 on a failure.
+int users_make_demo();
 
 }  // namespace velmor
