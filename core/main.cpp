@@ -30,6 +30,7 @@
 #include "core/scheduler.h"
 #include "core/sockets.h"
 #include "core/strfmt.h"
+#include "users/admin.h"
 
 namespace velmor {
 namespace {
@@ -39,6 +40,10 @@ namespace {
 constexpr const char* kUsage =
     "usage: velmor [--root DIR] [--pid-file PATH] [--control PATH] [--bind ADDR]\n"
     "              [--init [--standard-ports]] [--help] [--version]\n"
+    "       velmor [--root DIR] --adduser NAME [--password PW] [--full-name TEXT]\n"
+    "              [--home DIR] [--group N]\n"
+    "       velmor [--root DIR] --passwd NAME [--password PW]\n"
+    "       velmor [--root DIR] --deluser NAME\n"
     "\n"
     "  --root DIR        the installation folder (default /usr/local/velmor); the pid file\n"
     "                    and the control socket then default to DIR/run/velmor.pid and\n"
@@ -50,6 +55,10 @@ constexpr const char* kUsage =
     "                    files that exist are left alone. Services listen on unprivileged\n"
     "                    ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119, web 8000)\n"
     "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80\n"
+    "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
+    "                    --password the password is read from standard input\n"
+    "  --passwd NAME     set a user's password; --deluser NAME removes a user. A running\n"
+    "                    suite is told to reload the user file\n"
     "  --help            this text\n"
     "  --version         the version\n";
 
@@ -179,6 +188,7 @@ int init_installation(const Options& options) {
     if (f.path == "config/templates/master" && install("config/master", f.data)) return 1;
   }
   // Later subsystems add their own first-run steps here (sample users, ...).
+  if (users_make_demo() != 0) return 1;
   std::printf("Velmor installation in %s: %d files written, %d left as they were\n", paths.root.c_str(), written,
               kept);
   return 0;
@@ -380,7 +390,8 @@ int start_and_run() {
 
   log_message("Loading scheduler task entries");
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
-  // users: "Loading user database", "Loading user group options".
+  // "Loading user database", "Loading user group options"; users_init says what failed.
+  if (int rc = users_init()) return fail(nullptr, rc);
   // mail: "Initialising mail system", mail_init().
   log_message("Starting listening sockets");
   if (sockets_init() != 0) {
@@ -407,7 +418,10 @@ int main(int argc, char** argv) {
   // the crash handler writes to it directly.
   std::setvbuf(stdout, nullptr, _IOLBF, 0);
   Options options;
+  int users_command = users_command_options(argc, argv);  // --adduser, --passwd, --deluser
+  if (users_command == 2) return 2;
   if (int rc = parse_command_line(argc, argv, options); rc >= 0) return rc;
+  if (users_command == 1) return users_command_run();
   if (options.init) return init_installation(options);
   return start_and_run();
 }

@@ -4,7 +4,6 @@
 #include <charconv>
 #include <cstdio>
 #include <cstring>
-#include <fstream>
 #include <limits>
 #include <new>
 #include <unordered_map>
@@ -13,6 +12,7 @@
 #include "core/filecache.h"
 #include "core/log.h"
 #include "core/strfmt.h"
+#include "core/textfile.h"
 #include "core/util.h"
 
 namespace velmor {
@@ -257,53 +257,49 @@ int groups_load(const std::string& path) {
   GroupList& g = groups();
   g.path = path;
   g.sets.clear();
-  if (path.empty()) return 1;
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return 1;
   std::vector<std::shared_ptr<GroupOptions>> sets;
   // A key's value is applied when the next key line, group line or the end of
   // the file is reached, so continuation lines can extend it first.
   std::optional<std::string> key;
   std::string value;
   auto apply = [&] {
-    if (key && !sets.empty() && !group_option(*sets.back(), *key, value)) {
-      if (option_index(*key) >= 0) {
-        log_message("Group option value refused: ", *key);
-      }
+    if (key && !sets.empty() && !group_option(*sets.back(), *key, value) &&
+        option_index(*key) >= 0) {
+      log_message("Group option value refused: ", *key);
     }
     key.reset();
   };
-  try {
-    std::string line;
-    while (std::getline(in, line)) {
-      std::string_view text = line;
-      if (!text.empty() && text.back() == '\r') text.remove_suffix(1);
-      if (text.empty() || text[0] == '|' || text[0] == '\r') continue;
-      if (text[0] == '#') {
-        if (auto number = group_line_number(text)) {
-          apply();
-          sets.push_back(std::make_shared<GroupOptions>());
-          sets.back()->number = *number;
-        }
-        continue;
-      }
-      if (text[0] == '%') {
+  auto read_line = [&](std::string_view text) {
+    if (text.empty() || text[0] == '|') return;
+    if (text[0] == '#') {
+      if (auto number = group_line_number(text)) {
         apply();
-        if (sets.empty()) continue;  // a key before the first group
-        std::size_t colon = text.find(':');
-        key = std::string(trim_blanks(text.substr(1, colon == std::string_view::npos ? colon : colon - 1)));
-        value = colon == std::string_view::npos ? std::string()
-                                                 : std::string(drop_leading_blanks(text.substr(colon + 1)));
-        continue;
+        sets.push_back(std::make_shared<GroupOptions>());
+        sets.back()->number = *number;
       }
-      std::string_view more = drop_leading_blanks(text);
-      if (!key || more.empty()) continue;
-      if (!value.empty()) value += ',';
-      value += more;
+      return;  // a "#" without a number is a comment
     }
+    if (text[0] == '%') {
+      apply();
+      if (sets.empty()) return;  // a key before the first group
+      std::size_t colon = text.find(':');
+      key = std::string(trim_blanks(text.substr(1, colon == std::string_view::npos ? colon : colon - 1)));
+      value = colon == std::string_view::npos ? std::string()
+                                               : std::string(drop_leading_blanks(text.substr(colon + 1)));
+      return;
+    }
+    std::string_view more = drop_leading_blanks(text);
+    if (!key || more.empty()) return;
+    if (!value.empty()) value += ',';
+    value += more;
+  };
+  try {
+    std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
+    if (!text) return 1;
+    for_each_line(*text, read_line);
     apply();
   } catch (const std::bad_alloc&) {
-    g.sets = std::move(sets);
+    g.sets = std::move(sets);  // the sets read so far stay
     return 2;
   }
   g.sets = std::move(sets);

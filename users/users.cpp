@@ -12,13 +12,13 @@
 #include <charconv>
 #include <cstdio>
 #include <cstring>
-#include <fstream>
 #include <new>
 #include <optional>
 
 #include "core/filecache.h"
 #include "core/log.h"
 #include "core/strfmt.h"
+#include "core/textfile.h"
 #include "core/util.h"
 #include "users/groups.h"
 
@@ -159,7 +159,6 @@ std::string random_chars(std::size_t count, std::string_view alphabet) {
 std::string new_salt() { return random_chars(5, kCryptAlphabet); }
 
 std::optional<UserRecord> parse_line(std::string_view line) {
-  if (!line.empty() && line.back() == '\r') line.remove_suffix(1);
   if (line.empty() || line[0] == ' ' || line[0] == '\t' || line[0] == '|') return std::nullopt;
   std::size_t comma = line.find(',');
   if (comma == std::string_view::npos) return std::nullopt;
@@ -218,17 +217,15 @@ int user_load(const std::string& path) {
   UserTable& t = table();
   t.path = path;
   for (auto& bucket : t.buckets) bucket.clear();
-  if (path.empty()) return 1;
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return 1;
   try {
-    std::string line;
-    while (std::getline(in, line)) {
+    std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
+    if (!text) return 1;
+    for_each_line(*text, [&](std::string_view line) {
       if (auto user = parse_line(line)) {
         int b = bucket_of(user->login);
         t.buckets[b].push_back(std::make_unique<UserRecord>(std::move(*user)));
       }
-    }
+    });
   } catch (const std::bad_alloc&) {
     return 2;  // the users read so far stay
   }
