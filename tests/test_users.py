@@ -9,14 +9,12 @@ import subprocess
 import tempfile
 import unittest
 
-from harness import Suite, SuiteTestCase
-
-VELMOR = os.environ.get('VELMOR_BIN', os.path.join(os.getcwd(), 'build', 'velmor'))
+from harness import VELMOR_BIN, Suite, SuiteTestCase
 
 
 def velmor(root, *args, stdin=None):
     """Runs the velmor binary on an installation; (returncode, stdout + stderr)."""
-    done = subprocess.run([VELMOR, '--root', root, *args], input=stdin, capture_output=True,
+    done = subprocess.run([VELMOR_BIN, '--root', root, *args], input=stdin, capture_output=True,
                           text=True, timeout=30)
     return done.returncode, done.stdout + done.stderr
 
@@ -121,6 +119,7 @@ class UserAdministration(SuiteTestCase):
 class MissingGroupsFile(unittest.TestCase):
     def test_starts_and_refuses_without_a_default_group(self):
         suite = Suite()
+        self.addCleanup(suite.cleanup)
         os.remove(suite.path('config/groups'))
         suite.start()
         try:
