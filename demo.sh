@@ -11,7 +11,11 @@ ninja -C build-release -j"${VELMOR_JOBS:-$(nproc)}"
 
 root="$PWD/demo"
 if [ ! -f "$root/config/master" ]; then
-  ./build-release/velmor --root "$root" --init
+  # The demo user's random password is shown once by --init; keep it (private)
+  # so that every run can show it again.
+  init_out=$(./build-release/velmor --root "$root" --init)
+  echo "$init_out"
+  (umask 077; echo "$init_out" | grep '^Demo login' > "$root/demo-login" || true)
 fi
 if [ -f "$root/run/velmor.pid" ] && ! kill -0 "$(cat "$root/run/velmor.pid")" 2>/dev/null; then
   echo "Removing the pid file of a suite that is no longer running"
@@ -50,5 +54,6 @@ for key, label in names.items():
     print('  %-13s port %s' % (label, port))
 print('Logs are in demo/logs; Ctrl-C stops the suite.\n')
 PY
+[ -s "$root/demo-login" ] && cat "$root/demo-login" && echo
 wait $pid || true
 wait $pid 2>/dev/null || true
