@@ -35,28 +35,29 @@ bool file_missing(const std::string& path) {
   return path.empty() || (::stat(path.c_str(), &st) != 0 && errno == ENOENT);
 }
 
-// Loads the user file; a missing one leaves the table empty.
-int load_users() {
-  const std::string& path = text_of(config.file_user_dbase);
-  int rc = user_load(path);
+// Loads the user or the groups file with `loader`. A missing file is no
+// failure: `missing` says what follows from it.
+int load_file(const ConfigText& key, int (*loader)(const std::string&), const char* missing,
+              const char* unreadable) {
+  const std::string& path = text_of(key);
+  int rc = loader(path);
   if (rc == 1 && file_missing(path)) {
-    log_message("User database file missing, nobody can log in: ", path);
+    log_message(missing, path);
     return 0;
   }
-  if (rc != 0) log_message("User database file cannot be read: ", path);
+  if (rc != 0) log_message(unreadable, path);
   return rc;
 }
 
-// Loads the groups file; a missing one leaves no default group.
+int load_users() {
+  return load_file(config.file_user_dbase, user_load, "User database file missing, nobody can log in: ",
+                   "User database file cannot be read: ");
+}
+
 int load_groups() {
-  const std::string& path = text_of(config.file_user_groups);
-  int rc = groups_load(path);
-  if (rc == 1 && file_missing(path)) {
-    log_message("User group file missing, every service is refused: ", path);
-    return 0;
-  }
-  if (rc != 0) log_message("User group file cannot be read: ", path);
-  return rc;
+  return load_file(config.file_user_groups, groups_load,
+                   "User group file missing, every service is refused: ",
+                   "User group file cannot be read: ");
 }
 
 // "change pass": 1 when the old password is wrong, 2 changed, 0 failed.

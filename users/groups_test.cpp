@@ -3,27 +3,16 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <sstream>
 
 #include "core/defaults.h"
+#include "users/test_files.h"
 
 namespace velmor {
 namespace {
 
-namespace fs = std::filesystem;
+using namespace testing_files;
 
-std::string read_file(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
-void write_file(const fs::path& path, const std::string& text) {
-  std::ofstream(path, std::ios::binary) << text;
-}
 
 // A local time: 2026-12-07 is a Monday, 2026-12-12 a Saturday.
 std::time_t local(int day, int hour, int minute) {
@@ -40,13 +29,10 @@ std::time_t local(int day, int hour, int minute) {
 class GroupsTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "groups_test.XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    dir_ = pattern;
+    ASSERT_FALSE(scratch_.path().empty());
   }
   void TearDown() override {
     groups_load("");
-    fs::remove_all(dir_);
   }
   std::string file() const { return (dir_ / "groups").string(); }
   void load(const std::string& text) {
@@ -65,7 +51,8 @@ class GroupsTest : public ::testing::Test {
     return out;
   }
 
-  fs::path dir_;
+  ScratchDir scratch_;
+  const fs::path& dir_ = scratch_.path();
 };
 
 TEST_F(GroupsTest, ReadsEveryKindOfLine) {

@@ -198,16 +198,18 @@ bool save_or_undo(Undo undo) {
 }
 
 // Applies a change to one field of a user, saves, and writes the change-log
-// record; puts the field back when the file cannot be written.
+// record "<tag>:<login>,<note>"; puts the field back when the file cannot be
+// written.
 template <typename Field>
-int change_field(std::string_view name, Field UserRecord::*field, Field value,
-                 const std::string& note) {
+int change_field(std::string_view name, Field UserRecord::*field, Field value, const char* tag,
+                 std::string_view note) {
   UserRecord* user = find_login(name);
   if (!user) return refuse(strprintf("no user %.*s", static_cast<int>(name.size()), name.data()));
   Field old = std::move(user->*field);
   user->*field = std::move(value);
   if (!save_or_undo([&] { user->*field = std::move(old); })) return 0;
-  user_change_note(note);
+  user_change_note(strprintf("%s:%s,%.*s", tag, user->login.c_str(), static_cast<int>(note.size()),
+                             note.data()));
   return 1;
 }
 
@@ -313,35 +315,21 @@ int user_set_password(std::string_view name, std::string_view password) {
   if (std::string why = password_problem(password); !why.empty()) return refuse(why);
   std::string hash = md5_crypt(password, new_salt());
   if (hash.size() > kMaxHash) return refuse("the password hash is too long");
-  const UserRecord* user = find_login(name);
-  std::string note = user ? strprintf("pass:%s,%.*s", user->login.c_str(),
-                                      static_cast<int>(password.size()), password.data())
-                          : std::string();
-  return change_field(name, &UserRecord::password_hash, std::move(hash), note);
+  return change_field(name, &UserRecord::password_hash, std::move(hash), "pass", password);
 }
 
 int user_set_home(std::string_view name, std::string_view home) {
   if (std::string why = home_problem(home); !why.empty()) return refuse(why);
-  const UserRecord* user = find_login(name);
-  std::string note = user ? strprintf("dir:%s,%.*s", user->login.c_str(),
-                                      static_cast<int>(home.size()), home.data())
-                          : std::string();
-  return change_field(name, &UserRecord::home, std::string(home), note);
+  return change_field(name, &UserRecord::home, std::string(home), "dir", home);
 }
 
 int user_set_name(std::string_view name, std::string_view full_name) {
   if (std::string why = field_problem("full name", full_name); !why.empty()) return refuse(why);
-  const UserRecord* user = find_login(name);
-  std::string note = user ? strprintf("name:%s,%.*s", user->login.c_str(),
-                                      static_cast<int>(full_name.size()), full_name.data())
-                          : std::string();
-  return change_field(name, &UserRecord::full_name, std::string(full_name), note);
+  return change_field(name, &UserRecord::full_name, std::string(full_name), "name", full_name);
 }
 
 int user_set_group(std::string_view name, int group) {
-  const UserRecord* user = find_login(name);
-  std::string note = user ? strprintf("group:%s,%d", user->login.c_str(), group) : std::string();
-  return change_field(name, &UserRecord::group, group, note);
+  return change_field(name, &UserRecord::group, group, "group", std::to_string(group));
 }
 
 int user_remove(std::string_view name) {

@@ -6,28 +6,17 @@
 
 #include <csignal>
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <sstream>
 
 #include "core/config.h"
 #include "users/groups.h"
+#include "users/test_files.h"
 
 namespace velmor {
 namespace {
 
-namespace fs = std::filesystem;
+using namespace testing_files;
 
-std::string read_file(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
-void write_file(const fs::path& path, const std::string& text) {
-  std::ofstream(path, std::ios::binary) << text;
-}
 
 unsigned mode_of(const fs::path& path) {
   struct stat st {};
@@ -38,9 +27,7 @@ unsigned mode_of(const fs::path& path) {
 class UsersTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "users_test.XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    dir_ = pattern;
+    ASSERT_FALSE(scratch_.path().empty());
     config.file_user_changes = (dir_ / "changes").string();
     config.file_user_exec.reset();
   }
@@ -48,7 +35,6 @@ class UsersTest : public ::testing::Test {
     config.file_user_changes.reset();
     user_load("");
     groups_load("");
-    fs::remove_all(dir_);
   }
   fs::path users_file() const { return dir_ / "users"; }
   std::string changes() const { return read_file(dir_ / "changes"); }
@@ -58,7 +44,8 @@ class UsersTest : public ::testing::Test {
     ASSERT_EQ(user_load(users_file().string()), 0);
   }
 
-  fs::path dir_;
+  ScratchDir scratch_;
+  const fs::path& dir_ = scratch_.path();
 };
 
 // Hashes made with `openssl passwd -1`.
