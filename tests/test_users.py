@@ -9,7 +9,7 @@ import subprocess
 import tempfile
 import unittest
 
-from harness import VELMOR_BIN, VELMORCTL_BIN, Suite, SuiteTestCase
+from harness import VELMOR_BIN, Suite, SuiteTestCase
 
 
 def velmor(root, *args, stdin=None):
@@ -68,7 +68,6 @@ class InitMakesADemoUser(unittest.TestCase):
         self.assertNotIn(password, out)
 
 
-@unittest.skipUnless(os.path.exists(VELMORCTL_BIN), 'velmorctl is not built yet')
 class UserAdministration(SuiteTestCase):
     def change_pass(self, user, old, new):
         rc, out = self.suite.ctl('change pass %s %s %s' % (user, old, new))
