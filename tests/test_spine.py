@@ -157,9 +157,9 @@ class Init(unittest.TestCase):
         self.root = tempfile.mkdtemp(prefix='velmor-init-')
         self.addCleanup(shutil.rmtree, self.root, True)
 
-    def init(self, *args):
+    def init(self, *args, env=None):
         return subprocess.run([VELMOR_BIN, '--root', self.root, '--init'] + list(args), stdin=subprocess.DEVNULL,
-                              stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, timeout=20)
+                              stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, timeout=20, env=env)
 
     def master(self):
         keys = {}
@@ -194,9 +194,12 @@ class Init(unittest.TestCase):
             self.assertEqual(f.read(), 'mine\n')
         self.assertEqual(self.master()['smtp.sock.port'], '2525')
 
-    def test_standard_ports(self):
-        self.assertEqual(self.init('--standard-ports').returncode, 0)
+    def test_standard_ports_and_the_host_name_from_the_environment(self):
+        env = dict(os.environ, **{'inet$hostname': 'gateway', 'inet$localdomain': 'example.org'})
+        self.assertEqual(self.init('--standard-ports', env=env).returncode, 0)
         keys = self.master()
+        self.assertEqual(keys['server.name'], 'gateway.example.org')
+        self.assertEqual(keys['mail.domains'], 'gateway.example.org, localhost')
         self.assertEqual([keys[k] for k in ('smtp.sock.port', 'pop.sock.port', 'imap.sock.port', 'nntp.sock.port',
                                             'web.sock.port')], ['25', '110', '143', '119', '80'])
 
