@@ -295,7 +295,7 @@ void accept_step(SocketRecord& listener) {
   auto& d = state();
   const int service = listener.service;
   const ServiceHandlers* h = service_handlers(service);
-  for (int i = 0; i < 64; ++i) {
+  for (int i = 0; i < 128; ++i) {  // a bounded batch keeps the other records served
     int limit = service_limit(service);
     if (limit >= 0 && limit_count(service) >= limit) return;  // the rest wait in the backlog
     if (log_mask & logfac::proxy) log_message("Accept request (service):", std::to_string(service), logfac::proxy);
