@@ -96,6 +96,8 @@ VPID=
 PPORT=$(free_port)
 PF="$WORK/postfix"
 mkdir -p "$PF_CONF" "$PF/queue" "$PF/data"
+chmod 755 "$WORK" "$PF"  # Postfix's own processes run as its user
+$SUDO chown postfix "$PF/data"
 cat >"$PF_CONF/main.cf" <<EOT
 compatibility_level = 3.6
 queue_directory = $PF/queue
@@ -114,6 +116,7 @@ default_transport = discard
 local_transport = discard
 relay_transport = discard
 maillog_file = $PF/maillog
+maillog_file_prefixes = $PF
 default_process_limit = $((SESSIONS + 20))
 smtpd_client_connection_rate_limit = 0
 EOT

@@ -164,6 +164,65 @@ CacheFile queue_create_incoming() {
   return f;
 }
 
+PendingIncoming queue_open_incoming_pending() {
+  PendingIncoming p;
+  p.path = queue_new_incoming_name();
+  if (p.path.empty()) return p;
+  p.hidden = path_join(path_dir(p.path), "." + std::string(path_leaf(p.path)) + ".new");
+  p.file = filecache_open(p.hidden, FileMode::append);
+  if (!p.file) unlink(p.hidden.c_str());
+  return p;
+}
+
+namespace {
+struct Commit {
+  std::string path, hidden;
+  int owner;
+};
+std::vector<Commit> g_commits;
+}  // namespace
+
+void queue_commit_later(std::string path, std::string hidden, int owner) {
+  g_commits.push_back({std::move(path), std::move(hidden), owner});
+}
+
+bool queue_commit_pending() { return !g_commits.empty(); }
+
+void queue_commit(const std::function<void(int owner, int error)>& done) {
+  std::vector<Commit> batch;
+  batch.swap(g_commits);
+  if (batch.empty()) return;
+  std::string dir = incoming_dir();
+  int dir_fd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  int error = dir_fd < 0 ? errno : (syncfs(dir_fd) == 0 ? 0 : errno);
+  std::vector<int> errors(batch.size(), error);
+  bool renamed = false;
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    if (errors[i] == 0 && rename(batch[i].hidden.c_str(), batch[i].path.c_str()) != 0) errors[i] = errno;
+    if (errors[i] == 0) renamed = true;
+  }
+  if (renamed && fsync(dir_fd) != 0) {
+    // The renames may not last: take them back rather than acknowledge them.
+    int e = errno;
+    for (std::size_t i = 0; i < batch.size(); ++i)
+      if (errors[i] == 0) {
+        unlink(batch[i].path.c_str());
+        errors[i] = e;
+      }
+  }
+  if (dir_fd >= 0) close(dir_fd);
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    if (errors[i] == 0) {
+      queue_add_incoming(batch[i].path);
+    } else {
+      unlink(batch[i].hidden.c_str());
+      log_write(strprintf("Mail queue: %s not queued: %s", batch[i].path.c_str(), error_text(errors[i]).c_str()),
+                logchan::errors);
+    }
+    done(batch[i].owner, errors[i]);
+  }
+}
+
 void queue_file_discard(CacheFile& file) {
   if (!file) return;
   std::string path = filecache_path(file);

@@ -51,6 +51,24 @@ enum class ErrorMail {
 ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file,
                           bool headers_only = false);
 
+// Incoming files committed in groups (the SMTP server): the message is
+// written to its hidden name and flushed without a sync of its own; one
+// commit then syncs the file system once, renames every finished file into
+// place and syncs the folder once, so a burst of messages costs two syncs in
+// all rather than two each. Nothing is acknowledged before its commit.
+struct PendingIncoming {
+  CacheFile file;         // writes go to the hidden name
+  std::string path;       // the final name
+  std::string hidden;     // the name it is written under
+};
+PendingIncoming queue_open_incoming_pending();
+// Queues a flushed file for the next commit; `owner` identifies who waits.
+void queue_commit_later(std::string path, std::string hidden, int owner);
+bool queue_commit_pending();
+// Runs the commit; `done(owner, error)` is called for each file (error 0:
+// the file is in place, durable and in the incoming list).
+void queue_commit(const std::function<void(int owner, int error)>& done);
+
 // Throws away an unfinished queue file (and the name reserved for it).
 void queue_file_discard(CacheFile& file);
 

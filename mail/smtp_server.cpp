@@ -4,9 +4,13 @@
 // place; replies never overrun the output buffer (parsing waits while the
 // client does not read); overlong lines are refused without losing the
 // transaction.
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
 #include <ctime>
 #include <memory>
+#include <unordered_map>
 
 #include "core/config.h"
 #include "core/globals.h"
@@ -29,6 +33,7 @@ constexpr int reply = 20;       // reply being sent, then a command
 constexpr int command = 30;     // waiting for a command
 constexpr int data = 40;        // receiving message data
 constexpr int reply_data = 41;  // the 354 being sent, then message data
+constexpr int committing = 42;  // the message waits for its group commit
 }  // namespace state
 
 constexpr std::uint32_t kIdVerify = 0x80;
@@ -42,7 +47,12 @@ const char* const kLocalError = "451 Requested action aborted: local error in pr
 struct SmtpSession final : SessionData {
   std::string received;  // the Received: text made at accept
   std::string trace;     // received, its date line and the X-Sender line
-  CacheFile queue;       // the queue file of the transaction
+  CacheFile queue;       // the queue file of the transaction (its hidden name)
+  std::string queue_path;  // the name it gets once committed
+  std::string queue_hidden;
+  std::uint64_t serial = 0;  // identifies the session to the group commit
+  bool committed = false;
+  int commit_error = 0;
   int denial = 0;        // 1 reject list, 2 not a local user, 3 may not send now
   int recipients = 0;
   bool write_failed = false;
@@ -60,6 +70,10 @@ struct SmtpSession final : SessionData {
 };
 
 SmtpSession& session(SocketRecord& r) { return r.session_as<SmtpSession>(); }
+
+// Sessions waiting for the group commit: serial -> descriptor.
+std::unordered_map<std::uint64_t, int> g_waiting;
+std::uint64_t g_next_serial = 1;
 
 void reply(SocketRecord& r, std::string_view text) {
   // kReplyRoom is reserved before every command, so this always fits.
@@ -96,11 +110,14 @@ void cmd_mail(SocketRecord& r, SmtpSession& s, std::string_view arg) {
     std::time_t now = server_now ? server_now : std::time(nullptr);
     s.trace = s.received + ";\r\n\t" + mail_date_text(now) + "\r\n";
     s.trace += "X-Sender: " + (sender.empty() ? std::string("Unknown") : std::string(sender)) + "\r\n";
-    s.queue = queue_create_incoming();
-    if (!s.queue) {
+    PendingIncoming p = queue_open_incoming_pending();
+    if (!p.file) {
       reply(r, kLocalError);
       return;
     }
+    s.queue = std::move(p.file);
+    s.queue_path = std::move(p.path);
+    s.queue_hidden = std::move(p.hidden);
     std::string line = "MAIL " + std::string(line_cut(arg)) + "\r\n";
     if (filecache_write(s.queue, line) != 0) {
       s.discard();
@@ -250,18 +267,44 @@ void commands(SocketRecord& r, SmtpSession& s) {
   if (r.state == sockstate::closing) r.read_buf.clear();
 }
 
+// The whole message is in: it is flushed now and committed with every other
+// message finished in this pass; the reply waits for that commit.
 void finish_message(SocketRecord& r, SmtpSession& s) {
-  std::string path = filecache_path(s.queue);
-  int rc = s.write_failed ? 1 : filecache_close(s.queue);
+  int rc = s.write_failed ? EIO : filecache_purge(s.queue);
   if (rc != 0) {
-    log_write("SMTP: message not queued, the queue file could not be written: " + path, logchan::errors);
+    log_write("SMTP: message not queued, the queue file could not be written: " + s.queue_path, logchan::errors);
+    unlink(s.queue_hidden.c_str());
     s.discard();
     reply(r, kLocalError);
-  } else {
-    queue_add_incoming(path);
-    reply(r, "250 OK\r\n");
+    r.state = state::reply;
+    return;
   }
-  s.discard();
+  s.serial = g_next_serial++;
+  g_waiting[s.serial] = r.fd;
+  queue_commit_later(s.queue_path, s.queue_hidden, static_cast<int>(s.serial));
+  s.committed = false;
+  r.state = state::committing;
+  r.want_write = true;  // the write handler runs the commit in the next pass
+}
+
+void commit_done(int owner, int error) {
+  auto it = g_waiting.find(static_cast<std::uint64_t>(owner));
+  if (it == g_waiting.end()) return;
+  SocketRecord* r = record_for(it->second);
+  g_waiting.erase(it);
+  if (!r || r->closed || r->service != svc::smtp || !r->session) return;
+  SmtpSession& s = session(*r);
+  if (s.serial != static_cast<std::uint64_t>(owner)) return;
+  s.committed = true;
+  s.commit_error = error;
+}
+
+// Tells the client how its commit went.
+void commit_reply(SocketRecord& r, SmtpSession& s) {
+  reply(r, s.commit_error == 0 ? "250 OK\r\n" : kLocalError);
+  s.committed = false;
+  s.recipients = 0;
+  r.want_write = false;
   r.state = state::reply;
 }
 
@@ -316,6 +359,12 @@ int smtp_read(SocketRecord& r, long) {
 }
 
 int smtp_write(SocketRecord& r) {
+  if (r.state == state::committing) {
+    SmtpSession& s = session(r);
+    if (!s.committed && queue_commit_pending()) queue_commit(commit_done);
+    if (!s.committed) return 0;
+    commit_reply(r, s);
+  }
   if (!r.write_buf.empty() && socket_send(r) < 0) return 1;
   if (r.write_buf.empty()) {
     if (r.state == sockstate::closing) return 1;
@@ -328,7 +377,12 @@ int smtp_write(SocketRecord& r) {
 }
 
 void smtp_release(SocketRecord& r) {
-  if (r.session) session(r).discard();
+  if (!r.session) return;
+  SmtpSession& s = session(r);
+  // A message waiting for its commit is still committed (it was received
+  // whole), but nobody waits for the answer.
+  if (s.serial) g_waiting.erase(s.serial);
+  s.discard();
 }
 
 }  // namespace
