@@ -50,6 +50,13 @@ struct GroupOptions {
   bool permits(std::string_view key, std::time_t now = 0) const;
 };
 
+// The permission rule for a connection's or a user's set: a missing set (no
+// groups file) refuses everything.
+inline bool group_permits(const std::shared_ptr<const GroupOptions>& set, std::string_view key,
+                          std::time_t now = 0) {
+  return set && set->permits(key, now);
+}
+
 // Replaces the list with the file's sets. A missing file leaves no sets at
 // all (no default group). 0; 1 cannot open; 2 no memory.
 int groups_load(const std::string& path);

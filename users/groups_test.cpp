@@ -156,9 +156,11 @@ TEST_F(GroupsTest, ReloadKeepsASetALiveConnectionHolds) {
   EXPECT_FALSE(held->permits("mail.pop.fetch"));
   EXPECT_EQ(group_default()->text("group.name"), "new");
 
-  // A missing file leaves no default group at all.
+  // A missing file leaves no default group at all, and no set refuses.
   EXPECT_EQ(groups_load((dir_ / "missing").string()), 1);
   EXPECT_EQ(group_default(), nullptr);
+  EXPECT_FALSE(group_permits(group_default(), "mail.pop.fetch"));
+  EXPECT_TRUE(group_permits(held, "mail.imap.fetch"));
   EXPECT_EQ(held->text("group.name"), "old");
 }
 
