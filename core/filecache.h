@@ -51,15 +51,20 @@ class CacheFile {
   std::shared_ptr<FileCacheEntry> entry_;
 };
 
-// Raises cache.max to 32768, sets the per-file limit from cache.big and makes
-// the private tmp folder. 0 = done.
+// Raises cache.max to 32768, sets the per-file limit from cache.big (1 MB
+// when it is 0) and the memory kept by unused entries from cache.max (16 MB
+// when it is 0), and makes the private tmp folder. 0 = done; 1 = the tmp
+// folder cannot be made.
 int filecache_init();
 // Drops every unused entry and writes the statistics line (channel 0).
 void filecache_shutdown();
 
 // Opens `path` in `mode`; an empty handle on failure (missing file in read
 // mode, a second writer, no memory, a path too long). A second writer on a
-// file that already has one is always refused.
+// file that already has one is always refused, and so is a writer on a file
+// that readers hold open. Readers share an append or update writer's window;
+// a file being rewritten (write mode) is seen as it is on disk until its
+// close puts the new one in place.
 CacheFile filecache_open(const std::string& path, FileMode mode);
 
 // Brings the window over `offset` and returns how many bytes of the file are
