@@ -1,83 +1,21 @@
-#include "mail/queue.h"
-
-#include <dirent.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
-#include <cstdlib>
-#include <fstream>
-#include <sstream>
-
-#include "core/config.h"
-#include "core/filecache.h"
-#include "core/globals.h"
-#include "mail/queue_internal.h"
+#include "mail/queue_test_fixture.h"
 
 namespace velmor {
 namespace {
 
-std::string slurp(const std::string& path) {
-  std::ifstream f(path, std::ios::binary);
-  std::stringstream s;
-  s << f.rdbuf();
-  return s.str();
-}
-
-void spit(const std::string& path, const std::string& text) {
-  std::ofstream f(path, std::ios::binary);
-  f << text;
-}
-
-std::vector<std::string> listing(const std::string& dir) {
-  std::vector<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (dirent* e = readdir(d))
-      if (std::string(e->d_name) != "." && std::string(e->d_name) != "..") names.emplace_back(e->d_name);
-    closedir(d);
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
-class QueueTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    char tmpl[] = "/tmp/velmor-queue-test.XXXXXX";
-    root = mkdtemp(tmpl);
-    config_reset();
-    paths.tmp_dir = root + "/tmp";
-    filecache_init();
-    config.mail_dir_incoming = root + "/in";
-    config.mail_dir_outgoing = root + "/out";
-    config.mail_dir_oddments = root + "/odd";
-    config.mail_domains = "site.example, localhost";
-    config.admin_email = "postmaster@site.example";
-    mkdir((root + "/in").c_str(), 0770);
-    mkdir((root + "/out").c_str(), 0770);
-    queue_init(1000);
-    queue_scan_incoming();
-    queue_scan_outgoing();
-  }
-  void TearDown() override {
-    filecache_shutdown();
-    std::string cmd = "rm -rf '" + root + "'";
-    ASSERT_EQ(std::system(cmd.c_str()), 0);
-  }
-  std::string in(const std::string& n) { return root + "/in/" + n; }
-  std::string root;
-};
+using QueueTest = QueueFixture;
 
 TEST_F(QueueTest, NamesAreNeverReusedAndUnfinishedFilesVanishAtStart) {
-  spit(in("10000"), "held mail");  // left by an earlier run with the same clock
+  write_file(in("10000"), "held mail");  // left by an earlier run with the same clock
   std::string a = queue_new_incoming_name();
   std::string b = queue_new_incoming_name();
   EXPECT_EQ(a, in("10001"));
   EXPECT_EQ(b, in("10002"));
-  EXPECT_EQ(slurp(in("10000")), "held mail");
+  EXPECT_EQ(read_file(in("10000")), "held mail");
   // The names are reserved under the hidden names the files are written as.
-  EXPECT_EQ(listing(root + "/in"), (std::vector<std::string>{".10001.new", ".10002.new", "10000"}));
+  EXPECT_EQ(folder_names(root + "/in"), (std::vector<std::string>{".10001.new", ".10002.new", "10000"}));
 
   CacheFile f = queue_create_incoming();
   ASSERT_TRUE(f);
@@ -85,10 +23,10 @@ TEST_F(QueueTest, NamesAreNeverReusedAndUnfinishedFilesVanishAtStart) {
   std::string path = filecache_path(f);
   EXPECT_EQ(file_size(path), -1);  // invisible to scans until closed
   ASSERT_EQ(filecache_close(f), 0);
-  EXPECT_EQ(slurp(path), "MAIL FROM:<a@b>\r\n");
+  EXPECT_EQ(read_file(path), "MAIL FROM:<a@b>\r\n");
 
   queue_init(1000);  // a restart: the unfinished reservations go
-  EXPECT_EQ(listing(root + "/in"), (std::vector<std::string>{"10000", "10003"}));
+  EXPECT_EQ(folder_names(root + "/in"), (std::vector<std::string>{"10000", "10003"}));
   queue_scan_incoming();
   EXPECT_EQ(queue_incoming(), (std::list<std::string>{in("10000"), in("10003")}));
   EXPECT_EQ(queue_new_incoming_name(), in("10001"));
@@ -112,7 +50,7 @@ TEST_F(QueueTest, LocalUsersAndThePrimaryDomain) {
 
 TEST_F(QueueTest, TheFirstMatchingRejectLineDecides) {
   config.mail_file_smtpreject = root + "/reject";
-  spit(root + "/reject", "!boss@corp.example\n*@corp.example  spammers\n ignored@x\n\n");
+  write_file(root + "/reject", "!boss@corp.example\n*@corp.example  spammers\n ignored@x\n\n");
   ASSERT_EQ(smtp_reject_load(), 0);
   EXPECT_FALSE(smtp_reject_match("boss@corp.example"));
   EXPECT_TRUE(smtp_reject_match("clerk@corp.example"));
@@ -121,10 +59,10 @@ TEST_F(QueueTest, TheFirstMatchingRejectLineDecides) {
 }
 
 TEST_F(QueueTest, ErrorMailsAreWholeMessagesAndNeverGoToTheNullSender) {
-  spit(in("1"), "MAIL FROM:<ann@far.example>\r\nRCPT TO:<x@site.example>\r\nDATA\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
+  write_file(in("1"), "MAIL FROM:<ann@far.example>\r\nRCPT TO:<x@site.example>\r\nDATA\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
   ASSERT_EQ(send_error_mail("Local user x\ndoes not exist\n.dot\n", "", in("1")), ErrorMail::sent);
   ASSERT_EQ(queue_incoming().size(), 1u);
-  std::string mail = slurp(queue_incoming().front());
+  std::string mail = read_file(queue_incoming().front());
   EXPECT_EQ(mail.substr(0, 66),
             "MAIL FROM:<postmaster@site.example>\r\nRCPT TO:<ann@far.example>\r\nDA");
   EXPECT_NE(mail.find("\r\nX-Loop: 0\r\n\r\nAn error occured whilst trying to send this mail.\r\n"
@@ -138,14 +76,14 @@ TEST_F(QueueTest, ErrorMailsAreWholeMessagesAndNeverGoToTheNullSender) {
 
   // Only the header of a refused message goes back; no file, no attachment.
   EXPECT_EQ(send_error_mail("too big\r\n", "admin@site.example", in("1"), true), ErrorMail::sent);
-  mail = slurp(queue_incoming().back());
+  mail = read_file(queue_incoming().back());
   EXPECT_TRUE(mail.ends_with("-----\r\n\r\nSubject: s\r\n.\r\n"));
   EXPECT_EQ(mail.find("body"), std::string::npos);
   EXPECT_EQ(send_error_mail("note", "admin@site.example", ""), ErrorMail::sent);
-  mail = slurp(queue_incoming().back());
+  mail = read_file(queue_incoming().back());
   EXPECT_TRUE(mail.ends_with("\r\nnote\r\n.\r\n"));
 
-  spit(in("2"), "MAIL FROM:<>\r\nRCPT TO:<x@site.example>\r\nDATA\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
+  write_file(in("2"), "MAIL FROM:<>\r\nRCPT TO:<x@site.example>\r\nDATA\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
   std::size_t before = queue_incoming().size();
   EXPECT_EQ(send_error_mail("x", "", in("2")), ErrorMail::skipped);
   EXPECT_EQ(queue_incoming().size(), before);
@@ -154,15 +92,15 @@ TEST_F(QueueTest, ErrorMailsAreWholeMessagesAndNeverGoToTheNullSender) {
 TEST_F(QueueTest, AMessageThatLoopsGoesToOddmentsInsteadOfAnotherErrorMail) {
   const std::string looping = "MAIL FROM:<a@far.example>\r\nRCPT TO:<x>\r\nDATA\r\nSubject: s\r\n\r\nx-loop: yes\r\n.\r\n";
   const std::string plain = "MAIL FROM:<a@far.example>\r\nRCPT TO:<x>\r\nDATA\r\nSubject: s\r\n\r\nok\r\n.\r\n";
-  spit(in("1"), looping);
-  spit(in("2"), plain);
+  write_file(in("1"), looping);
+  write_file(in("2"), plain);
   EXPECT_EQ(send_error_mail("x", "", in("1")), ErrorMail::moved);
   EXPECT_TRUE(queue_incoming().empty());
   // Two files moved in the same second keep both.
   mail_move_to_oddments(in("2"), "test");
-  std::vector<std::string> odd = listing(root + "/odd");
+  std::vector<std::string> odd = folder_names(root + "/odd");
   ASSERT_EQ(odd.size(), 2u);
-  std::vector<std::string> kept{slurp(root + "/odd/" + odd[0]), slurp(root + "/odd/" + odd[1])};
+  std::vector<std::string> kept{read_file(root + "/odd/" + odd[0]), read_file(root + "/odd/" + odd[1])};
   std::sort(kept.begin(), kept.end());
   EXPECT_EQ(kept, (std::vector<std::string>{plain, looping}));
 }
@@ -170,7 +108,7 @@ TEST_F(QueueTest, AMessageThatLoopsGoesToOddmentsInsteadOfAnotherErrorMail) {
 TEST_F(QueueTest, BannedPhrasesAreFoundAnywhereInALargeFile) {
   std::string big(3 * 1024 * 1024, 'a');
   big.replace(big.size() - 20, 10, "BuY NoW!!!");
-  spit(in("9"), big);
+  write_file(in("9"), big);
   EXPECT_TRUE(mail_filter_match("'cheap', 'buy now'", in("9")));
   EXPECT_FALSE(mail_filter_match("'cheap', 'sell now'", in("9")));
   EXPECT_FALSE(mail_filter_match("", in("9")));
@@ -179,8 +117,8 @@ TEST_F(QueueTest, BannedPhrasesAreFoundAnywhereInALargeFile) {
 TEST_F(QueueTest, OutgoingRescanMergesAndKeepsHeldEntries) {
   config.smtp_direct = "direct.example";
   std::string out = root + "/out/";
-  spit(out + "1", "MAIL FROM:<ann@site.example>\r\nRCPT TO:<a@far.example>\r\nRCPT TO:<b@far.example>\r\nDATA\r\nx\r\n.\r\n");
-  spit(out + "2", "MAIL FROM:<ann@site.example>\r\nRCPT TO:<c@direct.example>\r\nDATA\r\nx\r\n.\r\n");
+  write_file(out + "1", "MAIL FROM:<ann@site.example>\r\nRCPT TO:<a@far.example>\r\nRCPT TO:<b@far.example>\r\nDATA\r\nx\r\n.\r\n");
+  write_file(out + "2", "MAIL FROM:<ann@site.example>\r\nRCPT TO:<c@direct.example>\r\nDATA\r\nx\r\n.\r\n");
   queue_scan_outgoing();
   ASSERT_EQ(queue_outgoing().size(), 2u);
   const OutgoingEntry& first = queue_outgoing().front();
@@ -193,7 +131,7 @@ TEST_F(QueueTest, OutgoingRescanMergesAndKeepsHeldEntries) {
   const OutgoingEntry* held = &first;
   unlink((out + "1").c_str());
   unlink((out + "2").c_str());
-  spit(out + "3", "MAIL FROM:<x@site.example>\r\nRCPT TO:<d@far.example>\r\nDATA\r\nx\r\n.\r\n");
+  write_file(out + "3", "MAIL FROM:<x@site.example>\r\nRCPT TO:<d@far.example>\r\nDATA\r\nx\r\n.\r\n");
   queue_scan_outgoing();
   ASSERT_EQ(queue_outgoing().size(), 2u);
   EXPECT_EQ(&queue_outgoing().front(), held);  // the same entry, not a copy
