@@ -174,19 +174,7 @@ class Debatch final : public AliasSink {
       filecache_destroy(outgoing_);
       return;
     }
-    if (filecache_copy(file_, env_.data_offset, outgoing_, kToEnd) != 0) write_failed_ = true;
-    std::string name = filecache_path(outgoing_);
-    if (write_failed_) {
-      filecache_destroy(outgoing_);
-      fail("Outgoing mail file could not be written");
-      return;
-    }
-    if (filecache_close(outgoing_) != 0) {
-      fail("Outgoing mail file could not be written");
-      return;
-    }
-    ++copies;
-    queue_add_outgoing(name);
+    commit_outgoing(outgoing_, !write_failed_);
   }
 
  private:
@@ -213,8 +201,15 @@ class Debatch final : public AliasSink {
       return;
     }
     int rc = filecache_write(out, "MAIL FROM:<" + outgoing_sender() + ">\r\nRCPT TO:<" + std::string(address) + ">\r\n");
-    if (rc == 0) rc = filecache_copy(file_, env_.data_offset, out, kToEnd);
-    if (rc != 0) {
+    commit_outgoing(out, rc == 0);
+  }
+
+  // Copies the message (from its DATA line) behind an outgoing envelope,
+  // syncs the file into place and lists it; any failure is recorded.
+  void commit_outgoing(CacheFile& out, bool ok) {
+    if (ok && filecache_copy(file_, env_.data_offset, out, kToEnd) != 0) ok = false;
+    std::string name = filecache_path(out);
+    if (!ok) {
       filecache_destroy(out);
       fail("Outgoing mail file could not be written");
       return;
