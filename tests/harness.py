@@ -28,7 +28,7 @@ TOP = os.path.dirname(HERE)
 def _binary(env_name, name):
     path = os.environ.get(env_name)
     if path:
-        return path
+        return os.path.abspath(path)  # the daemon runs in its installation folder
     for build in ('build', 'build-release'):
         candidate = os.path.join(TOP, build, name)
         if os.path.exists(candidate):

@@ -2,6 +2,7 @@
 
 import os
 import signal
+import socket
 import subprocess
 import shutil
 import tempfile
@@ -113,6 +114,31 @@ class StartAndStop(unittest.TestCase):
         self.assertEqual(self.suite.stop(), 0)
         self.assertIn('Suite started: 2.0.49', self.suite.log('main'))
         self.assertTrue(os.path.isdir(self.suite.pid_file))
+
+    def test_a_port_in_use_stops_start_up(self):
+        s = self.suite.start()
+        listening = []
+        for port in s.ports.values():
+            try:
+                socket.create_connection(('127.0.0.1', port), timeout=2).close()
+                listening.append(port)
+            except OSError:
+                pass
+        self.assertEqual(s.stop(), 0)
+        if not listening:
+            self.skipTest('no listening service is built yet')
+        with socket.socket() as taken:
+            # A listener holds the port even against SO_REUSEADDR; the option
+            # only lets this test's bind past connections still closing.
+            taken.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
+            taken.bind(('127.0.0.1', listening[0]))
+            taken.listen()
+            r = self.run_velmor('--bind', '127.0.0.1')
+        self.assertEqual(r.returncode, 1)
+        self.assertEqual(r.stdout.splitlines()[-1], 'Socket initialisation failed - see logs for more info')
+        self.assertIn('Bind Failed - is another server running on this port: %d' % listening[0],
+                      self.suite.log('errors'))
+        self.assertFalse(os.path.exists(self.suite.pid_file))
 
     def test_missing_configuration(self):
         os.remove(self.suite.path('config/master'))
