@@ -47,6 +47,8 @@ struct MessageRecord {
   std::uint64_t header_length = 0;  // offset of the body from the message start
   std::list<MimePart> parts;
 };
+// "Message start" is the start of its separator line throughout: a message
+// without one (a damaged file's first message) has total_length == length.
 
 // Mailbox record flags.
 namespace boxflag {
@@ -87,5 +89,30 @@ void mailbox_release(Mailbox& box, int owner);
 int mailbox_expunge(Mailbox& box);
 int mailbox_overview_write(Mailbox& box);
 int mailbox_overview_read(Mailbox& box);
+
+// ---- the pieces the above are built from (also used by the tests) ----------
+
+class ByteSource;  // mail/mailfile.h
+inline constexpr std::uint64_t kNoMessage = ~std::uint64_t{0};
+// Parses the message that starts at `offset`, appends its record to the box
+// (assigning its identifier) and returns where the next message starts, or
+// kNoMessage at the end. A "From " line starts a message only at the start
+// of the file or right after the "." line that ends the previous message.
+std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbox& box);
+// The separator line for a queue file's first line ("From sender date").
+std::string mailbox_separator(std::string_view envelope_line, std::time_t when);
+// The date of a separator line; kBadDate when the line is none.
+std::time_t mailbox_separator_date(std::string_view line);
+// Header lines delivery drops from arriving mail (they carry our own state).
+bool mailbox_header_dropped(std::string_view line);
+// The box a recipient address names by its sub-address ("ann_work@site" ->
+// "work"); "inbox" for anything that is not a plain name.
+std::string mailbox_box_for_address(std::string_view address);
+std::string mailbox_overview_text(const Mailbox& box);
+int mailbox_overview_parse(Mailbox& box, std::string_view text);
+// Offset of a message in the mailbox file (the sum of the lengths before it).
+std::uint64_t mailbox_size(const Mailbox& box);
+// Forgets every cached mailbox (tests).
+void mailbox_cache_clear();
 
 }  // namespace velmor

@@ -1,0 +1,465 @@
+// Local delivery: a queued message appended to a user's mailbox, after the
+// receive checks of the user's group and the user's own forward and
+// vacation settings.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <functional>
+#include <vector>
+
+#include "core/filecache.h"
+#include "core/globals.h"
+#include "core/log.h"
+#include "core/strfmt.h"
+#include "core/util.h"
+#include "mail/delivery.h"
+#include "mail/mailbox.h"
+#include "mail/mailfile.h"
+#include "mail/queue.h"
+#include "users/groups.h"
+#include "users/users.h"
+
+namespace velmor {
+
+namespace {
+
+constexpr std::time_t kVacationInterval = 7 * 24 * 3600;
+constexpr int kMaxForwardHops = 10;
+constexpr std::string_view kForwardedHeader = "X-Velmor-Forwarded-By:";
+
+std::time_t now() { return server_now ? server_now : std::time(nullptr); }
+
+void debug(std::string_view text, std::string_view value = {}) {
+  log_message(text, value, logfac::maildebatch);
+}
+
+// Where a group's redirect option sends its error mail: the option's
+// address (completed with our domain), or the sender when it is unset.
+std::string redirect_address(const GroupOptions& group, std::string_view key) {
+  const std::string& to = group.text(key);
+  if (to.empty()) return {};
+  if (to.find('@') != std::string::npos) return to;
+  return to + "@" + mail_primary_domain();
+}
+
+bool is_temporary(int error) {
+  return error == ENOSPC || error == EDQUOT || error == EIO || error == EMFILE || error == ENFILE ||
+         error == ENOMEM || error == EROFS || error == EFBIG || error == EAGAIN || error == EINTR;
+}
+
+// Writes a new incoming queue file and queues it. 0 or an errno value.
+int queue_new_message(const std::function<int(CacheFile&)>& fill) {
+  CacheFile file = queue_create_incoming();
+  if (!file) return EIO;
+  std::string path = filecache_path(file);
+  int rc = fill(file);
+  if (rc) {
+    filecache_destroy(file);
+    return rc;
+  }
+  if ((rc = filecache_close(file)) != 0) return rc;
+  queue_add_incoming(path);
+  return 0;
+}
+
+// Writes `length` bytes of a source from `offset` to a queue file.
+int copy_to_queue(ByteSource& in, std::uint64_t offset, std::uint64_t length, CacheFile& out) {
+  while (length > 0) {
+    std::string_view v = in.view(offset, 64 * 1024);
+    if (v.empty()) return EIO;
+    v = v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), length)));
+    if (int rc = filecache_write(out, v)) return rc;
+    offset += v.size();
+    length -= v.size();
+  }
+  return 0;
+}
+
+// Text as the body of a message in transmission form: CR LF lines, a dot
+// doubled at the start of a line, ending with the "." line.
+std::string as_transmission_body(std::string_view text) {
+  std::string out;
+  out.reserve(text.size() + 16);
+  while (!text.empty()) {
+    std::size_t lf = text.find('\n');
+    std::string_view line = text.substr(0, lf);
+    if (!line.empty() && line.back() == '\r') line.remove_suffix(1);
+    if (!line.empty() && line.front() == '.') out += '.';
+    out.append(line);
+    out += "\r\n";
+    if (lf == std::string_view::npos) break;
+    text.remove_prefix(lf + 1);
+  }
+  out += ".\r\n";
+  return out;
+}
+
+}  // namespace
+
+// ---- the queue file --------------------------------------------------------------
+
+QueueLayout queue_layout(ByteSource& in) {
+  QueueLayout q;
+  Line first = read_line(in, 0, 1024);
+  if (first.length == 0) return q;
+  q.envelope = std::string(line_body(first.text));
+  std::uint64_t pos = first.length;
+  while (pos < in.size()) {
+    Line line = read_line(in, pos, 16);
+    if (line.length == 0) break;
+    char c = line.text.empty() ? '\0' : static_cast<char>(line.text.front() | 0x20);
+    if (c == 'r') {
+      pos += line.length;
+      continue;
+    }
+    q.data_line = pos;
+    q.message = c == 'd' ? pos + line.length : pos;
+    break;
+  }
+  if (q.message == 0) q.data_line = q.message = pos;
+  // The header: the lines up to the first empty line (or the terminator).
+  pos = q.message;
+  while (pos < in.size()) {
+    Line line = read_line(in, pos, kHeaderLineKeep);
+    if (line.length == 0) break;
+    std::string_view body = line_body(line.text);
+    if (body.empty() || is_terminator_line(line.text)) break;
+    bool folded = body.front() == ' ' || body.front() == '\t';
+    if (folded && !q.header.empty()) {
+      q.header.back().append(line.text);
+    } else if (!folded) {
+      q.header.emplace_back(line.text);
+    }
+    pos += line.length;
+  }
+  q.header_end = pos;
+  return q;
+}
+
+std::string_view header_field(const QueueLayout& q, std::string_view name) {
+  for (const std::string& h : q.header) {
+    if (h.size() > name.size() && h[name.size()] == ':' && str_istarts_with(h, name)) {
+      return trim_blanks(line_body(std::string_view(h).substr(name.size() + 1)));
+    }
+  }
+  return {};
+}
+
+bool vacation_reply_wanted(const QueueLayout& q, std::string_view sender) {
+  if (sender.empty() || sender == "<>") return false;
+  for (char c : sender) {
+    if (static_cast<unsigned char>(c) <= ' ' || c == '<' || c == '>') return false;
+  }
+  if (str_istarts_with(sender, "MAILER-DAEMON")) return false;
+  std::string_view precedence = header_field(q, "Precedence");
+  for (std::string_view word : {"bulk", "list", "junk"}) {
+    if (str_istarts_with(precedence, word)) return false;
+  }
+  for (const std::string& h : q.header) {
+    if (str_istarts_with(h, "List-Id:")) return false;
+  }
+  std::string_view auto_submitted = header_field(q, "Auto-Submitted");
+  if (!auto_submitted.empty() && !str_istarts_with(auto_submitted, "no")) return false;
+  return true;
+}
+
+bool vacation_note_sent(const std::string& record_path, std::string_view sender, std::time_t when) {
+  std::string kept;
+  bool recent = false;
+  FileSource in(record_path);
+  std::uint64_t pos = 0;
+  while (in.is_open() && pos < in.size()) {
+    Line line = read_line(in, pos, 1024);
+    if (line.length == 0) break;
+    pos += line.length;
+    std::string_view body = line_body(line.text);
+    std::size_t blank = body.find(' ');
+    if (blank == std::string_view::npos) continue;
+    std::time_t t = static_cast<std::time_t>(std::strtoll(std::string(body.substr(0, blank)).c_str(), nullptr, 10));
+    if (t + kVacationInterval <= when || t > when) continue;  // expired (or from the future)
+    std::string_view who = body.substr(blank + 1);
+    if (str_iequals(who, sender)) {
+      recent = true;
+      break;
+    }
+    kept.append(body);
+    kept += '\n';
+  }
+  if (recent) return false;
+  strappendf(kept, "%lld ", static_cast<long long>(when));
+  kept.append(sender);
+  kept += '\n';
+  file_write_atomic(record_path, kept, false, 0600);
+  return true;
+}
+
+// ---- delivery -----------------------------------------------------------------
+
+namespace {
+
+struct Recipient {
+  const UserRecord* user = nullptr;
+  std::shared_ptr<const GroupOptions> group;
+};
+
+// The receive checks of the recipient's group; true when the message was
+// refused (and the refusal mailed).
+bool refused(const Recipient& r, const std::string& queue_file, std::string_view sender) {
+  const GroupOptions& g = *r.group;
+  const std::string& user = r.user->login;
+  std::int64_t size = file_size(queue_file);
+  std::uint32_t limit = g.size("mail.msg.size");
+  if (limit && size > static_cast<std::int64_t>(limit)) {
+    std::string shown(trim_blanks(size_text(static_cast<std::uint64_t>(size))));
+    log_write(strprintf("[Mail] Oversize article [%s]:%s", shown.c_str(), user.c_str()),
+              logchan::filter);
+    mail_send_error(strprintf("The following email was greater than the %ukB length limit, at %lldkB\n",
+                              limit / 1024, static_cast<long long>(size / 1024)),
+                    redirect_address(g, "mail.large.redirect"), queue_file);
+    return true;
+  }
+  const std::string& block = g.text("mail.address.recv.block");
+  if (!block.empty() && wildcard_match(sender, block) && !wildcard_match(sender, g.text("mail.address.recv.allow"))) {
+    debug("Sent by forbidden user");
+    log_write(strprintf("[Mail] Blocked sender [%.*s] for: %s", static_cast<int>(sender.size()), sender.data(),
+                        user.c_str()),
+              logchan::filter);
+    mail_send_error("The following email was sent by a forbidden user\n", redirect_address(g, "mail.block.redirect"),
+                    queue_file);
+    return true;
+  }
+  const std::string& filter = g.text("mail.filter");
+  if (!filter.empty() && mail_filter_match(filter, queue_file)) {
+    log_write(strprintf("[Mail] Banned word/phrase found: %s", user.c_str()), logchan::filter);
+    mail_send_error("The following email contained a forbidden phrase\n", redirect_address(g, "mail.filter.redirect"),
+                    queue_file);
+    return true;
+  }
+  return false;
+}
+
+// The first line of a small file in the home folder, trimmed.
+std::string first_line_of(const std::string& path) {
+  FileSource in(path);
+  if (!in.is_open()) return {};
+  Line line = read_line(in, 0, 1024);
+  return std::string(trim_blanks(line_body(line.text)));
+}
+
+// Honours <home>/.forward: the message goes on to its address as a new
+// queue file and no local copy is kept. False when delivery is to go on
+// locally: no forward file, a forward back to this same user, a message
+// that has already passed this user's forward (a loop between users), or
+// a queue file that could not be written.
+bool forwarded(const Recipient& r, ByteSource& in, const QueueLayout& q) {
+  std::string target = first_line_of(path_join(r.user->home, ".forward"));
+  while (!target.empty() && (target.front() == '<')) target.erase(0, 1);
+  if (auto gt = target.find('>'); gt != std::string::npos) target.erase(gt);
+  if (target.empty() || target.find_first_of(" \t\r\n") != std::string::npos) return false;
+  if (auto local = mail_local_user(target)) {
+    const UserRecord* u = user_find(*local);
+    if (u == r.user) return false;
+  }
+  int hops = 0;
+  for (const std::string& h : q.header) {
+    if (!str_istarts_with(h, kForwardedHeader)) continue;
+    ++hops;
+    if (str_iequals(trim_blanks(line_body(std::string_view(h).substr(kForwardedHeader.size()))), r.user->login)) {
+      debug("Forward loop, delivering locally for:", r.user->login);
+      return false;
+    }
+  }
+  if (hops >= kMaxForwardHops) return false;
+  int rc = queue_new_message([&](CacheFile& out) {
+    std::string head = q.envelope + "\r\nRCPT TO:<" + target + ">\r\nDATA\r\n" + std::string(kForwardedHeader) +
+                       " " + r.user->login + "\r\n";
+    if (int e = filecache_write(out, head)) return e;
+    return copy_to_queue(in, q.message, in.size() - q.message, out);
+  });
+  if (rc) {
+    debug("Forward queue file failed, delivering locally:", error_text(rc));
+    return false;
+  }
+  debug("Forwarded to:", target);
+  return true;
+}
+
+void vacation(const Recipient& r, const QueueLayout& q, std::string_view sender) {
+  const std::string& home = r.user->home;
+  if (!file_is_regular(path_join(home, ".vacation")) || !vacation_reply_wanted(q, sender)) return;
+  if (!vacation_note_sent(path_join(home, ".vacation.sent"), sender, now())) return;
+  FileSource text(path_join(home, ".vacation"));
+  std::string_view body = text.view(0, static_cast<std::size_t>(std::min<std::uint64_t>(text.size(), 256 * 1024)));
+  std::string me = r.user->login + "@" + mail_primary_domain();
+  std::string s(sender);
+  int rc = queue_new_message([&](CacheFile& out) {
+    std::string msg = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + s + ">\r\nDATA\r\n";
+    msg += "Date: " + date_text(now(), "%a, %d %b %Y %H:%M:%S %Z") + "\r\n";
+    msg += "From: " + me + "\r\nTo: " + s + "\r\nSubject: Vacation Message\r\n";
+    msg += "Precedence: bulk\r\nAuto-Submitted: auto-replied\r\n\r\n";
+    msg += as_transmission_body(body);
+    return filecache_write(out, msg);
+  });
+  if (rc) debug("Vacation reply could not be queued:", error_text(rc));
+}
+
+// Appends the message to the mailbox file. 0 or an errno value; on failure
+// the file is cut back to `old_size`.
+int append_message(int fd, std::uint64_t old_size, ByteSource& in, const QueueLayout& q, std::string_view user,
+                   std::uint32_t uid) {
+  std::string out = mailbox_separator(q.envelope, now());
+  int rc = 0;
+  std::string tail;  // the last bytes written, to see whether the terminator came
+  auto put = [&](std::string_view data) {
+    if (rc) return;
+    out.append(data);
+    tail.append(data.substr(data.size() > 5 ? data.size() - 5 : 0));
+    if (tail.size() > 5) tail.erase(0, tail.size() - 5);
+    if (out.size() >= 64 * 1024) {
+      rc = write_all(fd, out);
+      out.clear();
+    }
+  };
+  // The header, without the lines that carry mailbox state.
+  std::uint64_t pos = q.message;
+  bool dropping = false;
+  while (pos < q.header_end && !rc) {
+    Line line = read_line(in, pos, kHeaderLineKeep);
+    if (line.length == 0) break;
+    pos += line.length;
+    bool folded = line.text.front() == ' ' || line.text.front() == '\t';
+    if (!folded) dropping = mailbox_header_dropped(line.text);
+    if (dropping) continue;
+    if (line.length == line.text.size()) {
+      put(line_body(line.text));
+      put("\r\n");
+    } else {  // a header line longer than we keep in memory: copied as it is
+      for (std::uint64_t o = line.offset, left = line.length; left > 0 && !rc;) {
+        std::string_view v = in.view(o, 64 * 1024);
+        if (v.empty()) {
+          rc = EIO;
+          break;
+        }
+        v = v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), left)));
+        put(v);
+        o += v.size();
+        left -= v.size();
+      }
+    }
+  }
+  // Empty lines at the start of the body are dropped with the header's end.
+  while (pos < in.size()) {
+    Line line = read_line(in, pos, 4);
+    if (line.length == 0 || line_body(line.text).size() != 0 || line.length > 2) break;
+    pos += line.length;
+  }
+  put("X-RCPT-TO: ");
+  put(user);
+  put("\r\nX-Processed-By: Velmor Mail Suite (");
+  put(kVersion);
+  put(")\r\n");
+  put(strprintf("X-UID: %u\r\n\r\n", uid));
+  while (pos < in.size() && !rc) {
+    std::string_view v = in.view(pos, 64 * 1024);
+    if (v.empty()) {
+      rc = EIO;
+      break;
+    }
+    put(v);
+    pos += v.size();
+  }
+  if (!rc && tail != "\r\n.\r\n" && tail.substr(2) != "\n.\n") {
+    // A queue file without its terminator: the message is closed here, so
+    // the next one in the mailbox still starts at a separator.
+    if (!tail.empty() && tail.back() != '\n') put("\r\n");
+    put(".\r\n");
+  }
+  if (!rc) rc = write_all(fd, out);
+  if (!rc && ::fsync(fd) != 0) rc = errno;
+  if (rc) {
+    while (::ftruncate(fd, static_cast<off_t>(old_size)) != 0 && errno == EINTR) {
+    }
+    ::fsync(fd);
+  }
+  return rc;
+}
+
+}  // namespace
+
+int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender) {
+  debug("Mailbox append for:", recipient);
+  debug("Mailbox append from:", sender);
+  std::shared_ptr<const GroupOptions> sender_group;
+  if (auto s = mail_local_user(sender); s && user_find(*s)) {
+    sender_group = user_group(user_find(*s)->login);
+  } else {
+    sender_group = group_default();
+  }
+  bool exempt = sender_group && (sender_group->mail_flags & gflag::mail_override);
+
+  auto local = mail_local_user(recipient);
+  if (!local) return 0;
+  if (local->size() > 63) local->resize(63);
+  debug("Mailbox local user is:", *local);
+  Recipient r;
+  r.user = user_find(*local);
+  if (!r.user || r.user->home.empty()) return 0;
+  r.group = user_group(r.user->login);
+
+  if (!exempt && r.group && refused(r, queue_file, sender)) return 1;
+
+  FileSource in(queue_file);
+  if (!in.is_open()) return kAppendTemporaryFailure;
+  QueueLayout q = queue_layout(in);
+  if (in.failed()) return kAppendTemporaryFailure;
+
+  if (r.group && (r.group->mail_flags & gflag::mail_forward) && forwarded(r, in, q)) return 1;
+  if (r.group && (r.group->mail_flags & gflag::mail_vacation)) vacation(r, q, sender);
+
+  std::string box_name = mailbox_box_for_address(recipient);
+  if (box_name != "inbox") {
+    debug("Appending mailbox in email address:", box_name);
+  } else {
+    debug("Using inbox");
+  }
+  debug(strprintf("using box `%s'", box_name.c_str()));
+  std::string dir = path_join(r.user->home, "mail");
+  make_path(dir);
+  std::string path = path_join(dir, box_name);
+  debug("Trying to open mailbox");
+  // Never through a link: the box name came from the network.
+  UniqueFd fd(::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
+  struct stat st {};
+  int error = !fd ? errno : (::fstat(fd.get(), &st) != 0 ? errno : (S_ISREG(st.st_mode) ? 0 : EISDIR));
+  Mailbox* box = error ? nullptr : mailbox_lookup(path);
+  if (!error && !box) error = EIO;
+  if (error) {
+    debug("Mailbox open failed");
+    if (is_temporary(error)) return kAppendTemporaryFailure;
+    mail_move_to_oddments(queue_file, strprintf("Couldn't open mailbox for user `%s'", r.user->login.c_str()));
+    return 1;
+  }
+  std::uint64_t old_size = static_cast<std::uint64_t>(st.st_size);
+  std::uint32_t uid = box->next_uid ? box->next_uid : 1;
+  if (int rc = append_message(fd.get(), old_size, in, q, r.user->login, uid)) {
+    log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
+    return kAppendTemporaryFailure;
+  }
+  fd.close();
+  box->flags |= boxflag::new_mail | boxflag::delivered;
+  FileSource written(path);
+  std::size_t before = box->messages.size();
+  if (mailbox_size(*box) == old_size) mailbox_parse_message(written, old_size, *box);
+  if (box->messages.size() == before) {
+    // The record did not follow the file (changed behind our back): the
+    // lookup brings it in line with what the file now holds.
+    mailbox_lookup(path);
+    return 1;
+  }
+  mailbox_overview_write(*box);
+  return 1;
+}
+
+}  // namespace velmor

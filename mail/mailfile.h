@@ -1,0 +1,100 @@
+// Reading and writing mailbox files: a descriptor that closes itself, a
+// line reader over any byte source (a file read in large windows, or text in
+// memory), and writes that report every failure.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+namespace velmor {
+
+class UniqueFd {
+ public:
+  UniqueFd() = default;
+  explicit UniqueFd(int fd) : fd_(fd) {}
+  UniqueFd(UniqueFd&& other) noexcept : fd_(other.release()) {}
+  UniqueFd& operator=(UniqueFd&& other) noexcept;
+  UniqueFd(const UniqueFd&) = delete;
+  UniqueFd& operator=(const UniqueFd&) = delete;
+  ~UniqueFd();
+
+  int get() const { return fd_; }
+  explicit operator bool() const { return fd_ >= 0; }
+  int release() {
+    int fd = fd_;
+    fd_ = -1;
+    return fd;
+  }
+  // Closes now; 0 or the errno of a failed close.
+  int close();
+
+ private:
+  int fd_ = -1;
+};
+
+class ByteSource {
+ public:
+  virtual ~ByteSource() = default;
+  virtual std::uint64_t size() const = 0;
+  // The bytes from `offset` on: at least `want` of them unless the source
+  // ends first. Valid until the next call. Empty at the end or on a failure.
+  virtual std::string_view view(std::uint64_t offset, std::size_t want) = 0;
+  virtual bool failed() const { return false; }
+};
+
+class TextSource : public ByteSource {
+ public:
+  explicit TextSource(std::string_view text) : text_(text) {}
+  std::uint64_t size() const override { return text_.size(); }
+  std::string_view view(std::uint64_t offset, std::size_t want) override;
+
+ private:
+  std::string_view text_;
+};
+
+// A file read through one window; the window holds at least 64 KiB.
+class FileSource : public ByteSource {
+ public:
+  // Takes its own descriptor on `path` (read only).
+  explicit FileSource(const std::string& path);
+  // Reads through a descriptor owned by the caller.
+  explicit FileSource(int fd);
+  bool is_open() const { return fd_ >= 0; }
+  std::uint64_t size() const override { return size_; }
+  std::string_view view(std::uint64_t offset, std::size_t want) override;
+  bool failed() const override { return failed_; }
+  // Re-reads the size (the file may have grown) and drops the window.
+  void refresh();
+
+ private:
+  UniqueFd own_;
+  int fd_ = -1;
+  std::uint64_t size_ = 0;
+  std::string window_;
+  std::uint64_t window_offset_ = 0;
+  bool failed_ = false;
+};
+
+struct Line {
+  std::uint64_t offset = 0;
+  std::uint64_t length = 0;  // including the line end; 0 at the end of the source
+  std::string_view text;     // at most `keep` bytes of the line, line end included when kept
+};
+// The line at `offset`, running to its LF or to the end of the source. The
+// text is valid until the next call on the source.
+Line read_line(ByteSource& in, std::uint64_t offset, std::size_t keep = 8192);
+
+// The line's text without its CR LF (or LF).
+std::string_view line_body(std::string_view text);
+// A line that holds only "." (the end of a message in transmission form).
+bool is_terminator_line(std::string_view text);
+
+// Writes all of `data` at the descriptor's position. 0 or an errno value.
+int write_all(int fd, std::string_view data);
+// Copies `length` bytes from `offset` of `from` to the position of `to`.
+int copy_range(int from, std::uint64_t offset, std::uint64_t length, int to);
+// fsync of the folder that holds `path`, so a rename in it is durable.
+int sync_parent_dir(const std::string& path);
+
+}  // namespace velmor
