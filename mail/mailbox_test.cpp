@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <csignal>
@@ -274,6 +275,42 @@ TEST_F(TempDir, FailedExpungeLeavesTheOldMailbox) {
   EXPECT_EQ(read_file(inbox()), m1 + m2);
   EXPECT_EQ(box->count, 2);
   EXPECT_FALSE(fs::exists(dir_ / "mail" / "inbox~"));
+}
+
+TEST_F(TempDir, KilledExpungeLeavesTheOldOrTheNewMailboxWhole) {
+  std::string old_text, new_text;
+  for (int i = 0; i < 30; ++i) {
+    std::string m = message("a@x", "Subject: " + std::to_string(i) + "\r\nX-UID: " + std::to_string(i + 1) + "\r\n",
+                            std::string(300000, 'a' + i % 26) + "\r\n");
+    old_text += m;
+    if (i) new_text += m;
+  }
+  write_file(inbox(), old_text);
+  Mailbox* box = mailbox_lookup(inbox());
+  ASSERT_EQ(box->count, 30);
+  box->messages.front().flags |= msgflag::deleted;
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    mailbox_expunge(*box);
+    _exit(0);
+  }
+  // Kill it as soon as the new mailbox is being written.
+  std::string tmp = (dir_ / "mail" / "inbox~").string();
+  for (int i = 0; i < 5000; ++i) {
+    std::error_code ec;
+    if (fs::exists(tmp, ec) && fs::file_size(tmp, ec) > 1000000) break;
+    usleep(1000);
+  }
+  kill(child, SIGKILL);
+  int status = 0;
+  waitpid(child, &status, 0);
+  std::string after = read_file(inbox());
+  EXPECT_TRUE(after == old_text || after == new_text);
+  mailbox_cache_clear();
+  Mailbox* reread = mailbox_lookup(inbox());
+  EXPECT_EQ(reread->count, after == old_text ? 30 : 29);
+  EXPECT_EQ(mailbox_size(*reread), after.size());
 }
 
 TEST_F(TempDir, InUseMarkBelongsToOneSession) {

@@ -58,6 +58,9 @@ struct PopSession : SessionData {
   std::vector<MessageRecord*> index;
   std::vector<std::uint64_t> offsets;
   bool last_cr = false;  // the previous line ended with CR (its LF may follow)
+  // A line longer than the input buffer: refused once, then skipped to its end.
+  bool skip_line = false;
+  bool overlong_pending = false;
 
   // What is being streamed beyond the reply.
   enum class Listing { none, list, uidl } listing = Listing::none;
@@ -429,23 +432,47 @@ void command(SocketRecord& r, PopSession& s, std::string_view line, bool& discar
   }
 }
 
+// The input buffer is full without a line end: the line is refused (once)
+// and the rest of it skipped as it arrives.
+void overlong(PopSession& s, SocketRecord& r) {
+  r.read_buf.clear();
+  s.last_cr = false;
+  if (!s.skip_line) s.overlong_pending = true;
+  s.skip_line = true;
+}
+
 // Runs the complete command lines in the input until one starts a stream
 // or the output buffer could not take another reply.
 void process(SocketRecord& r, PopSession& s) {
   while (!s.streaming() && r.state != popstate::closing && r.write_buf.room() >= kReplyRoom) {
     std::string_view in = r.read_buf.view();
-    if (s.last_cr && !in.empty() && in.front() == '\n') {
-      r.read_buf.consume(1);
-      in.remove_prefix(1);
-    }
-    s.last_cr = false;
-    std::size_t eol = in.find_first_of("\r\n");
-    if (eol == std::string_view::npos) {
-      if (r.read_buf.room() == 0) {  // a line longer than the whole buffer
-        reply(r, "-ERR Bad command - too long\r\n");
-        r.read_buf.clear();
+    if (s.last_cr && !in.empty()) {
+      s.last_cr = false;
+      if (in.front() == '\n') {
+        r.read_buf.consume(1);
+        in.remove_prefix(1);
       }
-      return;
+    }
+    if (s.overlong_pending) {
+      s.overlong_pending = false;
+      reply(r, "-ERR Bad command - too long\r\n");
+      continue;
+    }
+    std::size_t eol = in.find_first_of("\r\n");
+    if (s.skip_line) {  // the rest of an overlong line
+      if (eol == std::string_view::npos) {
+        r.read_buf.clear();
+        return;
+      }
+      s.skip_line = false;
+      r.read_buf.consume(eol + 1);
+      s.last_cr = in[eol] == '\r';
+      continue;
+    }
+    if (eol == std::string_view::npos) {
+      if (r.read_buf.room() != 0) return;
+      overlong(s, r);
+      continue;
     }
     std::size_t used = eol + 1;
     if (in[eol] == '\r') {
@@ -565,7 +592,7 @@ int pop_read(SocketRecord& r, long) {
   if (s.streaming() || !r.write_buf.empty()) {
     // Commands wait until the current reply is out; the input stays.
     if (r.read_buf.room() == 0 && r.read_buf.view().find_first_of("\r\n") == std::string_view::npos) {
-      r.read_buf.clear();  // a flood without line ends
+      overlong(s, r);
     }
     return 0;
   }

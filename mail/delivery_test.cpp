@@ -1,0 +1,248 @@
+#include "mail/delivery.h"
+
+#include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "core/config.h"
+#include "core/filecache.h"
+#include "core/globals.h"
+#include "core/util.h"
+#include "mail/mailbox.h"
+#include "mail/mailfile.h"
+#include "users/groups.h"
+#include "users/users.h"
+
+namespace velmor {
+namespace {
+
+namespace fs = std::filesystem;
+
+std::string read_file(const fs::path& p) {
+  std::ifstream f(p, std::ios::binary);
+  std::stringstream ss;
+  ss << f.rdbuf();
+  return ss.str();
+}
+
+void write_file(const fs::path& p, std::string_view data) {
+  fs::create_directories(p.parent_path());
+  std::ofstream f(p, std::ios::binary | std::ios::trunc);
+  f << data;
+}
+
+QueueLayout layout_of(std::string_view text) {
+  TextSource in(text);
+  return queue_layout(in);
+}
+
+TEST(QueueFile, LayoutFindsEnvelopeDataAndHeader) {
+  std::string q =
+      "MAIL FROM:<bob@x>\r\nRCPT TO:<ann@y>\r\nrcpt to:<eve@y>\r\nDATA\r\nSubject: hi\r\n there\r\n"
+      "Precedence: bulk\r\n\r\nbody\r\n.\r\n";
+  QueueLayout l = layout_of(q);
+  EXPECT_EQ(l.envelope, "MAIL FROM:<bob@x>");
+  EXPECT_EQ(q.substr(l.data_line, 6), "DATA\r\n");
+  EXPECT_EQ(q.substr(l.message, 8), "Subject:");
+  EXPECT_EQ(q.substr(l.header_end, 6), "\r\nbody");
+  ASSERT_EQ(l.header.size(), 2u);
+  EXPECT_EQ(l.header[0], "Subject: hi\r\n there\r\n");
+  EXPECT_EQ(header_field(l, "precedence"), "bulk");
+  EXPECT_EQ(header_field(l, "Subject"), "hi\r\n there");
+  // A message without a body ends its header at the terminator.
+  QueueLayout bare = layout_of("MAIL FROM:<a@x>\r\nRCPT TO:<b@y>\r\nDATA\r\nSubject: s\r\n.\r\n");
+  EXPECT_EQ(bare.header.size(), 1u);
+}
+
+TEST(Vacation, NoReplyToListsAutomataOrTheNullSender) {
+  auto wanted = [](std::string_view header, std::string_view sender = "bob@x") {
+    std::string q = "MAIL FROM:<bob@x>\r\nRCPT TO:<ann@y>\r\nDATA\r\n" + std::string(header) + "\r\nhi\r\n.\r\n";
+    return vacation_reply_wanted(layout_of(q), sender);
+  };
+  EXPECT_TRUE(wanted("Subject: hello\r\n"));
+  EXPECT_TRUE(wanted("Auto-Submitted: no\r\n"));
+  EXPECT_FALSE(wanted("Subject: hello\r\n", ""));
+  EXPECT_FALSE(wanted("Subject: hello\r\n", "<>"));
+  EXPECT_FALSE(wanted("Subject: hello\r\n", "MAILER-DAEMON@x"));
+  EXPECT_FALSE(wanted("Precedence: bulk\r\n"));
+  EXPECT_FALSE(wanted("precedence: List\r\n"));
+  EXPECT_FALSE(wanted("Precedence: junk\r\n"));
+  EXPECT_FALSE(wanted("List-Id: <news.example.org>\r\n"));
+  EXPECT_FALSE(wanted("Auto-Submitted: auto-replied\r\n"));
+}
+
+TEST(Vacation, AtMostOncePerSenderPerWeek) {
+  char tmpl[] = "/tmp/velmor-vacation-XXXXXX";
+  ASSERT_NE(mkdtemp(tmpl), nullptr);
+  std::string record = std::string(tmpl) + "/.vacation.sent";
+  const std::time_t t0 = 1700000000, week = 7 * 24 * 3600;
+  EXPECT_TRUE(vacation_note_sent(record, "bob@x", t0));
+  EXPECT_FALSE(vacation_note_sent(record, "BOB@x", t0 + 3600));
+  EXPECT_TRUE(vacation_note_sent(record, "carl@x", t0 + 3600));
+  EXPECT_FALSE(vacation_note_sent(record, "bob@x", t0 + week - 1));
+  EXPECT_TRUE(vacation_note_sent(record, "bob@x", t0 + week));
+  // Old entries are dropped as the record is rewritten.
+  EXPECT_TRUE(vacation_note_sent(record, "dave@x", t0 + 3 * week));
+  EXPECT_EQ(read_file(record).find("bob"), std::string::npos);
+  EXPECT_EQ(read_file(record).find("carl"), std::string::npos);
+  fs::remove_all(tmpl);
+}
+
+// A site with the user ann (home under a temporary folder) and one group
+// that honours forward and vacation files.
+class Delivery : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/velmor-delivery-XXXXXX";
+    ASSERT_NE(mkdtemp(tmpl), nullptr);
+    dir_ = tmpl;
+    config_reset();
+    paths.tmp_dir = (dir_ / "tmp").string();
+    fs::create_directories(dir_ / "tmp");
+    fs::create_directories(dir_ / "in");
+    fs::create_directories(dir_ / "odd");
+    config.mail_domains = "example.test";
+    config.mail_dir_incoming = (dir_ / "in").string();
+    config.mail_dir_oddments = (dir_ / "odd").string();
+    config.admin_email = "postmaster@example.test";
+    ASSERT_EQ(filecache_init(), 0);
+    home_ = dir_ / "ann";
+    write_file(dir_ / "users", "ann," + md5_crypt("pw", "$1$abcde$") + ",Ann Lee," + home_.string() + ",0\n");
+    write_file(dir_ / "groups", "#0\n%mail.forward: yes\n%mail.vacation: yes\n%mail.pop.fetch: yes\n");
+    ASSERT_EQ(user_load((dir_ / "users").string()), 0);
+    ASSERT_EQ(groups_load((dir_ / "groups").string()), 0);
+    mailbox_cache_clear();
+  }
+  void TearDown() override {
+    mailbox_cache_clear();
+    fs::remove_all(dir_);
+  }
+
+  std::string queue(std::string_view header, std::string_view body = "hello\r\n",
+                    std::string_view sender = "bob@elsewhere.test") {
+    std::string path = (dir_ / ("q" + std::to_string(++n_))).string();
+    write_file(path, "MAIL FROM:<" + std::string(sender) + ">\r\nRCPT TO:<ann@example.test>\r\nDATA\r\n" +
+                         std::string(header) + "\r\n" + std::string(body) + ".\r\n");
+    return path;
+  }
+  std::string inbox() const { return (home_ / "mail" / "inbox").string(); }
+  std::vector<std::string> incoming() const {
+    std::vector<std::string> out;
+    for (const auto& e : fs::directory_iterator(dir_ / "in")) {
+      if (e.path().filename().string()[0] != '.') out.push_back(read_file(e.path()));
+    }
+    return out;
+  }
+
+  fs::path dir_, home_;
+  int n_ = 0;
+};
+
+TEST_F(Delivery, StateHeadersAreReplacedAndIdentifiersRise) {
+  std::string q1 = queue("From: bob@elsewhere.test\r\nStatus: RO\r\nX-UID: 77\r\nx-status: D\r\n"
+                         "X-Keywords: x\r\n  continued\r\nSubject: first\r\n",
+                         "\r\n\r\n.. dotted\r\nFrom here on\r\n");
+  ASSERT_EQ(mailbox_append(q1, "ann@example.test", "bob@elsewhere.test"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: second\r\n"), "ann", "bob@elsewhere.test"), 1);
+  std::string box = read_file(inbox());
+  EXPECT_EQ(box.find("Status:"), std::string::npos);
+  EXPECT_EQ(box.find("X-UID: 77"), std::string::npos);
+  EXPECT_EQ(box.find("status:"), std::string::npos);
+  EXPECT_NE(box.find("X-Keywords: x\r\n  continued\r\n"), std::string::npos);
+  EXPECT_NE(box.find("X-RCPT-TO: ann\r\nX-Processed-By: Velmor Mail Suite (2.0.49)\r\nX-UID: 1\r\n\r\n"
+                     ".. dotted\r\nFrom here on\r\n.\r\n"),
+            std::string::npos);
+  EXPECT_NE(box.find("X-UID: 2\r\n\r\nhello\r\n.\r\n"), std::string::npos);
+  Mailbox* m = mailbox_lookup(inbox());
+  ASSERT_NE(m, nullptr);
+  EXPECT_EQ(m->count, 2);
+  EXPECT_EQ(m->unseen, 2);
+  EXPECT_EQ(m->messages.front().flags & msgflag::deleted, 0u);
+  EXPECT_TRUE(m->flags & boxflag::new_mail);
+  // The cache and a fresh read of the files agree.
+  std::string overview = read_file(home_ / "mail" / "overview" / "inbox");
+  mailbox_cache_clear();
+  Mailbox* again = mailbox_lookup(inbox());
+  EXPECT_EQ(mailbox_overview_text(*again), overview);
+}
+
+TEST_F(Delivery, SubAddressChoosesABoxInsideTheMailFolder) {
+  ASSERT_EQ(mailbox_append(queue("Subject: w\r\n"), "ann_work@example.test", "bob@x"), 1);
+  EXPECT_TRUE(fs::exists(home_ / "mail" / "work"));
+  EXPECT_TRUE(fs::exists(home_ / "mail" / "overview" / "work"));
+  ASSERT_EQ(mailbox_append(queue("Subject: t\r\n"), "ann_../../etc@example.test", "bob@x"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: o\r\n"), "ann_overview@example.test", "bob@x"), 1);
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 2);
+  EXPECT_EQ(mailbox_append(queue("Subject: n\r\n"), "nobody@example.test", "bob@x"), 0);
+  EXPECT_EQ(mailbox_append(queue("Subject: n\r\n"), "ann@elsewhere.test", "bob@x"), 0);
+}
+
+TEST_F(Delivery, FullDiskKeepsTheQueueFileAndTheMailboxAsItWas) {
+  ASSERT_EQ(mailbox_append(queue("Subject: fits\r\n"), "ann", "bob@x"), 1);
+  std::string before = read_file(inbox());
+  std::string overview = read_file(home_ / "mail" / "overview" / "inbox");
+  std::string big = queue("Subject: too big\r\n", std::string(100000, 'y') + "\r\n");
+  struct rlimit old_limit {};
+  getrlimit(RLIMIT_FSIZE, &old_limit);
+  auto old_handler = std::signal(SIGXFSZ, SIG_IGN);
+  struct rlimit small = {static_cast<rlim_t>(before.size() + 50000), old_limit.rlim_max};
+  setrlimit(RLIMIT_FSIZE, &small);
+  int rc = mailbox_append(big, "ann", "bob@x");
+  setrlimit(RLIMIT_FSIZE, &old_limit);
+  std::signal(SIGXFSZ, old_handler);
+  EXPECT_EQ(rc, kAppendTemporaryFailure);
+  EXPECT_TRUE(fs::exists(big));
+  EXPECT_EQ(read_file(inbox()), before);
+  EXPECT_EQ(read_file(home_ / "mail" / "overview" / "inbox"), overview);
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+  // Room again: the kept file goes in whole, with the next identifier.
+  ASSERT_EQ(mailbox_append(big, "ann", "bob@x"), 1);
+  EXPECT_EQ(mailbox_lookup(inbox())->messages.back().uid, 2u);
+}
+
+TEST_F(Delivery, ForwardGoesOnButNeverInACircle) {
+  write_file(home_ / ".forward", "bob@elsewhere.test\n");
+  ASSERT_EQ(mailbox_append(queue("Subject: fwd\r\n"), "ann", "carl@x"), 1);
+  EXPECT_FALSE(fs::exists(inbox()));
+  auto queued = incoming();
+  ASSERT_EQ(queued.size(), 1u);
+  EXPECT_EQ(queued[0].rfind("MAIL FROM:<carl@x>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n", 0), 0u);
+  EXPECT_NE(queued[0].find("Subject: fwd\r\nhello\r\n.\r\n") , std::string::npos);
+
+  // The message coming back through the same forward stays here.
+  std::string back = (dir_ / "back").string();
+  write_file(back, "MAIL FROM:<carl@x>\r\nRCPT TO:<ann@example.test>\r\n" + queued[0].substr(queued[0].find("DATA")));
+  ASSERT_EQ(mailbox_append(back, "ann", "carl@x"), 1);
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+
+  // A forward to oneself delivers here.
+  write_file(home_ / ".forward", "<ann@example.test>\n");
+  ASSERT_EQ(mailbox_append(queue("Subject: self\r\n"), "ann", "carl@x"), 1);
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 2);
+  EXPECT_EQ(incoming().size(), 1u);
+}
+
+TEST_F(Delivery, VacationRepliesOnceAndMarksItsReply) {
+  write_file(home_ / ".vacation", "Away until Monday.\n.hidden dot\n");
+  ASSERT_EQ(mailbox_append(queue("Subject: one\r\n"), "ann", "bob@elsewhere.test"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: two\r\n"), "ann", "bob@elsewhere.test"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: list\r\nList-Id: <l.x>\r\n", "hi\r\n", "list@x"), "ann", "list@x"), 1);
+  auto queued = incoming();
+  ASSERT_EQ(queued.size(), 1u);
+  const std::string& r = queued[0];
+  EXPECT_EQ(r.rfind("MAIL FROM:<ann@example.test>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n", 0), 0u);
+  EXPECT_NE(r.find("\r\nSubject: Vacation Message\r\n"), std::string::npos);
+  EXPECT_NE(r.find("\r\nPrecedence: bulk\r\n"), std::string::npos);
+  EXPECT_NE(r.find("\r\nAuto-Submitted: auto-replied\r\n"), std::string::npos);
+  EXPECT_EQ(r.substr(r.size() - 36), "Away until Monday.\r\n..hidden dot\r\n.\r\n");
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 3);
+}
+
+}  // namespace
+}  // namespace velmor
