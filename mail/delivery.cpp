@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <functional>
+#include <optional>
 #include <vector>
 
 #include "core/filecache.h"
@@ -460,6 +461,111 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
   }
   mailbox_overview_write(*box);
   return 1;
+}
+
+// ---- read receipts --------------------------------------------------------------
+
+namespace {
+
+// The address a receipt goes to: of the From value's words, the last that
+// holds an "@" (angle brackets and quotes removed); without one, the words
+// joined and completed with our domain.
+std::string receipt_address(std::string_view from) {
+  std::string last, words;
+  std::size_t i = 0;
+  while (i < from.size()) {
+    while (i < from.size() && (from[i] == ' ' || from[i] == '\t' || from[i] == ',')) ++i;
+    if (i >= from.size()) break;
+    std::string word;
+    if (from[i] == '"') {
+      std::size_t end = from.find('"', i + 1);
+      word = from.substr(i + 1, end == std::string_view::npos ? std::string_view::npos : end - i - 1);
+      i = end == std::string_view::npos ? from.size() : end + 1;
+    } else if (from[i] == '<') {
+      std::size_t end = from.find('>', i + 1);
+      word = from.substr(i + 1, end == std::string_view::npos ? std::string_view::npos : end - i - 1);
+      i = end == std::string_view::npos ? from.size() : end + 1;
+    } else if (from[i] == '(') {
+      std::size_t end = from.find(')', i + 1);
+      i = end == std::string_view::npos ? from.size() : end + 1;
+      continue;
+    } else {
+      std::size_t end = from.find_first_of(" \t,<(\"", i);
+      word = from.substr(i, end == std::string_view::npos ? std::string_view::npos : end - i);
+      i = end == std::string_view::npos ? from.size() : end;
+    }
+    if (word.find('@') != std::string::npos) {
+      last = word;
+    } else {
+      words += word;
+    }
+  }
+  if (!last.empty()) return last;
+  if (words.empty()) return {};
+  return words + "@" + mail_primary_domain();
+}
+
+bool plain_address(std::string_view a) {
+  if (a.empty()) return false;
+  for (char c : a) {
+    if (static_cast<unsigned char>(c) <= ' ' || c == '<' || c == '>' || c == 0x7f) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset, std::string_view user) {
+  if (message.flags & msgflag::seen) return 0;
+  message.flags |= msgflag::seen;
+  if (box.unseen > 0) --box.unseen;
+  box.changed = true;
+  if (!(message.flags & msgflag::receipt_wanted)) return 0;
+
+  // The header of the message as stored.
+  FileSource in(box.path);
+  std::uint64_t pos = offset + (message.total_length - message.length);
+  std::uint64_t end = offset + message.header_length;
+  std::vector<std::string> header;
+  while (pos < end && pos < in.size()) {
+    Line line = read_line(in, pos, kHeaderLineKeep);
+    if (line.length == 0 || line_body(line.text).empty()) break;
+    pos += line.length;
+    if ((line.text.front() == ' ' || line.text.front() == '\t') && !header.empty()) continue;
+    header.emplace_back(line_body(line.text));
+  }
+  auto value = [&](std::string_view name) -> std::optional<std::string> {
+    for (const std::string& h : header) {
+      if (h.size() > name.size() && h[name.size()] == ':' && str_istarts_with(h, name)) {
+        return std::string(trim_blanks(std::string_view(h).substr(name.size() + 1)));
+      }
+    }
+    return std::nullopt;
+  };
+  auto from = value("From");
+  auto subject = value("Subject");
+  if (!from || !subject) return 0;  // nobody to tell, or nothing to tell about
+  std::string to = receipt_address(*from);
+  if (!plain_address(to)) return 0;
+  const UserRecord* u = user_find(user);
+  std::string login = u ? u->login : std::string(user);
+  std::string full_name = u ? u->full_name : login;
+  std::string domain = mail_primary_domain();
+  std::string me = login + "@" + domain;
+  auto date = value("Date");
+  std::string text = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + to + ">\r\nDATA\r\nTo: " + *from + "\r\nFrom: " +
+                     full_name + " <" + me + ">\r\nDate: " + date_text(now(), "%a, %d %b %Y %H:%M:%S %Z") +
+                     "\r\nSubject: Read Receipt (Original:" + *subject +
+                     ")\r\n\r\n  This is an automatically generated response to inform you that\r\n     " + full_name +
+                     " <mailto:" + me + ">\r\n  has received, and read your email about:\r\n     " + *subject;
+  if (date) text += "  (" + *date + ")";
+  text += "\r\n\r\n  This is purely an informative message, and does not require any action \r\n  on your "
+          "part.\r\n\r\n  If you believe you should not have recevied this message, or if there any\r\n  other "
+          "problems with this mail, please email <mailto:postmaster@" +
+          domain + ">\r\n\r\n.\r\n";
+  int rc = queue_new_message([&](CacheFile& out) { return filecache_write(out, text); });
+  if (rc) debug("Read receipt could not be queued:", error_text(rc));
+  return rc;
 }
 
 }  // namespace velmor

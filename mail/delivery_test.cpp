@@ -244,5 +244,31 @@ TEST_F(Delivery, VacationRepliesOnceAndMarksItsReply) {
   EXPECT_EQ(mailbox_lookup(inbox())->count, 3);
 }
 
+TEST_F(Delivery, ReadReceiptGoesOnceToTheSender) {
+  ASSERT_EQ(mailbox_append(queue("From: \"Bob B\" <bob@elsewhere.test> (work)\r\nSubject: please confirm\r\n"
+                                 "Date: Tue, 14 Nov 2023 22:13:20 +0000\r\nX-Read-Receipt: Yes\r\n"),
+                           "ann", "bob@elsewhere.test"),
+            1);
+  ASSERT_EQ(mailbox_append(queue("From: carl@x\r\nSubject: no receipt\r\n"), "ann", "carl@x"), 1);
+  Mailbox* box = mailbox_lookup(inbox());
+  ASSERT_EQ(box->unseen, 2);
+  MessageRecord& first = box->messages.front();
+  EXPECT_TRUE(first.flags & msgflag::receipt_wanted);
+  EXPECT_EQ(mailbox_mark_seen(*box, first, 0, "ann"), 0);
+  EXPECT_EQ(mailbox_mark_seen(*box, first, 0, "ann"), 0);
+  EXPECT_EQ(mailbox_mark_seen(*box, box->messages.back(), first.total_length, "ann"), 0);
+  EXPECT_EQ(box->unseen, 0);
+  auto queued = incoming();
+  ASSERT_EQ(queued.size(), 1u);
+  const std::string& r = queued[0];
+  EXPECT_EQ(r.rfind("MAIL FROM:<ann@example.test>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n"
+                    "To: \"Bob B\" <bob@elsewhere.test> (work)\r\nFrom: Ann Lee <ann@example.test>\r\n",
+                    0),
+            0u);
+  EXPECT_NE(r.find("Subject: Read Receipt (Original:please confirm)\r\n"), std::string::npos);
+  EXPECT_NE(r.find("     please confirm  (Tue, 14 Nov 2023 22:13:20 +0000)\r\n"), std::string::npos);
+  EXPECT_EQ(r.substr(r.size() - 5), "\r\n.\r\n");
+}
+
 }  // namespace
 }  // namespace velmor

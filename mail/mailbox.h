@@ -89,6 +89,11 @@ void mailbox_release(Mailbox& box, int owner);
 int mailbox_expunge(Mailbox& box);
 int mailbox_overview_write(Mailbox& box);
 int mailbox_overview_read(Mailbox& box);
+// Marks a message seen by `user` (the message starts at `offset` of the
+// mailbox file). The first time, a message that asked for a read receipt
+// gets one queued to its sender. 0, or non-zero when the receipt could not
+// be queued.
+int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset, std::string_view user);
 
 // ---- the pieces the above are built from (also used by the tests) ----------
 

@@ -112,6 +112,7 @@ std::optional<std::size_t> message_number(const PopSession& s, std::string_view 
 }
 
 void drop_mailbox(SocketRecord& r, PopSession& s) {
+  if (s.box && s.box->changed) mailbox_overview_write(*s.box);  // the seen marks
   if (s.box) mailbox_release(*s.box, r.fd);
   s.box = nullptr;
   s.file.close();
@@ -221,6 +222,8 @@ void retr(SocketRecord& r, PopSession& s, std::string_view arg) {
   s.range_at = 0;
   s.trailer = missing_terminator(tail);
   r.state = popstate::message;
+  // Retrieved is read: a sender who asked gets the receipt, once.
+  mailbox_mark_seen(*s.box, *s.index[*i], s.offsets[*i], r.user_name);
 }
 
 bool starts_status(std::string_view line) {
