@@ -687,6 +687,9 @@ int mailbox_expunge(Mailbox& box) {
   std::string tmp = std::string(path_dir(box.path)) + "/" + leaf.substr(0, 10) + "~";
   UniqueFd out(::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, st.st_mode & 0777));
   if (!out) return errno;
+  if (::fchown(out.get(), st.st_uid, st.st_gid) != 0) {
+    // Only root may give the file away; the mailbox then keeps our owner.
+  }
   int rc = 0;
   std::uint64_t offset = 0, run_start = 0, run_length = 0;
   for (const auto& m : box.messages) {
