@@ -338,7 +338,7 @@ std::string mailbox_box_for_address(std::string_view address) {
   while (!address.empty() && (address.front() == '<' || address.front() == ':' || is_blank(address.front()))) {
     address.remove_prefix(1);
   }
-  std::string_view local = address.substr(0, address.find_first_of("@>\r\n "));
+  std::string_view local = address.substr(0, address.find_first_of("@>\r\n"));
   std::size_t us = local.find('_');
   if (us == std::string_view::npos) return "inbox";
   std::string_view box = local.substr(us + 1);
@@ -587,6 +587,9 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
         return 1;
       }
       MimePart& p = current->parts.emplace_back();
+      p.content_type = type;
+      p.description = desc;
+      p.content_id = id;
       p.length = static_cast<std::uint32_t>(v[0]);
       p.lines = static_cast<std::uint32_t>(v[1]);
       p.body_offset = static_cast<std::uint32_t>(v[2]);
