@@ -208,12 +208,12 @@ TEST_F(Delivery, FullDiskKeepsTheQueueFileAndTheMailboxAsItWas) {
 
 TEST_F(Delivery, ForwardGoesOnButNeverInACircle) {
   write_file(home_ / ".forward", "bob@elsewhere.test\n");
-  ASSERT_EQ(mailbox_append(queue("Subject: fwd\r\n"), "ann", "carl@x"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: fwd\r\n", "hello\r\n", "carl@x"), "ann", "carl@x"), 1);
   EXPECT_FALSE(fs::exists(inbox()));
   auto queued = incoming();
   ASSERT_EQ(queued.size(), 1u);
   EXPECT_EQ(queued[0].rfind("MAIL FROM:<carl@x>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n", 0), 0u);
-  EXPECT_NE(queued[0].find("Subject: fwd\r\nhello\r\n.\r\n") , std::string::npos);
+  EXPECT_NE(queued[0].find("Subject: fwd\r\n\r\nhello\r\n.\r\n"), std::string::npos);
 
   // The message coming back through the same forward stays here.
   std::string back = (dir_ / "back").string();
@@ -240,7 +240,7 @@ TEST_F(Delivery, VacationRepliesOnceAndMarksItsReply) {
   EXPECT_NE(r.find("\r\nSubject: Vacation Message\r\n"), std::string::npos);
   EXPECT_NE(r.find("\r\nPrecedence: bulk\r\n"), std::string::npos);
   EXPECT_NE(r.find("\r\nAuto-Submitted: auto-replied\r\n"), std::string::npos);
-  EXPECT_EQ(r.substr(r.size() - 36), "Away until Monday.\r\n..hidden dot\r\n.\r\n");
+  EXPECT_EQ(r.substr(r.size() - 41), "\r\n\r\nAway until Monday.\r\n..hidden dot\r\n.\r\n");
   EXPECT_EQ(mailbox_lookup(inbox())->count, 3);
 }
 
