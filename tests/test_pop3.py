@@ -153,13 +153,18 @@ class RoundTrip(MailSuite):
             self.pop()
         self.assertEqual(str(refused.exception),
                          str(b'-ERR mailbox already in use: another POP or IMAP session is currently active'))
-        first.sock.close()  # gone without QUIT
+        first.close()  # gone without QUIT
         deadline = time.monotonic() + 10
         while True:
+            p = poplib.POP3('127.0.0.1', self.suite.port('pop'), timeout=10)
             try:
-                again = self.pop()
+                p.user('alice')
+                p.pass_(PASSWORD)
+                again = p
+                self.addCleanup(p.close)
                 break
             except poplib.error_proto:
+                p.close()
                 if time.monotonic() > deadline:
                     raise
                 time.sleep(0.05)
@@ -186,9 +191,9 @@ class BadInput(MailSuite):
         invalid_first = b'-ERR Invalid command; valid commands:  USER,  QUIT\r\n'
         self.assertEqual(talk(b'STAT'), [invalid_first])
         self.assertEqual(talk(b'RETR 1'), [invalid_first])
+        self.assertEqual(talk(b'PASS x'), [invalid_first])  # PASS without USER
         self.assertEqual(talk(b'USER alice'), [b'+OK please send PASS command\r\n'])
         self.assertEqual(talk(b'LIST'), [b'-ERR Invalid command; valid commands:  USER, PASS, QUIT\r\n'])
-        self.assertEqual(talk(b'PASS x'), [invalid_first])  # PASS without USER
         bad = [b'-ERR Invalid username or password, please try again\r\n']
         self.assertEqual(talk(b'USER alice') + talk(b'PASS wrong'), [b'+OK please send PASS command\r\n'] + bad)
         self.assertEqual(talk(b'USER nobody-here') + talk(b'PASS ' + PASSWORD.encode()),
