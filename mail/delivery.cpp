@@ -1,7 +1,6 @@
 // Local delivery: a queued message appended to a user's mailbox, after the
 // receive checks of the user's group and the user's own forward and
 // vacation settings.
-#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -308,8 +307,8 @@ void vacation(const Recipient& r, const QueueLayout& q, std::string_view sender)
 
 // Appends the message to the mailbox file. 0 or an errno value; on failure
 // the file is cut back to `old_size`.
-int append_message(int fd, std::uint64_t old_size, ByteSource& in, const QueueLayout& q, std::string_view user,
-                   std::uint32_t uid) {
+int append_message(CacheFile& box, std::uint64_t old_size, ByteSource& in, const QueueLayout& q,
+                   std::string_view user, std::uint32_t uid) {
   std::string out = mailbox_separator(q.envelope, now());
   int rc = 0;
   std::string tail;  // the last bytes written, to see whether the terminator came
@@ -319,7 +318,7 @@ int append_message(int fd, std::uint64_t old_size, ByteSource& in, const QueueLa
     tail.append(data.substr(data.size() > 5 ? data.size() - 5 : 0));
     if (tail.size() > 5) tail.erase(0, tail.size() - 5);
     if (out.size() >= 64 * 1024) {
-      rc = write_all(fd, out);
+      rc = filecache_write(box, out);
       out.clear();
     }
   };
@@ -377,12 +376,11 @@ int append_message(int fd, std::uint64_t old_size, ByteSource& in, const QueueLa
     if (!tail.empty() && tail.back() != '\n') put("\r\n");
     put(".\r\n");
   }
-  if (!rc) rc = write_all(fd, out);
-  if (!rc && ::fsync(fd) != 0) rc = errno;
+  if (!rc) rc = filecache_write(box, out);
+  if (!rc) rc = filecache_sync(box);
   if (rc) {
-    while (::ftruncate(fd, static_cast<off_t>(old_size)) != 0 && errno == EINTR) {
-    }
-    ::fsync(fd);
+    filecache_truncate(box, old_size);
+    filecache_sync(box);
   }
   return rc;
 }
@@ -431,24 +429,36 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
   std::string path = path_join(dir, box_name);
   debug("Trying to open mailbox");
   // Never through a link: the box name came from the network.
-  UniqueFd fd(::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
   struct stat st {};
-  int error = !fd ? errno : (::fstat(fd.get(), &st) != 0 ? errno : (S_ISREG(st.st_mode) ? 0 : EISDIR));
+  bool existed = ::lstat(path.c_str(), &st) == 0;
+  int error = existed && !S_ISREG(st.st_mode) ? ELOOP : 0;
+  CacheFile file;
+  if (!error) {
+    errno = 0;
+    file = filecache_open(path, FileMode::append);
+    if (!file) error = errno ? errno : EIO;
+    if (file && !existed) ::chmod(path.c_str(), 0600);  // mail is private
+  }
   Mailbox* box = error ? nullptr : mailbox_lookup(path);
   if (!error && !box) error = EIO;
   if (error) {
     debug("Mailbox open failed");
+    if (file) filecache_abandon(file);
     if (is_temporary(error)) return kAppendTemporaryFailure;
     mail_move_to_oddments(queue_file, strprintf("Couldn't open mailbox for user `%s'", r.user->login.c_str()));
     return 1;
   }
-  std::uint64_t old_size = static_cast<std::uint64_t>(st.st_size);
+  std::uint64_t old_size = filecache_length(file);
   std::uint32_t uid = box->next_uid ? box->next_uid : 1;
-  if (int rc = append_message(fd.get(), old_size, in, q, r.user->login, uid)) {
+  if (int rc = append_message(file, old_size, in, q, r.user->login, uid)) {
+    filecache_abandon(file);
     log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
     return kAppendTemporaryFailure;
   }
-  fd.close();
+  if (int rc = filecache_close(file)) {
+    log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
+    return kAppendTemporaryFailure;
+  }
   box->flags |= boxflag::new_mail | boxflag::delivered;
   FileSource written(path);
   std::size_t before = box->messages.size();
