@@ -16,6 +16,7 @@
 #include "core/util.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
+#include "mail/test_files.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -24,18 +25,8 @@ namespace {
 
 namespace fs = std::filesystem;
 
-std::string read_file(const fs::path& p) {
-  std::ifstream f(p, std::ios::binary);
-  std::stringstream ss;
-  ss << f.rdbuf();
-  return ss.str();
-}
-
-void write_file(const fs::path& p, std::string_view data) {
-  fs::create_directories(p.parent_path());
-  std::ofstream f(p, std::ios::binary | std::ios::trunc);
-  f << data;
-}
+using testing_files::read_file;
+using testing_files::write_file;
 
 QueueLayout layout_of(std::string_view text) {
   TextSource in(text);

@@ -14,6 +14,7 @@
 
 #include "core/util.h"
 #include "mail/mailfile.h"
+#include "mail/test_files.h"
 
 namespace velmor {
 namespace {
@@ -33,17 +34,8 @@ Mailbox parse(std::string_view text) {
   return box;
 }
 
-std::string read_file(const fs::path& p) {
-  std::ifstream f(p, std::ios::binary);
-  std::stringstream ss;
-  ss << f.rdbuf();
-  return ss.str();
-}
-
-void write_file(const fs::path& p, std::string_view data) {
-  std::ofstream f(p, std::ios::binary | std::ios::trunc);
-  f << data;
-}
+using testing_files::read_file;
+using testing_files::write_file;
 
 class TempDir : public ::testing::Test {
  protected:
