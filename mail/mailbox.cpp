@@ -26,7 +26,6 @@ std::list<Mailbox> g_boxes;  // lives as long as the process
 
 std::time_t now() { return server_now ? server_now : std::time(nullptr); }
 
-bool starts_ci(std::string_view text, std::string_view prefix) { return str_istarts_with(text, prefix); }
 
 bool is_blank(char c) { return c == ' ' || c == '\t'; }
 
@@ -186,14 +185,14 @@ class MimeScanner {
   void flush_header() {
     if (header_.empty() || !current_) return;
     std::string_view h = header_;
-    if (starts_ci(h, "content-type:")) {
+    if (str_istarts_with(h, "content-type:")) {
       current_->content_type = first_line_value(h);
       if (str_istarts_with(current_->content_type, "multipart")) pending_boundary_ = boundary_of(h);
-    } else if (starts_ci(h, "content-id:")) {
+    } else if (str_istarts_with(h, "content-id:")) {
       current_->content_id = first_line_value(h);
-    } else if (starts_ci(h, "content-description:")) {
+    } else if (str_istarts_with(h, "content-description:")) {
       current_->description = first_line_value(h);
-    } else if (starts_ci(h, "content-transfer-encoding:")) {
+    } else if (str_istarts_with(h, "content-transfer-encoding:")) {
       current_->encoding = encoding_code(value_after_colon(h));
     }
     header_.clear();
@@ -309,7 +308,7 @@ std::string mailbox_separator(std::string_view envelope_line, std::time_t when) 
 }
 
 std::time_t mailbox_separator_date(std::string_view line) {
-  if (!starts_ci(line, "From ")) return kBadDate;
+  if (!str_istarts_with(line, "From ")) return kBadDate;
   std::string_view rest = line.substr(5);
   while (!rest.empty() && is_blank(rest.front())) rest.remove_prefix(1);
   std::size_t end = rest.find_first_of(" \t");
@@ -330,8 +329,8 @@ std::time_t mailbox_separator_date(std::string_view line) {
 
 bool mailbox_header_dropped(std::string_view line) {
   // Our own state travels in these headers; arriving mail must not set it.
-  return starts_ci(line, "Status:") || starts_ci(line, "From ") || starts_ci(line, "X-UID:") ||
-         starts_ci(line, "X-UIDL:") || starts_ci(line, "X-Status:") || starts_ci(line, "X-RCPT-TO:");
+  return str_istarts_with(line, "Status:") || str_istarts_with(line, "From ") || str_istarts_with(line, "X-UID:") ||
+         str_istarts_with(line, "X-UIDL:") || str_istarts_with(line, "X-Status:") || str_istarts_with(line, "X-RCPT-TO:");
 }
 
 std::string mailbox_box_for_address(std::string_view address) {
@@ -378,7 +377,7 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
   if (first.length == 0) return kNoMessage;
   std::uint64_t separator_length = 0;
   rec.internal_date = now();
-  if (starts_ci(first.text, "From ")) {
+  if (str_istarts_with(first.text, "From ")) {
     std::time_t t = mailbox_separator_date(first.text);
     if (t != kBadDate) rec.internal_date = t;
     separator_length = first.length;
@@ -396,37 +395,37 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
     if (h.empty()) return;
     switch (h.front() | 0x20) {
       case 'c':
-        if (starts_ci(h, "content-type:")) boundary = boundary_of(whole_value(h));
+        if (str_istarts_with(h, "content-type:")) boundary = boundary_of(whole_value(h));
         break;
       case 'd':
-        if (starts_ci(h, "Date:")) {
+        if (str_istarts_with(h, "Date:")) {
           std::time_t t = parse_date(trim_blanks(line_cut(value_after_colon(h))));
           rec.sent_date = t == kBadDate ? 0 : t;
         }
         break;
       case 'f':
-        if (starts_ci(h, "From:")) rec.from = first_line_value(h);
+        if (str_istarts_with(h, "From:")) rec.from = first_line_value(h);
         break;
       case 'r':
-        if (starts_ci(h, "Reply-To:")) rec.reply_to = first_line_value(h);
+        if (str_istarts_with(h, "Reply-To:")) rec.reply_to = first_line_value(h);
         break;
       case 's':
-        if (starts_ci(h, "Subject:")) rec.subject = first_line_value(h);
-        if (starts_ci(h, "Status:") && line_cut(value_after_colon(h)).find('R') != std::string_view::npos) {
+        if (str_istarts_with(h, "Subject:")) rec.subject = first_line_value(h);
+        if (str_istarts_with(h, "Status:") && line_cut(value_after_colon(h)).find('R') != std::string_view::npos) {
           rec.flags |= msgflag::seen;
         }
         break;
       case 't':
-        if (starts_ci(h, "To:")) rec.to = first_line_value(h);
+        if (str_istarts_with(h, "To:")) rec.to = first_line_value(h);
         break;
       case 'x':
-        if (starts_ci(h, "X-Status:")) {
+        if (str_istarts_with(h, "X-Status:")) {
           std::string_view v = line_cut(value_after_colon(h));
           if (v.find('D') != std::string_view::npos) rec.flags |= msgflag::deleted;
           if (v.find('A') != std::string_view::npos) rec.flags |= msgflag::answered;
-        } else if (starts_ci(h, "X-UID:")) {
+        } else if (str_istarts_with(h, "X-UID:")) {
           uid = parse_u32(value_after_colon(h));
-        } else if (starts_ci(h.substr(2), "read-receipt: yes") || starts_ci(h.substr(2), "return-receipt-to:")) {
+        } else if (str_istarts_with(h.substr(2), "read-receipt: yes") || str_istarts_with(h.substr(2), "return-receipt-to:")) {
           rec.flags |= msgflag::receipt_wanted;
         }
         break;
@@ -440,7 +439,7 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
   while (pos < in.size()) {
     Line line = read_line(in, pos);
     if (line.length == 0) break;
-    if (after_terminator && starts_ci(line.text, "From ")) {
+    if (after_terminator && str_istarts_with(line.text, "From ")) {
       end = pos;
       break;
     }
