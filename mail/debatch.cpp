@@ -19,6 +19,7 @@
 #include "core/util.h"
 #include "mail/alias.h"
 #include "mail/mailbox.h"
+#include "mail/pop_server.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
@@ -450,6 +451,7 @@ int mail_init() {
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
   smtp_server_register();
+  pop_server_init();
   return 0;
 }
 
