@@ -18,6 +18,8 @@
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
 #include "mail/queue.h"
+#include "mail/queue_internal.h"
+#include "mail/queue_text.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -56,7 +58,7 @@ int queue_new_message(const std::function<int(CacheFile&)>& fill) {
   std::string path = filecache_path(file);
   int rc = fill(file);
   if (rc) {
-    filecache_destroy(file);
+    queue_file_discard(file);
     return rc;
   }
   if ((rc = filecache_close(file)) != 0) return rc;
@@ -77,23 +79,12 @@ int copy_to_queue(ByteSource& in, std::uint64_t offset, std::uint64_t length, Ca
   return 0;
 }
 
-// Text as the body of a message in transmission form: CR LF lines, a dot
-// doubled at the start of a line, ending with the "." line.
+// Text as the body of a message in transmission form, ending with the "."
+// line.
 std::string as_transmission_body(std::string_view text) {
-  std::string out;
-  out.reserve(text.size() + 16);
-  while (!text.empty()) {
-    std::size_t lf = text.find('\n');
-    std::string_view line = text.substr(0, lf);
-    if (!line.empty() && line.back() == '\r') line.remove_suffix(1);
-    if (!line.empty() && line.front() == '.') out += '.';
-    out.append(line);
-    out += "\r\n";
-    if (lf == std::string_view::npos) break;
-    text.remove_prefix(lf + 1);
-  }
-  out += ".\r\n";
-  return out;
+  std::string out = mail_body_lines(text);
+  if (!out.empty() && out.back() != '\n') out += "\r\n";
+  return out + ".\r\n";
 }
 
 }  // namespace
@@ -296,7 +287,7 @@ void vacation(const Recipient& r, const QueueLayout& q, std::string_view sender)
   std::string s(sender);
   int rc = queue_new_message([&](CacheFile& out) {
     std::string msg = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + s + ">\r\nDATA\r\n";
-    msg += "Date: " + date_text(now(), "%a, %d %b %Y %H:%M:%S %Z") + "\r\n";
+    msg += "Date: " + mail_date_text(now()) + "\r\n";
     msg += "From: " + me + "\r\nTo: " + s + "\r\nSubject: Vacation Message\r\n";
     msg += "Precedence: bulk\r\nAuto-Submitted: auto-replied\r\n\r\n";
     msg += as_transmission_body(body);
@@ -564,7 +555,7 @@ int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset
   std::string me = login + "@" + domain;
   auto date = value("Date");
   std::string text = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + to + ">\r\nDATA\r\nTo: " + *from + "\r\nFrom: " +
-                     full_name + " <" + me + ">\r\nDate: " + date_text(now(), "%a, %d %b %Y %H:%M:%S %Z") +
+                     full_name + " <" + me + ">\r\nDate: " + mail_date_text(now()) +
                      "\r\nSubject: Read Receipt (Original:" + *subject +
                      ")\r\n\r\n  This is an automatically generated response to inform you that\r\n     " + full_name +
                      " <mailto:" + me + ">\r\n  has received, and read your email about:\r\n     " + *subject;
