@@ -30,6 +30,7 @@
 #include "core/scheduler.h"
 #include "core/sockets.h"
 #include "core/strfmt.h"
+#include "mail/queue.h"
 #include "users/admin.h"
 
 namespace velmor {
@@ -285,7 +286,7 @@ void wait_until(std::int64_t tick) {
 // Every half second; each poll returns quickly.
 void tick() {
   if (mail_transfer_state) mail_transfer_poll();
-  // mail: mail_poll();
+  mail_poll();
   log_poll();
   schedule_poll();
   process_poll();
@@ -392,7 +393,8 @@ int start_and_run() {
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // "Loading user database", "Loading user group options"; users_init says what failed.
   if (int rc = users_init()) return fail(nullptr, rc);
-  // mail: "Initialising mail system", mail_init().
+  log_message("Initialising mail system");
+  mail_init();
   log_message("Starting listening sockets");
   if (sockets_init() != 0) {
     log_message("Socket initialisation failed - see logs for more info");
