@@ -146,7 +146,7 @@ void pass(SocketRecord& r, PopSession& s, std::string_view password, bool& disca
     return;
   }
   auto group = user_group(user->login);
-  if (group && !group->permits("mail.pop.fetch")) {
+  if (!group_permits(group, "mail.pop.fetch")) {
     reply(r, "-ERR access to this server forbidden\r\n");
     s.phase = 'd';
     return;
