@@ -16,7 +16,8 @@
 #include "core/util.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
-#include "mail/test_files.h"
+#include "mail/queue_test_fixture.h"
+#include "users/test_files.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -85,25 +86,16 @@ TEST(Vacation, AtMostOncePerSenderPerWeek) {
   fs::remove_all(tmpl);
 }
 
-// A site with the user ann (home under a temporary folder) and one group
-// that honours forward and vacation files.
-class Delivery : public ::testing::Test {
+// The scratch queue with the user ann (home inside it) and one group that
+// honours forward and vacation files.
+class Delivery : public QueueFixture {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/velmor-delivery-XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
-    config_reset();
-    paths.tmp_dir = (dir_ / "tmp").string();
-    fs::create_directories(dir_ / "tmp");
-    fs::create_directories(dir_ / "in");
-    fs::create_directories(dir_ / "odd");
-    config.mail_domains = "example.test";
-    config.mail_dir_incoming = (dir_ / "in").string();
-    config.mail_dir_oddments = (dir_ / "odd").string();
-    config.admin_email = "postmaster@example.test";
-    ASSERT_EQ(filecache_init(), 0);
+    QueueFixture::SetUp();
+    dir_ = root;
     home_ = dir_ / "ann";
+    fs::create_directories(home_);
+    fs::create_directories(dir_ / "odd");
     write_file(dir_ / "users", "ann," + md5_crypt("pw", "$1$abcde$") + ",Ann Lee," + home_.string() + ",0\n");
     write_file(dir_ / "groups", "#0\n%mail.forward: yes\n%mail.vacation: yes\n%mail.pop.fetch: yes\n");
     ASSERT_EQ(user_load((dir_ / "users").string()), 0);
@@ -112,22 +104,20 @@ class Delivery : public ::testing::Test {
   }
   void TearDown() override {
     mailbox_cache_clear();
-    fs::remove_all(dir_);
+    QueueFixture::TearDown();
   }
 
   std::string queue(std::string_view header, std::string_view body = "hello\r\n",
                     std::string_view sender = "bob@elsewhere.test") {
     std::string path = (dir_ / ("q" + std::to_string(++n_))).string();
-    write_file(path, "MAIL FROM:<" + std::string(sender) + ">\r\nRCPT TO:<ann@example.test>\r\nDATA\r\n" +
+    write_file(path, "MAIL FROM:<" + std::string(sender) + ">\r\nRCPT TO:<ann@site.example>\r\nDATA\r\n" +
                          std::string(header) + "\r\n" + std::string(body) + ".\r\n");
     return path;
   }
   std::string inbox() const { return (home_ / "mail" / "inbox").string(); }
-  std::vector<std::string> incoming() const {
+  std::vector<std::string> incoming() {
     std::vector<std::string> out;
-    for (const auto& e : fs::directory_iterator(dir_ / "in")) {
-      if (e.path().filename().string()[0] != '.') out.push_back(read_file(e.path()));
-    }
+    for (const std::string& path : folder_names(root + "/in", true)) out.push_back(read_file(path));
     return out;
   }
 
@@ -139,7 +129,7 @@ TEST_F(Delivery, StateHeadersAreReplacedAndIdentifiersRise) {
   std::string q1 = queue("From: bob@elsewhere.test\r\nStatus: RO\r\nX-UID: 77\r\nx-status: D\r\n"
                          "X-Keywords: x\r\n  continued\r\nSubject: first\r\n",
                          "\r\n\r\n.. dotted\r\nFrom here on\r\n");
-  ASSERT_EQ(mailbox_append(q1, "ann@example.test", "bob@elsewhere.test"), 1);
+  ASSERT_EQ(mailbox_append(q1, "ann@site.example", "bob@elsewhere.test"), 1);
   ASSERT_EQ(mailbox_append(queue("Subject: second\r\n"), "ann", "bob@elsewhere.test"), 1);
   std::string box = read_file(inbox());
   EXPECT_EQ(box.find("Status:"), std::string::npos);
@@ -164,13 +154,13 @@ TEST_F(Delivery, StateHeadersAreReplacedAndIdentifiersRise) {
 }
 
 TEST_F(Delivery, SubAddressChoosesABoxInsideTheMailFolder) {
-  ASSERT_EQ(mailbox_append(queue("Subject: w\r\n"), "ann_work@example.test", "bob@x"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: w\r\n"), "ann_work@site.example", "bob@x"), 1);
   EXPECT_TRUE(fs::exists(home_ / "mail" / "work"));
   EXPECT_TRUE(fs::exists(home_ / "mail" / "overview" / "work"));
-  ASSERT_EQ(mailbox_append(queue("Subject: t\r\n"), "ann_../../etc@example.test", "bob@x"), 1);
-  ASSERT_EQ(mailbox_append(queue("Subject: o\r\n"), "ann_overview@example.test", "bob@x"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: t\r\n"), "ann_../../etc@site.example", "bob@x"), 1);
+  ASSERT_EQ(mailbox_append(queue("Subject: o\r\n"), "ann_overview@site.example", "bob@x"), 1);
   EXPECT_EQ(mailbox_lookup(inbox())->count, 2);
-  EXPECT_EQ(mailbox_append(queue("Subject: n\r\n"), "nobody@example.test", "bob@x"), 0);
+  EXPECT_EQ(mailbox_append(queue("Subject: n\r\n"), "nobody@site.example", "bob@x"), 0);
   EXPECT_EQ(mailbox_append(queue("Subject: n\r\n"), "ann@elsewhere.test", "bob@x"), 0);
 }
 
@@ -208,12 +198,12 @@ TEST_F(Delivery, ForwardGoesOnButNeverInACircle) {
 
   // The message coming back through the same forward stays here.
   std::string back = (dir_ / "back").string();
-  write_file(back, "MAIL FROM:<carl@x>\r\nRCPT TO:<ann@example.test>\r\n" + queued[0].substr(queued[0].find("DATA")));
+  write_file(back, "MAIL FROM:<carl@x>\r\nRCPT TO:<ann@site.example>\r\n" + queued[0].substr(queued[0].find("DATA")));
   ASSERT_EQ(mailbox_append(back, "ann", "carl@x"), 1);
   EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
 
   // A forward to oneself delivers here.
-  write_file(home_ / ".forward", "<ann@example.test>\n");
+  write_file(home_ / ".forward", "<ann@site.example>\n");
   ASSERT_EQ(mailbox_append(queue("Subject: self\r\n"), "ann", "carl@x"), 1);
   EXPECT_EQ(mailbox_lookup(inbox())->count, 2);
   EXPECT_EQ(incoming().size(), 1u);
@@ -227,7 +217,7 @@ TEST_F(Delivery, VacationRepliesOnceAndMarksItsReply) {
   auto queued = incoming();
   ASSERT_EQ(queued.size(), 1u);
   const std::string& r = queued[0];
-  EXPECT_EQ(r.rfind("MAIL FROM:<ann@example.test>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n", 0), 0u);
+  EXPECT_EQ(r.rfind("MAIL FROM:<ann@site.example>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n", 0), 0u);
   EXPECT_NE(r.find("\r\nSubject: Vacation Message\r\n"), std::string::npos);
   EXPECT_NE(r.find("\r\nPrecedence: bulk\r\n"), std::string::npos);
   EXPECT_NE(r.find("\r\nAuto-Submitted: auto-replied\r\n"), std::string::npos);
@@ -252,8 +242,8 @@ TEST_F(Delivery, ReadReceiptGoesOnceToTheSender) {
   auto queued = incoming();
   ASSERT_EQ(queued.size(), 1u);
   const std::string& r = queued[0];
-  EXPECT_EQ(r.rfind("MAIL FROM:<ann@example.test>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n"
-                    "To: \"Bob B\" <bob@elsewhere.test> (work)\r\nFrom: Ann Lee <ann@example.test>\r\n",
+  EXPECT_EQ(r.rfind("MAIL FROM:<ann@site.example>\r\nRCPT TO:<bob@elsewhere.test>\r\nDATA\r\n"
+                    "To: \"Bob B\" <bob@elsewhere.test> (work)\r\nFrom: Ann Lee <ann@site.example>\r\n",
                     0),
             0u);
   EXPECT_NE(r.find("Subject: Read Receipt (Original:please confirm)\r\n"), std::string::npos);

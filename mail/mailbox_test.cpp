@@ -14,7 +14,7 @@
 
 #include "core/util.h"
 #include "mail/mailfile.h"
-#include "mail/test_files.h"
+#include "users/test_files.h"
 
 namespace velmor {
 namespace {
