@@ -452,8 +452,8 @@ void process(SocketRecord& r, PopSession& s) {
     if (s.last_cr && !in.empty()) {
       s.last_cr = false;
       if (in.front() == '\n') {
-        r.read_buf.consume(1);
-        in.remove_prefix(1);
+        r.read_buf.consume(1);  // moves the data: view it again
+        in = r.read_buf.view();
       }
     }
     if (s.overlong_pending) {

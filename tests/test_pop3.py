@@ -206,6 +206,11 @@ class BadInput(MailSuite):
         # A line longer than the input buffer is refused once, as a whole.
         self.assertEqual(talk(b'USER ' + b'b' * 200000), [b'-ERR Bad command - too long\r\n'])
         self.assertEqual(talk(b'NOOP'), [b'+OK\r\n'])
+        # A line end split between two packets is still one line end.
+        s.sendall(b'NOOP\r')
+        self.assertEqual(f.readline(), b'+OK\r\n')
+        time.sleep(0.05)
+        self.assertEqual(talk(b'\nNOOP'), [b'+OK\r\n'])
 
         # The other forms of the name the user database knows.
         self.assertEqual(talk(b'USER alice.liddell')[0], b'+OK please send PASS command\r\n')
