@@ -1,0 +1,287 @@
+"""The SMTP server with real clients: smtplib, raw sockets, swaks and curl.
+
+Debatching is off (mail.debatch.time 0), so every accepted message stays in
+the incoming queue where the tests read it back.
+"""
+import os
+import shutil
+import smtplib
+import socket
+import subprocess
+import threading
+import time
+import unittest
+
+from harness import Suite, SuiteTestCase
+
+NO_DEBATCH = {'mail.debatch.time': '0', 'mail.domains': 'localhost, site.example'}
+
+
+def queue_files(suite, folder='mail/in'):
+    d = suite.path(folder)
+    return sorted((os.path.join(d, n) for n in os.listdir(d) if n.isdigit()),
+                  key=lambda p: int(os.path.basename(p)))
+
+
+def hidden_files(suite, folder='mail/in'):
+    return [n for n in os.listdir(suite.path(folder)) if n.startswith('.')]
+
+
+def read(path):
+    with open(path, 'rb') as f:
+        return f.read()
+
+
+class Conversation:
+    """A raw SMTP connection for the replies clients don't let us see."""
+
+    def __init__(self, port):
+        self.sock = socket.create_connection(('127.0.0.1', port), timeout=10)
+        self.buf = b''
+        self.greeting = self.line()
+
+    def line(self):
+        while b'\r\n' not in self.buf:
+            chunk = self.sock.recv(65536)
+            if not chunk:
+                raise EOFError('connection closed; got %r' % self.buf)
+            self.buf += chunk
+        line, self.buf = self.buf.split(b'\r\n', 1)
+        return line.decode('latin-1')
+
+    def send(self, data):
+        self.sock.sendall(data if isinstance(data, bytes) else data.encode('latin-1'))
+
+    def cmd(self, text):
+        self.send(text + '\r\n')
+        return self.line()
+
+    def close(self):
+        self.sock.close()
+
+
+class SmtpServerTest(SuiteTestCase):
+    config = NO_DEBATCH
+
+    def test_smtplib_local_and_remote_recipients_from_loopback(self):
+        message = ('From: Ann <ann@far.example>\r\nTo: postmaster@localhost\r\n'
+                   'Subject: greetings\r\n\r\nfirst line\r\n.hidden dot line\r\n..two dots\r\nlast\r\n')
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
+            refused = c.sendmail('ann@far.example', ['postmaster@localhost', 'bob@remote.example'], message)
+            self.assertEqual(refused, {})
+            # smtplib tried EHLO first, got the unknown-command reply and fell back.
+            self.assertIsNone(c.esmtp_features.get('size'))
+        files = queue_files(self.suite)
+        self.assertEqual(len(files), 1)
+        data = read(files[0])
+        head, body = data.split(b'\r\n\r\n', 1)
+        lines = head.split(b'\r\n')
+        self.assertEqual(lines[0], b'MAIL FROM:<ann@far.example>')
+        self.assertEqual(lines[1], b'RCPT TO:<postmaster@localhost>')
+        self.assertEqual(lines[2], b'RCPT TO:<bob@remote.example>')
+        self.assertEqual(lines[3], b'DATA')
+        self.assertEqual(lines[4], b'Received: from 127.0.0.1')
+        self.assertTrue(lines[5].startswith(b'\tby ') and b'with SMTP (Velmor Server Suite v2.0.49 [Linux/i386]);' in lines[5])
+        self.assertRegex(lines[6].decode(), r'^\t\w{3}, \d\d \w{3} \d{4} \d\d:\d\d:\d\d [+-]\d{4}$')
+        self.assertEqual(lines[7], b'X-Sender: ann@far.example')
+        self.assertEqual(lines[8], b'From: Ann <ann@far.example>')
+        # No Date in the message: one was added as its last header line.
+        self.assertRegex(lines[-1].decode(), r'^Date: \w{3}, \d\d \w{3} \d{4} \d\d:\d\d:\d\d [+-]\d{4}$')
+        # Dot lines stay in their stuffed form, and the terminator is stored.
+        self.assertEqual(body, b'first line\r\n..hidden dot line\r\n...two dots\r\nlast\r\n.\r\n')
+        self.assertEqual(hidden_files(self.suite), [])
+
+    def test_reply_texts_and_command_errors(self):
+        c = Conversation(self.suite.port('smtp'))
+        self.assertRegex(c.greeting, r'^220 \S+ Velmor Server Suite SMTP Server  \(v2\.0\.49 \[Linux/i386\]\) ready at '
+                                     r'\d\d:\d\d:\d\d, \d\d \w{3} - Report problems to \S+$')
+        self.assertEqual(c.cmd('EHLO me.example'), '500 Unknown command:EHLO')
+        self.assertEqual(c.cmd('HELO me.example'), "250 Hello me.example, how's life?")
+        self.assertEqual(c.cmd('VERYLONGVERB x'), '500 Bad command - too long')
+        self.assertEqual(c.line(), '500 Unknown command:VERYLONGVE')
+        self.assertEqual(c.cmd('RCPT TO:<postmaster@localhost>'), '503 Need MAIL before RCPT')
+        self.assertEqual(c.cmd('DATA'), '503 Need MAIL before DATA')
+        self.assertEqual(c.cmd('MAIL FROM x'), '501 Syntax: MAIL FROM:<address>')
+        self.assertEqual(c.cmd('MAIL FROM:<' + 'a' * 300 + '@x>'), '501 Address too long')
+        self.assertEqual(c.cmd('MAIL FROM:<>'), '250 OK Sender accepted')
+        self.assertEqual(c.cmd('DATA'), '503 Need RCPT before DATA')
+        self.assertEqual(c.cmd('RCPT TO:<>'), '501 Syntax: RCPT TO:<address>')
+        self.assertEqual(c.cmd('VRFY nosuchuser'), '550 Unknown user (Server only checks mailbox/login names)')
+        self.assertEqual(c.cmd('TURN'), '502 TURN not available')
+        self.assertEqual(c.cmd('NOOP'), '250 OK')
+        self.assertEqual(c.cmd('RSET'), '250 Reset OK')
+        # Bare LF line ends are accepted for commands.
+        c.send('HELO bare\n')
+        self.assertEqual(c.line(), "250 Hello bare, how's life?")
+        # QUIT after RCPT without DATA leaves nothing behind.
+        self.assertEqual(c.cmd('MAIL FROM:<x@far.example>'), '250 OK Sender accepted')
+        self.assertEqual(c.cmd('RCPT TO:<postmaster@localhost>'), '250 OK Recipient syntactically correct')
+        self.assertRegex(c.cmd('QUIT'), r'^221 \S+ Velmor SMTP Server \(2\.0\.49\) closing connection at ')
+        c.close()
+        time.sleep(0.3)
+        self.assertEqual(queue_files(self.suite), [])
+        self.assertEqual(hidden_files(self.suite), [])
+
+    def test_pipelined_commands_and_a_client_that_does_not_read(self):
+        c = Conversation(self.suite.port('smtp'))
+        # Three commands in one send: three replies, and the null sender is "Unknown".
+        c.send('MAIL FROM:<>\r\nRCPT TO:<postmaster@localhost>\r\nDATA\r\nSubject: p\r\n\r\nbody\r\n.\r\n')
+        self.assertEqual(c.line(), '250 OK Sender accepted')
+        self.assertEqual(c.line(), '250 OK Recipient syntactically correct')
+        self.assertTrue(c.line().startswith('354 '))
+        self.assertEqual(c.line(), '250 OK')
+        self.assertIn(b'\r\nX-Sender: Unknown\r\n', read(queue_files(self.suite)[0]))
+        # Far more NOOPs than the output buffer holds replies for, unread:
+        # the server waits for the client instead of dropping replies.
+        count = 6000
+        c.send('NOOP\r\n' * count)
+        time.sleep(0.5)
+        replies = [c.line() for _ in range(count)]
+        self.assertEqual(set(replies), {'250 OK'})
+        self.assertEqual(c.cmd('NOOP'), '250 OK')
+        c.close()
+
+    def test_overlong_line_is_refused_and_the_transaction_survives(self):
+        c = Conversation(self.suite.port('smtp'))
+        self.assertEqual(c.cmd('MAIL FROM:<ann@far.example>'), '250 OK Sender accepted')
+        c.send('RCPT TO:<' + 'x' * 100000 + '@localhost>\r\n')
+        self.assertEqual(c.line(), '500 Line too long')
+        self.assertEqual(c.cmd('RCPT TO:<postmaster@localhost>'), '250 OK Recipient syntactically correct')
+        self.assertTrue(c.cmd('DATA').startswith('354'))
+        c.send('Subject: s\r\n\r\nok\r\n.\r\n')
+        self.assertEqual(c.line(), '250 OK')
+        c.close()
+        data = read(queue_files(self.suite)[0])
+        self.assertEqual(data.count(b'RCPT TO'), 1)
+
+    def test_bare_lf_message_is_stored_with_crlf(self):
+        c = Conversation(self.suite.port('smtp'))
+        c.cmd('MAIL FROM:<ann@far.example>')
+        c.cmd('RCPT TO:<postmaster@localhost>')
+        self.assertTrue(c.cmd('DATA').startswith('354'))
+        c.send('Subject: bare\nDate: Mon, 1 Jan 2024 00:00:00 +0000\n\nline one\nline two\n.\n')
+        self.assertEqual(c.line(), '250 OK')
+        c.close()
+        data = read(queue_files(self.suite)[0])
+        self.assertTrue(data.endswith(b'\r\n\r\nline one\r\nline two\r\n.\r\n'))
+        self.assertNotIn(b'\n', data.replace(b'\r\n', b''))
+        self.assertEqual(data.count(b'\r\nDate:'), 1)
+
+    def test_ten_megabyte_message(self):
+        line = b'0123456789' * 7 + b'\r\n'
+        body = line * (10 * 1024 * 1024 // len(line) + 1)
+        message = b'Subject: big\r\n\r\n' + body
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=30) as c:
+            c.sendmail('ann@far.example', ['postmaster@localhost'], message)
+        data = read(queue_files(self.suite)[0])
+        self.assertTrue(data.endswith(body + b'.\r\n'))
+
+    def test_disconnect_in_the_middle_of_data_leaves_no_file(self):
+        c = Conversation(self.suite.port('smtp'))
+        c.cmd('MAIL FROM:<ann@far.example>')
+        c.cmd('RCPT TO:<postmaster@localhost>')
+        self.assertTrue(c.cmd('DATA').startswith('354'))
+        c.send(b'Subject: cut\r\n\r\n' + b'x' * 200000 + b'\r\nmore')
+        time.sleep(0.3)
+        c.close()
+        time.sleep(0.5)
+        self.assertEqual(queue_files(self.suite), [])
+        self.assertEqual(hidden_files(self.suite), [])
+        # The server is still there for the next client.
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as s:
+            s.sendmail('a@far.example', ['postmaster@localhost'], 'Subject: after\r\n\r\nx\r\n')
+        self.assertEqual(len(queue_files(self.suite)), 1)
+
+    @unittest.skipUnless(shutil.which('swaks'), 'swaks is not installed')
+    def test_swaks(self):
+        out = subprocess.run(['swaks', '--server', '127.0.0.1', '--port', str(self.suite.port('smtp')),
+                              '--from', 'ann@far.example', '--to', 'postmaster@localhost',
+                              '--header', 'Subject: from swaks', '--body', 'swaks body'],
+                             capture_output=True, text=True, timeout=30)
+        self.assertEqual(out.returncode, 0, out.stdout + out.stderr)
+        data = read(queue_files(self.suite)[0])
+        self.assertIn(b'Subject: from swaks', data)
+        self.assertTrue(data.endswith(b'\r\n.\r\n'))
+
+    @unittest.skipUnless(shutil.which('curl'), 'curl is not installed')
+    def test_curl(self):
+        message = 'From: ann@far.example\r\nSubject: from curl\r\n\r\ncurl body\r\n'
+        out = subprocess.run(['curl', '-sS', '--max-time', '20', 'smtp://127.0.0.1:%d/client.example' % self.suite.port('smtp'),
+                              '--mail-from', 'ann@far.example', '--mail-rcpt', 'postmaster@localhost',
+                              '--upload-file', '-'], input=message, capture_output=True, text=True, timeout=30)
+        self.assertEqual(out.returncode, 0, out.stdout + out.stderr)
+        data = read(queue_files(self.suite)[0])
+        self.assertIn(b'Subject: from curl', data)
+        self.assertIn(b'RCPT TO:<postmaster@localhost>', data)
+
+
+class RelayTest(SuiteTestCase):
+    # smtp.allow names another peer, so loopback is a stranger here.
+    config = dict(NO_DEBATCH, **{'smtp.allow': '192.0.2.1'})
+
+    def test_a_stranger_may_not_relay_but_may_deliver_locally(self):
+        c = Conversation(self.suite.port('smtp'))
+        c.cmd('HELO stranger')
+        self.assertEqual(c.cmd('MAIL FROM:<someone@far.example>'), '250 OK Sender accepted')
+        self.assertEqual(c.cmd('RCPT TO:<victim@elsewhere.example>'), '550 Posting to this address forbidden')
+        self.assertEqual(c.cmd('RCPT TO:<postmaster@site.example>'), '250 OK Recipient syntactically correct')
+        self.assertEqual(c.cmd('TURN'), '502 TURN not available')
+        c.close()
+
+
+class BlockTest(SuiteTestCase):
+    config = dict(NO_DEBATCH, **{'smtp.block': '127.0.0.1'})
+
+    def test_blocked_peer_is_refused_at_once(self):
+        with socket.create_connection(('127.0.0.1', self.suite.port('smtp')), timeout=10) as s:
+            data = b''
+            while True:
+                chunk = s.recv(1000)
+                if not chunk:
+                    break
+                data += chunk
+        self.assertRegex(data.decode(), r'^421 \S+ connection refused\r\n$')
+
+
+class CrashTest(unittest.TestCase):
+    """SIGKILL while a message is being received: a queue file is either
+    whole (acknowledged before the kill) or absent, never half."""
+
+    def test_sigkill_while_queueing(self):
+        suite = Suite(config=NO_DEBATCH)
+        suite.start()
+        try:
+            port = suite.port('smtp')
+            with smtplib.SMTP('127.0.0.1', port, timeout=10) as c:
+                c.sendmail('ann@far.example', ['bob@remote.example'], 'Subject: whole\r\n\r\nsafe\r\n')
+            c = Conversation(port)
+            c.cmd('MAIL FROM:<ann@far.example>')
+            c.cmd('RCPT TO:<bob@remote.example>')
+            c.cmd('DATA')
+            c.send(b'Subject: half\r\n\r\n' + b'y' * 500000)
+            time.sleep(0.5)
+            suite.kill()  # SIGKILL
+            c.close()
+            files = queue_files(suite)
+            self.assertEqual(len(files), 1)
+            self.assertTrue(read(files[0]).endswith(b'\r\nsafe\r\n.\r\n'))
+            # A restart clears what was never acknowledged, and the whole
+            # message is debatched (into the outgoing queue).
+            if os.path.exists(suite.pid_file):
+                os.unlink(suite.pid_file)
+            suite.start()
+            self.assertEqual(hidden_files(suite), [])
+            suite.ctl('maildebatch')
+            deadline = time.time() + 10
+            while time.time() < deadline and not queue_files(suite, 'mail/out'):
+                time.sleep(0.1)
+            out = queue_files(suite, 'mail/out')
+            self.assertEqual(len(out), 1)
+            self.assertTrue(read(out[0]).endswith(b'\r\nsafe\r\n.\r\n'))
+            self.assertEqual(queue_files(suite), [])
+        finally:
+            suite.cleanup()
+
+
+if __name__ == '__main__':
+    unittest.main()
