@@ -2,6 +2,7 @@
 installation, and password changes and reloads through the control channel."""
 
 import os
+import poplib
 import re
 import shutil
 import stat
@@ -68,10 +69,37 @@ class InitMakesADemoUser(unittest.TestCase):
         self.assertNotIn(password, out)
 
 
+def pop_login(suite, user, password):
+    """True when the POP3 server lets `user` in with `password`."""
+    pop = poplib.POP3('127.0.0.1', suite.port('pop'), timeout=10)
+    try:
+        pop.user(user)
+        pop.pass_(password)
+        pop.quit()
+        return True
+    except poplib.error_proto:
+        return False
+    finally:
+        pop.close()
+
+
 class UserAdministration(SuiteTestCase):
     def change_pass(self, user, old, new):
         rc, out = self.suite.ctl('change pass %s %s %s' % (user, old, new))
         return out.strip()
+
+    def test_an_added_user_reads_mail_over_pop3(self):
+        root = self.suite.path('')
+        rc, out = velmor(root, '--adduser', 'dora', '--password', 'first', '--full-name', 'Dora Maar')
+        self.assertEqual(rc, 0, out)
+        self.assertTrue(pop_login(self.suite, 'dora', 'first'))
+        self.assertTrue(pop_login(self.suite, 'd.maar', 'first'))
+        self.assertFalse(pop_login(self.suite, 'dora', 'First'))
+        self.assertFalse(pop_login(self.suite, 'nobody', 'first'))
+        rc, out = velmor(root, '--passwd', 'dora', stdin='second\n')
+        self.assertEqual(rc, 0, out)
+        self.assertFalse(pop_login(self.suite, 'dora', 'first'))
+        self.assertTrue(pop_login(self.suite, 'dora', 'second'))
 
     def test_added_users_authenticate_and_change_their_password(self):
         root = self.suite.path('')
@@ -129,6 +157,9 @@ class MissingGroupsFile(unittest.TestCase):
         suite.start()
         try:
             self.assertIn('User group file missing', suite.log('main'))
+            rc, out = velmor(suite.root, '--adduser', 'erin', '--password', 'pw')
+            self.assertEqual(rc, 0, out)
+            self.assertFalse(pop_login(suite, 'erin', 'pw'))
         finally:
             suite.stop()
 
