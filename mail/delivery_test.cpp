@@ -70,9 +70,8 @@ TEST(Vacation, NoReplyToListsAutomataOrTheNullSender) {
 }
 
 TEST(Vacation, AtMostOncePerSenderPerWeek) {
-  char tmpl[] = "/tmp/velmor-vacation-XXXXXX";
-  ASSERT_NE(mkdtemp(tmpl), nullptr);
-  std::string record = std::string(tmpl) + "/.vacation.sent";
+  testing_files::ScratchDir scratch;
+  std::string record = (scratch.path() / ".vacation.sent").string();
   const std::time_t t0 = 1700000000, week = 7 * 24 * 3600;
   EXPECT_TRUE(vacation_note_sent(record, "bob@x", t0));
   EXPECT_FALSE(vacation_note_sent(record, "BOB@x", t0 + 3600));
@@ -83,7 +82,6 @@ TEST(Vacation, AtMostOncePerSenderPerWeek) {
   EXPECT_TRUE(vacation_note_sent(record, "dave@x", t0 + 3 * week));
   EXPECT_EQ(read_file(record).find("bob"), std::string::npos);
   EXPECT_EQ(read_file(record).find("carl"), std::string::npos);
-  fs::remove_all(tmpl);
 }
 
 // The scratch queue with the user ann (home inside it) and one group that

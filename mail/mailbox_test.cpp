@@ -40,17 +40,14 @@ using testing_files::write_file;
 class TempDir : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/velmor-mailbox-XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
+    dir_ = scratch_.path();
+    ASSERT_FALSE(dir_.empty());
     fs::create_directories(dir_ / "mail");
     mailbox_cache_clear();
   }
-  void TearDown() override {
-    mailbox_cache_clear();
-    fs::remove_all(dir_);
-  }
+  void TearDown() override { mailbox_cache_clear(); }
   std::string inbox() const { return (dir_ / "mail" / "inbox").string(); }
+  testing_files::ScratchDir scratch_;
   fs::path dir_;
 };
 
