@@ -102,7 +102,8 @@ void cmd_mail(SocketRecord& r, SmtpSession& s, std::string_view arg) {
     if (exists) s.group = user_group(*local);
     if ((r.flags & kIdVerify) && local && !exists) {
       s.denial = 2;
-    } else if (s.group && !s.group->permits("mail.smtp.send")) {
+    } else if (exists && !group_permits(s.group, "mail.smtp.send")) {
+      // A local sender with no group set (no groups file) is refused too.
       s.denial = 3;
     }
   }

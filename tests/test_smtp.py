@@ -243,6 +243,27 @@ class BlockTest(SuiteTestCase):
         self.assertRegex(data.decode(), r'^421 \S+ connection refused\r\n$')
 
 
+class NoGroupsTest(SuiteTestCase):
+    config = NO_DEBATCH
+
+    def test_a_local_sender_without_a_group_set_may_not_send(self):
+        # Without a groups file no set grants anything: a local user's mail is
+        # refused, while a stranger may still deliver to a local user.
+        self.suite.stop()
+        os.remove(self.suite.path('config/groups'))
+        self.suite.start()
+        c = Conversation(self.suite.port('smtp'))
+        try:
+            c.cmd('HELO me')
+            self.assertEqual(c.cmd('MAIL FROM:<demo@localhost>'), '250 OK Sender accepted')
+            self.assertEqual(c.cmd('RCPT TO:<postmaster@localhost>'), '550 posting denied')
+            c.cmd('MAIL FROM:<ann@far.example>')
+            self.assertEqual(c.cmd('RCPT TO:<demo@localhost>'),
+                             '250 OK Recipient syntactically correct')
+        finally:
+            c.close()
+
+
 class CrashTest(unittest.TestCase):
     """SIGKILL while a message is being received: a queue file is either
     whole (acknowledged before the kill) or absent, never half."""
