@@ -206,7 +206,7 @@ bool refused(const Recipient& r, const std::string& queue_file, std::string_view
     std::string shown(trim_blanks(size_text(static_cast<std::uint64_t>(size))));
     log_write(strprintf("[Mail] Oversize article [%s]:%s", shown.c_str(), user.c_str()),
               logchan::filter);
-    mail_send_error(strprintf("The following email was greater than the %ukB length limit, at %lldkB\n",
+    mail_send_refusal(strprintf("The following email was greater than the %ukB length limit, at %lldkB\n",
                               limit / 1024, static_cast<long long>(size / 1024)),
                     redirect_address(g, "mail.large.redirect"), queue_file);
     return true;
@@ -217,14 +217,14 @@ bool refused(const Recipient& r, const std::string& queue_file, std::string_view
     log_write(strprintf("[Mail] Blocked sender [%.*s] for: %s", static_cast<int>(sender.size()), sender.data(),
                         user.c_str()),
               logchan::filter);
-    mail_send_error("The following email was sent by a forbidden user\n", redirect_address(g, "mail.block.redirect"),
+    mail_send_refusal("The following email was sent by a forbidden user\n", redirect_address(g, "mail.block.redirect"),
                     queue_file);
     return true;
   }
   const std::string& filter = g.text("mail.filter");
   if (!filter.empty() && mail_filter_match(filter, queue_file)) {
     log_write(strprintf("[Mail] Banned word/phrase found: %s", user.c_str()), logchan::filter);
-    mail_send_error("The following email contained a forbidden phrase\n", redirect_address(g, "mail.filter.redirect"),
+    mail_send_refusal("The following email contained a forbidden phrase\n", redirect_address(g, "mail.filter.redirect"),
                     queue_file);
     return true;
   }

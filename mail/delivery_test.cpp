@@ -223,6 +223,24 @@ TEST_F(Delivery, VacationRepliesOnceAndMarksItsReply) {
   EXPECT_EQ(mailbox_lookup(inbox())->count, 3);
 }
 
+TEST_F(Delivery, ARefusedMessageIsReportedWithItsHeaderOnly) {
+  // The report of an oversize message must not carry the body that broke the
+  // limit, or the report would be refused in turn.
+  write_file(dir_ / "groups", "#0\n%mail.msg.size: 1\n");
+  ASSERT_EQ(groups_load((dir_ / "groups").string()), 0);
+  std::string body(4000, 'x');
+  body += "\r\n";
+  ASSERT_EQ(mailbox_append(queue("Subject: big\r\n", body), "ann", "bob@elsewhere.test"), 1);
+  EXPECT_FALSE(fs::exists(inbox()));
+  auto queued = incoming();
+  ASSERT_EQ(queued.size(), 1u);
+  EXPECT_NE(queued[0].find("RCPT TO:<bob@elsewhere.test>\r\n"), std::string::npos);
+  EXPECT_NE(queued[0].find("greater than the 1kB length limit"), std::string::npos);
+  EXPECT_NE(queued[0].find("Subject: big\r\n"), std::string::npos);
+  EXPECT_EQ(queued[0].find("xxxxxxxx"), std::string::npos);
+  EXPECT_LT(queued[0].size(), 1024u);
+}
+
 TEST_F(Delivery, ReadReceiptGoesOnceToTheSender) {
   ASSERT_EQ(mailbox_append(queue("From: \"Bob B\" <bob@elsewhere.test> (work)\r\nSubject: please confirm\r\n"
                                  "Date: Tue, 14 Nov 2023 22:13:20 +0000\r\nX-Read-Receipt: Yes\r\n"),
