@@ -4,44 +4,31 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <cstdlib>
-#include <fstream>
-#include <sstream>
 
 #include "core/strfmt.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
 
 std::uint32_t ip(const char* text) { return inet_addr(text); }
 
-std::string read_file(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
-
-void write_file(const std::string& path, std::string_view text) {
-  std::ofstream(path, std::ios::binary) << text;
-}
+using testing_files::read_file;
+using testing_files::write_file;
 
 class ConfigTest : public ::testing::Test {
  protected:
   void SetUp() override {
     config_reset();
-    char pattern[] = "/tmp/velmor-config-test-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
+    ASSERT_FALSE(scratch_.path().empty());
+    dir_ = scratch_.path().string();
   }
-  void TearDown() override {
-    config_reset();
-    std::system(("rm -rf " + dir_).c_str());
-  }
+  void TearDown() override { config_reset(); }
   int load(std::string_view text) {
     write_file(dir_ + "/master", text);
     return config_load_file(dir_ + "/master");
   }
+  testing_files::ScratchDir scratch_;
   std::string dir_;
 };
 

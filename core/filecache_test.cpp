@@ -1,7 +1,6 @@
 #include "core/filecache.h"
 
 #include <fcntl.h>
-#include <ftw.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -15,6 +14,7 @@
 
 #include "core/config.h"
 #include "core/globals.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
@@ -56,25 +56,21 @@ std::string walk(CacheFile& f) {
 class FileCacheTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/velmor-fcache-XXXXXX";
-    ASSERT_NE(::mkdtemp(tmpl), nullptr);
-    dir_ = tmpl;
+    ASSERT_FALSE(scratch_.path().empty());
+    dir_ = scratch_.path().string();
     paths.tmp_dir = dir_ + "/tmp";
     config.cache_big = 0;
     config.cache_max = 0;
     ASSERT_EQ(filecache_init(), 0);
   }
-  void TearDown() override {
-    filecache_shutdown();
-    ::nftw(dir_.c_str(), [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 16,
-           FTW_DEPTH | FTW_PHYS);
-  }
+  void TearDown() override { filecache_shutdown(); }
   std::string at(const std::string& name) const { return dir_ + "/" + name; }
   void limit_file_size(int kilobytes) {
     config.cache_big = kilobytes * 1024;
     ASSERT_EQ(filecache_init(), 0);
   }
 
+  testing_files::ScratchDir scratch_;
   std::string dir_;
 };
 
@@ -415,9 +411,8 @@ TEST(FileHelpers, PathsAndFolders) {
   EXPECT_EQ(path_dir("/y"), "/");
   EXPECT_EQ(path_dir("y"), "");
 
-  char tmpl[] = "/tmp/velmor-paths-XXXXXX";
-  ASSERT_NE(::mkdtemp(tmpl), nullptr);
-  std::string base = tmpl;
+  testing_files::ScratchDir scratch;
+  std::string base = scratch.path().string();
   make_parent_dirs(base + "/p/q/file");
   EXPECT_TRUE(file_is_directory(base + "/p/q"));
   EXPECT_FALSE(file_is_directory(base + "/p/q/file"));
@@ -428,8 +423,6 @@ TEST(FileHelpers, PathsAndFolders) {
   ASSERT_EQ(file_create(base + "/p/f"), 0);
   EXPECT_EQ(file_size(base + "/p/f"), 0);
   EXPECT_GT(file_mtime(base + "/p/f"), 0);
-  ::nftw(base.c_str(), [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 16,
-         FTW_DEPTH | FTW_PHYS);
 }
 
 }  // namespace

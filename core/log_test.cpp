@@ -5,32 +5,26 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdlib>
 #include <fstream>
 #include <sstream>
 
 #include "core/config.h"
 #include "core/filecache.h"
 #include "core/globals.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
 
-std::string read_file(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
+using testing_files::read_file;
 
 bool exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
 
 class LogTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/velmor-log-test-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
+    ASSERT_FALSE(scratch_.path().empty());
+    dir_ = scratch_.path().string();
     paths.tmp_dir = dir_ + "/tmp";
     config_reset();
     filecache_init();
@@ -41,7 +35,6 @@ class LogTest : public ::testing::Test {
     log_reset();
     filecache_shutdown();
     config_reset();
-    std::system(("rm -rf " + dir_).c_str());
   }
   // Writes the log configuration (paths relative to the test folder) and
   // starts the logger on it.
@@ -59,6 +52,7 @@ class LogTest : public ::testing::Test {
     return log_init();
   }
   std::string log(const std::string& name) { return read_file(dir_ + "/" + name); }
+  testing_files::ScratchDir scratch_;
   std::string dir_;
 };
 

@@ -2,12 +2,12 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <fstream>
 
 #include "core/config.h"
 #include "core/filecache.h"
 #include "core/globals.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
@@ -15,9 +15,8 @@ namespace {
 class MimeTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char pattern[] = "/tmp/velmor-mime-test-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    dir_ = pattern;
+    ASSERT_FALSE(scratch_.path().empty());
+    dir_ = scratch_.path().string();
     paths.tmp_dir = dir_ + "/tmp";
     config_reset();
     filecache_init();
@@ -36,8 +35,8 @@ class MimeTest : public ::testing::Test {
     mime_map_clear();
     filecache_shutdown();
     config_reset();
-    std::system(("rm -rf " + dir_).c_str());
   }
+  testing_files::ScratchDir scratch_;
   std::string dir_;
 };
 

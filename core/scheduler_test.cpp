@@ -15,6 +15,7 @@
 #include "core/config.h"
 #include "core/globals.h"
 #include "core/process.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
@@ -50,23 +51,14 @@ TEST(FieldMatch, ListsRangesStepsAndSwitches) {
 class SchedulerTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    ASSERT_NE(mkdtemp(dir), nullptr);
-    config.file_schedule = std::string(dir) + "/schedule";
-  }
-  void TearDown() override {
-    std::string cmd = std::string("rm -rf ") + dir;
-    ASSERT_EQ(std::system(cmd.c_str()), 0);
+    ASSERT_FALSE(scratch_.path().empty());
+    config.file_schedule = dir + "/schedule";
   }
   void write_schedule(const std::string& text) {
     std::ofstream(*config.file_schedule) << text;
     ASSERT_EQ(schedule_load(), 0);
   }
-  std::string read(const std::string& name) {
-    std::ifstream in(std::string(dir) + "/" + name);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  std::string read(const std::string& name) { return testing_files::read_file(dir + "/" + name); }
   // Reaps children until `name` has `lines` lines (or three seconds pass).
   bool wait_lines(const std::string& name, std::size_t lines) {
     for (int i = 0; i < 300; ++i) {
@@ -89,7 +81,8 @@ class SchedulerTest : public ::testing::Test {
     t.tm_isdst = -1;
     return std::mktime(&t);
   }
-  char dir[32] = "/tmp/velmor-sched-XXXXXX";
+  testing_files::ScratchDir scratch_;
+  std::string dir = scratch_.path().string();
 };
 
 TEST_F(SchedulerTest, TheTaskFileIsReadLineByLine) {
@@ -115,7 +108,7 @@ TEST_F(SchedulerTest, TheTaskFileIsReadLineByLine) {
   ASSERT_EQ(schedule_load(), 0);
   EXPECT_EQ(schedule_tasks().size(), 2u);
 
-  config.file_schedule = std::string(dir) + "/missing";
+  config.file_schedule = dir + "/missing";
   EXPECT_EQ(schedule_load(), 0);
   EXPECT_TRUE(schedule_tasks().empty());
 }

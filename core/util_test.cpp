@@ -1,6 +1,5 @@
 #include "core/util.h"
 
-#include <ftw.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +11,7 @@
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/process.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {
@@ -247,9 +247,8 @@ TEST(FormFields, QueryStrings) {
 }
 
 TEST(FormFields, PostedBodiesInFiles) {
-  char tmpl[] = "/tmp/velmor-form-XXXXXX";
-  ASSERT_NE(::mkdtemp(tmpl), nullptr);
-  paths.tmp_dir = tmpl;
+  testing_files::ScratchDir scratch;
+  paths.tmp_dir = scratch.path().string();
   config.cache_big = 4 * 1024;  // small windows, so values cross them
   ASSERT_EQ(filecache_init(), 0);
 
@@ -284,13 +283,12 @@ TEST(FormFields, PostedBodiesInFiles) {
   filecache_close(copy);
   filecache_close(page);
   config.cache_big = 0;
-  ::nftw(tmpl, [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 8, FTW_DEPTH | FTW_PHYS);
 }
 
 TEST(UserChangeNote, AppendsPrivatelyAndRunsTheHook) {
-  char tmpl[] = "/tmp/velmor-hook-XXXXXX";
-  ASSERT_NE(::mkdtemp(tmpl), nullptr);
-  const std::string dir = tmpl;
+  testing_files::ScratchDir scratch;
+  const std::string dir = scratch.path().string();
+  const char* tmpl = dir.c_str();
   // A stand-in for the command the hook runs, found on the PATH.
   const std::string script = dir + "/Filer_Run";
   FILE* f = std::fopen(script.c_str(), "w");
@@ -324,7 +322,6 @@ TEST(UserChangeNote, AppendsPrivatelyAndRunsTheHook) {
   ::setenv("PATH", old_path.c_str(), 1);
   config.file_user_changes.reset();
   config.file_user_exec.reset();
-  ::nftw(tmpl, [](const char* p, const struct stat*, int, FTW*) { return ::remove(p); }, 8, FTW_DEPTH | FTW_PHYS);
 }
 
 }  // namespace

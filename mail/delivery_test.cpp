@@ -17,7 +17,7 @@
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
 #include "mail/queue_test_fixture.h"
-#include "users/test_files.h"
+#include "core/test_files.h"
 #include "users/groups.h"
 #include "users/users.h"
 

@@ -14,7 +14,7 @@
 
 #include "core/util.h"
 #include "mail/mailfile.h"
-#include "users/test_files.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {

@@ -15,7 +15,7 @@
 #include "core/globals.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
-#include "users/test_files.h"
+#include "core/test_files.h"
 
 namespace velmor {
 

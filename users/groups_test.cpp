@@ -6,7 +6,7 @@
 #include <sstream>
 
 #include "core/defaults.h"
-#include "users/test_files.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {

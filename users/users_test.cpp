@@ -10,7 +10,7 @@
 
 #include "core/config.h"
 #include "users/groups.h"
-#include "users/test_files.h"
+#include "core/test_files.h"
 
 namespace velmor {
 namespace {

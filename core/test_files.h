@@ -1,4 +1,4 @@
-// Files for the users and groups tests: a scratch folder that is removed
+// Files for the unit tests: a scratch folder that is removed
 // afterwards, and whole-file reads and writes.
 #pragma once
 
@@ -9,6 +9,7 @@
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <string_view>
 
 namespace velmor::testing_files {
 
@@ -21,7 +22,7 @@ inline std::string read_file(const fs::path& path) {
   return text.str();
 }
 
-inline void write_file(const fs::path& path, const std::string& text) {
+inline void write_file(const fs::path& path, std::string_view text) {
   std::ofstream(path, std::ios::binary) << text;
 }
 
@@ -29,7 +30,7 @@ inline void write_file(const fs::path& path, const std::string& text) {
 class ScratchDir {
  public:
   ScratchDir() {
-    std::string pattern = ::testing::TempDir() + "velmor_users.XXXXXX";
+    std::string pattern = ::testing::TempDir() + "velmor_test.XXXXXX";
     if (::mkdtemp(pattern.data())) path_ = pattern;
   }
   ~ScratchDir() {
