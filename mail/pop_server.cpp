@@ -622,7 +622,6 @@ void pop_server_init() {
   h.read = pop_read;
   h.write = pop_write;
   h.release = pop_release;
-  h.idle_timeout = [] { return config.pop_sock_timeout; };
   register_service(svc::pop, std::move(h));
 }
 

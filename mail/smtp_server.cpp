@@ -394,7 +394,6 @@ void smtp_server_register() {
   h.read = smtp_read;
   h.write = smtp_write;
   h.release = smtp_release;
-  h.idle_timeout = [] { return config.smtp_sock_timeout; };
   register_service(svc::smtp, std::move(h));
 }
 
