@@ -28,6 +28,7 @@
 #include <utility>
 
 #include "core/config.h"
+#include "core/fileio.h"
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/strfmt.h"
@@ -55,31 +56,7 @@ constexpr std::time_t kRacySeconds = 2;
 // during static destruction is safe).
 std::uint64_t g_memory = 0;
 
-class Fd {
- public:
-  Fd() = default;
-  explicit Fd(int fd) : fd_(fd) {}
-  Fd(Fd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
-  Fd& operator=(Fd&& other) noexcept {
-    if (this != &other) {
-      reset();
-      fd_ = std::exchange(other.fd_, -1);
-    }
-    return *this;
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  ~Fd() { reset(); }
-  int get() const { return fd_; }
-  explicit operator bool() const { return fd_ >= 0; }
-  void reset() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
-  }
-
- private:
-  int fd_ = -1;
-};
+using Fd = UniqueFd;
 
 // A window buffer: `size` bytes and room for a NUL behind them.
 class Buffer {
@@ -222,7 +199,7 @@ std::int64_t read_at(int fd, char* dst, std::uint64_t n, std::uint64_t offset) {
 int write_at(int fd, const char* src, std::uint64_t n, std::uint64_t offset) {
   std::uint64_t done = 0;
   while (done < n) {
-    ssize_t w = ::pwrite(fd, src + done, n - done, static_cast<off_t>(offset + done));
+    ssize_t w = sysio::pwrite(fd, src + done, n - done, static_cast<off_t>(offset + done));
     if (w < 0) {
       if (errno == EINTR) continue;
       return errno;
@@ -682,12 +659,6 @@ int write_data(CacheData& d, std::string_view data) {
   return 0;
 }
 
-int sync_dir_of(const std::string& path) {
-  std::string dir(path_dir(path));
-  Fd fd(::open(dir.empty() ? "." : dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!fd) return errno;
-  return ::fsync(fd.get()) == 0 ? 0 : errno;
-}
 
 // The writer's part of a close: write back and, for a rewrite, put the new
 // file in place. The entry then serves readers from memory.
@@ -711,19 +682,19 @@ int commit(const std::shared_ptr<CacheData>& dp) {
     }
     return err;
   }
-  if (!err && ::fsync(d.fd.get()) != 0) err = errno;
+  if (!err && sysio::fsync(d.fd.get()) != 0) err = errno;
   if (!err && d.keep_backup && file_is_regular(d.path)) {
     std::string backup = d.path + "~";
     ::unlink(backup.c_str());
     if (::link(d.path.c_str(), backup.c_str()) != 0) err = errno;
   }
-  if (!err && ::rename(d.disk_path.c_str(), d.path.c_str()) != 0) err = errno;
+  if (!err && sysio::rename(d.disk_path.c_str(), d.path.c_str()) != 0) err = errno;
   if (err) {
     say(strprintf("filecache_close write failed:%s\n", d.path.c_str()));
     ::unlink(d.disk_path.c_str());
     return err;
   }
-  sync_dir_of(d.path);
+  sync_parent_dir(d.path);
   d.disk_path = d.path;
   refresh_stamp(d);
   list_entry(dp);
@@ -740,7 +711,7 @@ int close_handle(const std::shared_ptr<FileCacheEntry>& h, bool purge) {
   if (d->users == 0) {
     if (purge) unlist(*d);
     if (d->listed) {
-      d->fd.reset();  // an unused entry holds memory, not descriptors
+      d->fd.close();  // an unused entry holds memory, not descriptors
       trim(0);
     }
   }
@@ -854,7 +825,7 @@ int filecache_sync(CacheFile& file) {
   if (!d) return EBADF;
   if (!is_writer(file)) return 0;
   if (int err = flush(*d)) return err;
-  if (::fsync(d->fd.get()) != 0) return errno;
+  if (sysio::fsync(d->fd.get()) != 0) return errno;
   return 0;
 }
 
@@ -870,7 +841,7 @@ int filecache_truncate(CacheFile& file, std::uint64_t length) {
   CacheData* d = data_of(file, "Invalid struct key (truncate)");
   if (!d) return EBADF;
   if (!is_writer(file) || length > d->length) return EINVAL;
-  if (::ftruncate(d->fd.get(), static_cast<off_t>(length)) != 0) return errno;
+  if (sysio::ftruncate(d->fd.get(), static_cast<off_t>(length)) != 0) return errno;
   if (d->start > length) d->start = length;
   d->window = std::min(d->window, length - d->start);
   d->terminate();
@@ -1010,27 +981,7 @@ std::string filecache_temp_name() {
   }
 }
 
-// ---- file helpers ---------------------------------------------------------------
-
-std::int64_t file_size(const std::string& path) {
-  struct stat st{};
-  return ::stat(path.c_str(), &st) == 0 ? static_cast<std::int64_t>(st.st_size) : -1;
-}
-
-std::int64_t file_mtime(const std::string& path) {
-  struct stat st{};
-  return ::stat(path.c_str(), &st) == 0 ? static_cast<std::int64_t>(st.st_mtime) : 0;
-}
-
-bool file_is_regular(const std::string& path) {
-  struct stat st{};
-  return ::stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode);
-}
-
-bool file_is_directory(const std::string& path) {
-  struct stat st{};
-  return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
+// ---- file helpers that know the cache ------------------------------------
 
 int file_create(const std::string& path) {
   if (g_cache) {
@@ -1046,57 +997,8 @@ int file_rename(const std::string& from, const std::string& to) {
       if (auto it = cache().index.find(*p); it != cache().index.end()) unlist(*it->second);
     }
   }
-  return ::rename(from.c_str(), to.c_str()) == 0 ? 0 : errno;
+  return sysio::rename(from.c_str(), to.c_str()) == 0 ? 0 : errno;
 }
-
-std::string_view path_leaf(std::string_view path) {
-  std::size_t slash = path.rfind('/');
-  return slash == std::string_view::npos ? path : path.substr(slash + 1);
-}
-
-std::string_view path_extension(std::string_view path) {
-  std::string_view leaf = path_leaf(path);
-  std::size_t dot = leaf.rfind('.');
-  return dot == std::string_view::npos ? std::string_view() : leaf.substr(dot + 1);
-}
-
-std::string_view path_dir(std::string_view path) {
-  std::size_t slash = path.rfind('/');
-  if (slash == std::string_view::npos) return {};
-  return slash == 0 ? path.substr(0, 1) : path.substr(0, slash);
-}
-
-std::string path_join(std::string_view dir, std::string_view name) {
-  while (!name.empty() && name.front() == '/') name.remove_prefix(1);
-  while (dir.size() > 1 && dir.back() == '/') dir.remove_suffix(1);
-  if (dir.empty()) return std::string(name);
-  std::string out(dir);
-  if (out.back() != '/') out += '/';
-  out += name;
-  return out;
-}
-
-namespace {
-// Makes every directory whose path ends before position `end` of `path`.
-void make_dirs_upto(const std::string& path, std::size_t end, mode_t mode) {
-  if (path.size() > kMaxPath) return;
-  for (std::size_t i = 1; i <= end && i <= path.size(); ++i) {
-    if (i == path.size() || path[i] == '/') {
-      if (path[i - 1] == '/') continue;
-      std::string dir = path.substr(0, i);
-      ::mkdir(dir.c_str(), mode);
-    }
-  }
-}
-}  // namespace
-
-void make_parent_dirs(const std::string& file_path) {
-  std::size_t slash = file_path.rfind('/');
-  if (slash == std::string::npos || slash == 0) return;
-  make_dirs_upto(file_path, slash, 0744);
-}
-
-void make_path(const std::string& dir_path) { make_dirs_upto(dir_path, dir_path.size(), 0770); }
 
 int file_write_atomic(const std::string& path, std::string_view data, bool backup, unsigned mode) {
   int err = 0;

@@ -18,6 +18,8 @@
 #include <string>
 #include <string_view>
 
+#include "core/fileio.h"
+
 namespace velmor {
 
 enum class FileMode : int {
@@ -121,12 +123,8 @@ int filecache_users(const CacheFile& file);
 // A unique path under the private tmp folder ("<tmp>/u<hex>"), folders made.
 std::string filecache_temp_name();
 
-// ---- File helpers used everywhere -----------------------------------------
+// ---- File helpers that keep the cache true (the plain ones are in fileio.h) --
 
-std::int64_t file_size(const std::string& path);        // -1 when missing
-std::int64_t file_mtime(const std::string& path);       // seconds; 0 when unreadable
-bool file_is_regular(const std::string& path);
-bool file_is_directory(const std::string& path);
 int file_create(const std::string& path);                 // create or truncate, mode 0660
 int file_rename(const std::string& from, const std::string& to);
 std::string_view path_extension(std::string_view path);  // after the last "." of the leaf

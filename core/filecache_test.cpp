@@ -328,6 +328,24 @@ TEST_F(FileCacheTest, AFullDiskIsReportedAndTheOldFileKept) {
   EXPECT_FALSE(file_is_regular(at(".cfg.new")));
 }
 
+// A rewrite is synced before its rename, and a failed sync or rename leaves
+// the old file as it was.
+TEST_F(FileCacheTest, ARewriteSyncsBeforeItsRenameAndKeepsTheOldFileOnFailure) {
+  put(at("cfg"), "old\n");
+  for (sysio::Op op : {sysio::Op::write, sysio::Op::sync, sysio::Op::rename}) {
+    sysio::reset();
+    sysio::fail_nth(op, 1);
+    EXPECT_EQ(file_write_atomic(at("cfg"), "new\n"), EIO);
+    EXPECT_EQ(slurp(at("cfg")), "old\n");
+    EXPECT_FALSE(file_is_regular(at(".cfg.new")));
+  }
+  sysio::reset();
+  EXPECT_EQ(file_write_atomic(at("cfg"), "new\n"), 0);
+  EXPECT_EQ(slurp(at("cfg")), "new\n");
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 2u);  // the file, then its folder
+  EXPECT_EQ(sysio::count(sysio::Op::rename), 1u);
+}
+
 TEST_F(FileCacheTest, TemporaryFilesLiveUntilTheirClose) {
   limit_file_size(16);
   CacheFile t = filecache_open("", FileMode::temporary);

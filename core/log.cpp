@@ -18,6 +18,7 @@
 
 #include "core/config.h"
 #include "core/filecache.h"
+#include "core/fileio.h"
 #include "core/globals.h"
 #include "core/strfmt.h"
 #include "core/textfile.h"
@@ -65,18 +66,6 @@ std::string stamp() {
   return std::string(text, n);
 }
 
-bool write_all(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t n = ::write(fd, data.data(), data.size());
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    data.remove_prefix(static_cast<std::size_t>(n));
-  }
-  return true;
-}
-
 // P -> P1 -> P2 ... up to `keep` generations; P itself is gone afterwards, so
 // the next write starts a new file.
 void rotate(const LogFile& f) {
@@ -94,7 +83,7 @@ void rotate(const LogFile& f) {
 bool append_to_file(LogFile& f, std::string_view data) {
   int fd = ::open(f.path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0660);
   if (fd < 0) return false;
-  write_all(fd, data);
+  write_all_unwatched(fd, data);
   struct stat st {};
   std::int64_t size = ::fstat(fd, &st) == 0 ? static_cast<std::int64_t>(st.st_size) : 0;
   ::fchmod(fd, 0660);

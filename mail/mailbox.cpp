@@ -708,9 +708,9 @@ int mailbox_expunge(Mailbox& box) {
   // Messages appended behind the records (none while the mark is held) stay.
   std::uint64_t tail = static_cast<std::uint64_t>(st.st_size) - offset;
   if (tail && !rc) rc = copy_range(old.get(), offset, tail, out.get());
-  if (!rc && ::fsync(out.get()) != 0) rc = errno;
+  if (!rc && sysio::fsync(out.get()) != 0) rc = errno;
   if (int c = out.close(); !rc) rc = c;
-  if (!rc && ::rename(tmp.c_str(), box.path.c_str()) != 0) rc = errno;
+  if (!rc && sysio::rename(tmp.c_str(), box.path.c_str()) != 0) rc = errno;
   if (rc) {
     ::unlink(tmp.c_str());
     log_message("Mailbox expunge failed:", box.path + " " + error_text(rc), logfac::maildebatch);

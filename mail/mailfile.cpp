@@ -13,23 +13,6 @@ namespace {
 constexpr std::size_t kWindow = 64 * 1024;
 }
 
-UniqueFd& UniqueFd::operator=(UniqueFd&& other) noexcept {
-  if (this != &other) {
-    close();
-    fd_ = other.release();
-  }
-  return *this;
-}
-
-UniqueFd::~UniqueFd() { close(); }
-
-int UniqueFd::close() {
-  if (fd_ < 0) return 0;
-  int rc = ::close(fd_) == 0 ? 0 : errno;
-  fd_ = -1;
-  return rc;
-}
-
 std::string_view TextSource::view(std::uint64_t offset, std::size_t) {
   if (offset >= text_.size()) return {};
   return text_.substr(offset);
@@ -113,41 +96,5 @@ std::string_view line_body(std::string_view text) {
 }
 
 bool is_terminator_line(std::string_view text) { return line_body(text) == "." && text.size() > 1; }
-
-int write_all(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t n = ::write(fd, data.data(), data.size());
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return errno;
-    }
-    if (n == 0) return EIO;
-    data.remove_prefix(static_cast<std::size_t>(n));
-  }
-  return 0;
-}
-
-int copy_range(int from, std::uint64_t offset, std::uint64_t length, int to) {
-  std::string buf(static_cast<std::size_t>(std::min<std::uint64_t>(length, 256 * 1024)), '\0');
-  while (length > 0) {
-    std::size_t chunk = static_cast<std::size_t>(std::min<std::uint64_t>(length, buf.size()));
-    ssize_t n = ::pread(from, buf.data(), chunk, static_cast<off_t>(offset));
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return errno;
-    if (n == 0) return EIO;  // the source is shorter than its records say
-    if (int rc = write_all(to, std::string_view(buf.data(), static_cast<std::size_t>(n)))) return rc;
-    offset += static_cast<std::uint64_t>(n);
-    length -= static_cast<std::uint64_t>(n);
-  }
-  return 0;
-}
-
-int sync_parent_dir(const std::string& path) {
-  std::size_t slash = path.rfind('/');
-  std::string dir = slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
-  UniqueFd fd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!fd) return errno;
-  return ::fsync(fd.get()) == 0 ? 0 : errno;
-}
 
 }  // namespace velmor

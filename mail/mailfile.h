@@ -1,37 +1,15 @@
-// Reading and writing mailbox files: a descriptor that closes itself, a
-// line reader over any byte source (a file read in large windows, or text in
-// memory), and writes that report every failure.
+// Reading mailbox files: a line reader over any byte source (a file read in
+// large windows, or text in memory). Descriptors and checked writes are in
+// core/fileio.h.
 #pragma once
 
 #include <cstdint>
 #include <string>
 #include <string_view>
 
+#include "core/fileio.h"
+
 namespace velmor {
-
-class UniqueFd {
- public:
-  UniqueFd() = default;
-  explicit UniqueFd(int fd) : fd_(fd) {}
-  UniqueFd(UniqueFd&& other) noexcept : fd_(other.release()) {}
-  UniqueFd& operator=(UniqueFd&& other) noexcept;
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-  ~UniqueFd();
-
-  int get() const { return fd_; }
-  explicit operator bool() const { return fd_ >= 0; }
-  int release() {
-    int fd = fd_;
-    fd_ = -1;
-    return fd;
-  }
-  // Closes now; 0 or the errno of a failed close.
-  int close();
-
- private:
-  int fd_ = -1;
-};
 
 class ByteSource {
  public:
@@ -89,12 +67,5 @@ Line read_line(ByteSource& in, std::uint64_t offset, std::size_t keep = 8192);
 std::string_view line_body(std::string_view text);
 // A line that holds only "." (the end of a message in transmission form).
 bool is_terminator_line(std::string_view text);
-
-// Writes all of `data` at the descriptor's position. 0 or an errno value.
-int write_all(int fd, std::string_view data);
-// Copies `length` bytes from `offset` of `from` to the position of `to`.
-int copy_range(int from, std::uint64_t offset, std::uint64_t length, int to);
-// fsync of the folder that holds `path`, so a rename in it is durable.
-int sync_parent_dir(const std::string& path);
 
 }  // namespace velmor

@@ -194,14 +194,14 @@ void queue_commit(const std::function<void(int owner, int error)>& done) {
   if (batch.empty()) return;
   std::string dir = incoming_dir();
   int dir_fd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  int error = dir_fd < 0 ? errno : (syncfs(dir_fd) == 0 ? 0 : errno);
+  int error = dir_fd < 0 ? errno : (sysio::syncfs(dir_fd) == 0 ? 0 : errno);
   std::vector<int> errors(batch.size(), error);
   bool renamed = false;
   for (std::size_t i = 0; i < batch.size(); ++i) {
-    if (errors[i] == 0 && rename(batch[i].hidden.c_str(), batch[i].path.c_str()) != 0) errors[i] = errno;
+    if (errors[i] == 0 && sysio::rename(batch[i].hidden.c_str(), batch[i].path.c_str()) != 0) errors[i] = errno;
     if (errors[i] == 0) renamed = true;
   }
-  if (renamed && fsync(dir_fd) != 0) {
+  if (renamed && sysio::fsync(dir_fd) != 0) {
     // The renames may not last: take them back rather than acknowledge them.
     int e = errno;
     for (std::size_t i = 0; i < batch.size(); ++i)
