@@ -1,17 +1,20 @@
 // Local delivery: a queued message appended to a user's mailbox, after the
 // receive checks of the user's group and the user's own forward and
 // vacation settings.
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <functional>
 #include <optional>
+#include <unordered_map>
 #include <vector>
 
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/log.h"
+#include "core/safedir.h"
 #include "core/strfmt.h"
 #include "core/util.h"
 #include "mail/delivery.h"
@@ -29,12 +32,21 @@ namespace {
 
 constexpr std::time_t kVacationInterval = 7 * 24 * 3600;
 constexpr int kMaxForwardHops = 10;
+// New boxes made by sub-address, per user and day: a sender cannot make a
+// user's mail folder grow by a file for every address it invents.
+constexpr int kNewBoxesPerDay = 20;
 constexpr std::string_view kForwardedHeader = "X-Velmor-Forwarded-By:";
 
 std::time_t now() { return server_now ? server_now : std::time(nullptr); }
 
 void debug(std::string_view text, std::string_view value = {}) {
   log_message(text, value, logfac::maildebatch);
+}
+
+// Logs a file below a home that was not what it must be (a link, another
+// user's file, ...); such a file is never used.
+void log_refused(const std::string& home, const SafeResult& r) {
+  if (r.refused()) log_write("Mail delivery refused: " + safe_describe(home, r), logchan::errors);
 }
 
 // Where a group's redirect option sends its error mail: the option's
@@ -157,9 +169,18 @@ bool vacation_reply_wanted(const QueueLayout& q, std::string_view sender) {
 }
 
 bool vacation_note_sent(const std::string& record_path, std::string_view sender, std::time_t when) {
+  // The record lies in the user's home: read and rewritten without
+  // following links. A record that cannot be kept sends no reply.
+  std::string folder(path_dir(record_path)), name(path_leaf(record_path));
+  SafeDir home;
+  UniqueFd fd;
+  if (!SafeDir::open_root(folder, home).ok()) return false;
+  SafeResult opened = home.open_file(name, O_RDONLY, fd);
+  log_refused(folder, opened);
+  if (!opened.ok() && opened.status != SafeStatus::missing) return false;
   std::string kept;
   bool recent = false;
-  FileSource in(record_path);
+  FileSource in(std::move(fd));
   std::uint64_t pos = 0;
   while (in.is_open() && pos < in.size()) {
     Line line = read_line(in, pos, 1024);
@@ -182,8 +203,7 @@ bool vacation_note_sent(const std::string& record_path, std::string_view sender,
   strappendf(kept, "%lld ", static_cast<long long>(when));
   kept.append(sender);
   kept += '\n';
-  file_write_atomic(record_path, kept, false, 0600);
-  return true;
+  return home.replace_file(name, kept, 0600) == 0;
 }
 
 // ---- delivery -----------------------------------------------------------------
@@ -232,9 +252,12 @@ bool refused(const Recipient& r, const std::string& queue_file, std::string_view
 }
 
 // The first line of a small file in the home folder, trimmed.
-std::string first_line_of(const std::string& path) {
-  FileSource in(path);
-  if (!in.is_open()) return {};
+std::string first_line_of(const SafeDir& home, const std::string& home_path, std::string_view name) {
+  UniqueFd fd;
+  SafeResult opened = home.open_file(name, O_RDONLY, fd);
+  log_refused(home_path, opened);
+  if (!opened.ok()) return {};
+  FileSource in(std::move(fd));
   Line line = read_line(in, 0, 1024);
   return std::string(trim_blanks(line_body(line.text)));
 }
@@ -244,8 +267,8 @@ std::string first_line_of(const std::string& path) {
 // locally: no forward file, a forward back to this same user, a message
 // that has already passed this user's forward (a loop between users), or
 // a queue file that could not be written.
-bool forwarded(const Recipient& r, ByteSource& in, const QueueLayout& q) {
-  std::string target = first_line_of(path_join(r.user->home, ".forward"));
+bool forwarded(const Recipient& r, const SafeDir& home, ByteSource& in, const QueueLayout& q) {
+  std::string target = first_line_of(home, r.user->home, ".forward");
   while (!target.empty() && (target.front() == '<')) target.erase(0, 1);
   if (auto gt = target.find('>'); gt != std::string::npos) target.erase(gt);
   if (target.empty() || target.find_first_of(" \t\r\n") != std::string::npos) return false;
@@ -277,11 +300,13 @@ bool forwarded(const Recipient& r, ByteSource& in, const QueueLayout& q) {
   return true;
 }
 
-void vacation(const Recipient& r, const QueueLayout& q, std::string_view sender) {
-  const std::string& home = r.user->home;
-  if (!file_is_regular(path_join(home, ".vacation")) || !vacation_reply_wanted(q, sender)) return;
-  if (!vacation_note_sent(path_join(home, ".vacation.sent"), sender, now())) return;
-  FileSource text(path_join(home, ".vacation"));
+void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std::string_view sender) {
+  UniqueFd fd;
+  SafeResult opened = home.open_file(".vacation", O_RDONLY, fd);
+  log_refused(r.user->home, opened);
+  if (!opened.ok() || !vacation_reply_wanted(q, sender)) return;
+  if (!vacation_note_sent(path_join(r.user->home, ".vacation.sent"), sender, now())) return;
+  FileSource text(std::move(fd));
   std::string_view body = text.view(0, static_cast<std::size_t>(std::min<std::uint64_t>(text.size(), 256 * 1024)));
   std::string me = r.user->login + "@" + mail_primary_domain();
   std::string s(sender);
@@ -296,22 +321,30 @@ void vacation(const Recipient& r, const QueueLayout& q, std::string_view sender)
   if (rc) debug("Vacation reply could not be queued:", error_text(rc));
 }
 
-// Appends the message to the mailbox file. 0 or an errno value; on failure
-// the file is cut back to `old_size`.
-int append_message(CacheFile& box, std::uint64_t old_size, ByteSource& in, const QueueLayout& q,
-                   std::string_view user, std::uint32_t uid) {
+// Cuts the mailbox back to what it held before a failed append.
+void take_back(int fd, std::uint64_t old_size) {
+  if (sysio::ftruncate(fd, static_cast<off_t>(old_size)) == 0) sysio::fsync(fd);
+}
+
+// Appends the message to the mailbox file at `old_size` and syncs it. 0 or
+// an errno value; on failure the file is cut back to `old_size`.
+int append_message(int box, std::uint64_t old_size, ByteSource& in, const QueueLayout& q, std::string_view user,
+                   std::uint32_t uid) {
   std::string out = mailbox_separator(q.envelope, now());
+  std::uint64_t at = old_size;
   int rc = 0;
   std::string tail;  // the last bytes written, to see whether the terminator came
+  auto flush = [&] {
+    if (!rc) rc = pwrite_all(box, out, at);
+    at += out.size();
+    out.clear();
+  };
   auto put = [&](std::string_view data) {
     if (rc) return;
     out.append(data);
     tail.append(data.substr(data.size() > 5 ? data.size() - 5 : 0));
     if (tail.size() > 5) tail.erase(0, tail.size() - 5);
-    if (out.size() >= 64 * 1024) {
-      rc = filecache_write(box, out);
-      out.clear();
-    }
+    if (out.size() >= 64 * 1024) flush();
   };
   // The header, without the lines that carry mailbox state.
   std::uint64_t pos = q.message;
@@ -367,13 +400,37 @@ int append_message(CacheFile& box, std::uint64_t old_size, ByteSource& in, const
     if (!tail.empty() && tail.back() != '\n') put("\r\n");
     put(".\r\n");
   }
-  if (!rc) rc = filecache_write(box, out);
-  if (!rc) rc = filecache_sync(box);
-  if (rc) {
-    filecache_truncate(box, old_size);
-    filecache_sync(box);
-  }
+  flush();
+  if (!rc && sysio::fsync(box) != 0) rc = errno;
+  if (rc) take_back(box, old_size);
   return rc;
+}
+
+std::unordered_map<std::string, std::pair<std::time_t, int>> g_new_boxes;  // login -> day, boxes made
+
+bool new_box_allowed(const std::string& login) {
+  auto& [day, made] = g_new_boxes[login];
+  if (day != now() / 86400) {
+    day = now() / 86400;
+    made = 0;
+  }
+  return made < kNewBoxesPerDay;
+}
+
+// What becomes of a message whose mailbox cannot be opened: while the
+// suite may not write in the home it waits, as it does for a full disk;
+// anything else goes to oddments.
+int open_failed(const Recipient& r, const std::string& queue_file, const SafeResult& why) {
+  debug("Mailbox open failed");
+  std::string what = safe_describe(r.user->home, why);
+  if (why.refused()) {
+    log_write("Mail delivery refused: " + what, logchan::errors);
+  } else if (why.error == EACCES || why.error == EPERM || is_temporary(why.error)) {
+    log_write("Mail delivery for `" + r.user->login + "' waits: " + what, logchan::errors);
+    return kAppendTemporaryFailure;
+  }
+  mail_move_to_oddments(queue_file, strprintf("Couldn't open mailbox for user `%s'", r.user->login.c_str()));
+  return 1;
 }
 
 }  // namespace
@@ -405,8 +462,18 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
   QueueLayout q = queue_layout(in);
   if (in.failed()) return kAppendTemporaryFailure;
 
-  if (r.group && (r.group->mail_flags & gflag::mail_forward) && forwarded(r, in, q)) return 1;
-  if (r.group && (r.group->mail_flags & gflag::mail_vacation)) vacation(r, q, sender);
+  // The home is trusted; everything below it is the user's, and is reached
+  // without following links (core/safedir.h).
+  const std::string& home_path = r.user->home;
+  SafeDir home;
+  SafeResult opened = SafeDir::open_root(home_path, home);
+  if (opened.status == SafeStatus::missing) {
+    make_path(home_path);
+    opened = SafeDir::open_root(home_path, home);
+  }
+  bool home_ok = opened.ok();
+  if (home_ok && r.group && (r.group->mail_flags & gflag::mail_forward) && forwarded(r, home, in, q)) return 1;
+  if (home_ok && r.group && (r.group->mail_flags & gflag::mail_vacation)) vacation(r, home, q, sender);
 
   std::string box_name = mailbox_box_for_address(recipient);
   if (box_name != "inbox") {
@@ -414,53 +481,45 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
   } else {
     debug("Using inbox");
   }
+  SafeDir folder;
+  if (opened.ok()) opened = home.open_dir("mail", true, folder);
+  bool made = opened.ok() && box_name != "inbox" && !folder.has(box_name);
+  if (made && !new_box_allowed(r.user->login)) {
+    debug("Too many new mailboxes today, using inbox for:", box_name);
+    box_name = "inbox";
+    made = false;
+  }
   debug(strprintf("using box `%s'", box_name.c_str()));
-  std::string dir = path_join(r.user->home, "mail");
-  make_path(dir);
-  std::string path = path_join(dir, box_name);
+  std::string path = path_join(path_join(home_path, "mail"), box_name);
   debug("Trying to open mailbox");
-  // Never through a link: the box name came from the network.
+  UniqueFd fd;
+  if (opened.ok()) opened = home.open_file("mail/" + box_name, O_RDWR | O_CREAT, fd, 0600);
+  if (opened.ok() && made) ++g_new_boxes[r.user->login].second;
+  Mailbox* box = opened.ok() ? mailbox_lookup(path, home_path) : nullptr;
+  if (opened.ok() && !box) opened = SafeResult{SafeStatus::failed, EIO, "mail/" + box_name};
+  if (!opened.ok()) return open_failed(r, queue_file, opened);
+
+  // The message goes behind the last committed one. A file that does not
+  // match its records (it could not be cut back, or changed while a session
+  // holds it) waits, rather than glue the message to something unknown.
   struct stat st {};
-  bool existed = ::lstat(path.c_str(), &st) == 0;
-  int error = existed && !S_ISREG(st.st_mode) ? ELOOP : 0;
-  CacheFile file;
-  if (!error) {
-    errno = 0;
-    file = filecache_open(path, FileMode::append);
-    if (!file) error = errno ? errno : EIO;
-    if (file && !existed) ::chmod(path.c_str(), 0600);  // mail is private
-  }
-  Mailbox* box = error ? nullptr : mailbox_lookup(path);
-  if (!error && !box) error = EIO;
-  if (error) {
-    debug("Mailbox open failed");
-    if (file) filecache_abandon(file);
-    if (is_temporary(error)) return kAppendTemporaryFailure;
-    mail_move_to_oddments(queue_file, strprintf("Couldn't open mailbox for user `%s'", r.user->login.c_str()));
-    return 1;
-  }
-  std::uint64_t old_size = filecache_length(file);
-  std::uint32_t uid = box->next_uid ? box->next_uid : 1;
-  if (int rc = append_message(file, old_size, in, q, r.user->login, uid)) {
-    filecache_abandon(file);
-    log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
+  std::uint64_t old_size = mailbox_size(*box);
+  if (::fstat(fd.get(), &st) != 0 || static_cast<std::uint64_t>(st.st_size) != old_size) {
+    log_write("Mail delivery waits, the mailbox does not match its records: " + path, logchan::errors);
     return kAppendTemporaryFailure;
   }
-  if (int rc = filecache_close(file)) {
+  std::uint32_t uid = box->next_uid ? box->next_uid : 1;
+  int rc = append_message(fd.get(), old_size, in, q, r.user->login, uid);
+  if (!rc) {
+    FileSource written(fd.get());
+    rc = mailbox_commit(*box, written, old_size);
+    if (rc) take_back(fd.get(), old_size);
+  }
+  if (rc) {
     log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
     return kAppendTemporaryFailure;
   }
   box->flags |= boxflag::new_mail | boxflag::delivered;
-  FileSource written(path);
-  std::size_t before = box->messages.size();
-  if (mailbox_size(*box) == old_size) mailbox_parse_message(written, old_size, *box);
-  if (box->messages.size() == before) {
-    // The record did not follow the file (changed behind our back): the
-    // lookup brings it in line with what the file now holds.
-    mailbox_lookup(path);
-    return 1;
-  }
-  mailbox_overview_write(*box);
   return 1;
 }
 
@@ -524,7 +583,7 @@ int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset
   if (!(message.flags & msgflag::receipt_wanted)) return 0;
 
   // The header of the message as stored.
-  FileSource in(box.path);
+  FileSource in(mailbox_open(box));
   std::uint64_t pos = offset + (message.total_length - message.length);
   std::uint64_t end = offset + message.header_length;
   std::vector<std::string> header;

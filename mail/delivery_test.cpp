@@ -1,7 +1,9 @@
 #include "mail/delivery.h"
 
 #include <gtest/gtest.h>
+#include <grp.h>
 #include <sys/resource.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <csignal>
@@ -102,6 +104,8 @@ class Delivery : public QueueFixture {
   }
   void TearDown() override {
     mailbox_cache_clear();
+    sysio::reset();
+    server_now = 0;
     QueueFixture::TearDown();
   }
 
@@ -183,6 +187,64 @@ TEST_F(Delivery, FullDiskKeepsTheQueueFileAndTheMailboxAsItWas) {
   // Room again: the kept file goes in whole, with the next identifier.
   ASSERT_EQ(mailbox_append(big, "ann", "bob@x"), 1);
   EXPECT_EQ(mailbox_lookup(inbox())->messages.back().uid, 2u);
+}
+
+TEST_F(Delivery, AnAppendCountsOnlyOnceItAndItsLengthAreSynced) {
+  ASSERT_EQ(mailbox_append(queue("Subject: fits\r\n"), "ann", "bob@x"), 1);
+  std::string before = read_file(inbox());
+  std::string overview = read_file(home_ / "mail" / "overview" / "inbox");
+  std::string big = queue("Subject: big\r\n", std::string(200000, 'y') + "\r\n");
+  // A write failing half way, the mailbox's sync, the overview's sync.
+  for (auto [op, n] : {std::pair{sysio::Op::write, 2}, {sysio::Op::sync, 1}, {sysio::Op::sync, 2}}) {
+    sysio::reset();
+    sysio::fail_nth(op, n);
+    EXPECT_EQ(mailbox_append(big, "ann", "bob@x"), kAppendTemporaryFailure);
+    EXPECT_EQ(read_file(inbox()), before);
+    EXPECT_EQ(read_file(home_ / "mail" / "overview" / "inbox"), overview);
+    EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+  }
+  sysio::reset();
+  ASSERT_EQ(mailbox_append(big, "ann", "bob@x"), 1);
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 3u);  // the mailbox, then the overview and its folder
+  EXPECT_EQ(mailbox_lookup(inbox())->messages.back().uid, 2u);
+}
+
+TEST_F(Delivery, AtMostTwentyNewBoxesPerUserAndDay) {
+  server_now = 1700000000;
+  auto to = [&](std::string box) { return mailbox_append(queue("Subject: s\r\n"), "ann_" + box + "@site.example", "b@x"); };
+  for (int i = 0; i < 21; ++i) ASSERT_EQ(to("box" + std::to_string(i)), 1);
+  EXPECT_TRUE(fs::exists(home_ / "mail" / "box19"));
+  EXPECT_FALSE(fs::exists(home_ / "mail" / "box20"));
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+  ASSERT_EQ(to("box3"), 1);  // boxes that exist still get their mail
+  EXPECT_EQ(mailbox_lookup((home_ / "mail" / "box3").string())->count, 2);
+  server_now += 24 * 3600;
+  ASSERT_EQ(to("box20"), 1);
+  EXPECT_TRUE(fs::exists(home_ / "mail" / "box20"));
+}
+
+TEST_F(Delivery, AHomeTheSuiteCannotWriteKeepsTheMessageWaiting) {
+  std::string q = queue("Subject: wait\r\n");
+  fs::permissions(dir_, fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
+                            fs::perms::others_read | fs::perms::others_exec);
+  fs::permissions(home_, fs::perms::owner_read | fs::perms::owner_exec | fs::perms::group_read |
+                             fs::perms::group_exec | fs::perms::others_read | fs::perms::others_exec);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {  // as root, the suite runs as another user here
+    if (geteuid() == 0 && (setgroups(0, nullptr) != 0 || setresgid(4242, 4242, 4242) != 0 ||
+                           setresuid(4242, 4242, 4242) != 0)) {
+      _exit(99);
+    }
+    _exit(mailbox_append(q, "ann", "bob@x"));
+  }
+  int status = 0;
+  waitpid(child, &status, 0);
+  fs::permissions(home_, fs::perms::owner_all);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), kAppendTemporaryFailure);
+  EXPECT_TRUE(fs::exists(q));
+  EXPECT_FALSE(fs::exists(home_ / "mail"));
 }
 
 TEST_F(Delivery, ForwardGoesOnButNeverInACircle) {

@@ -14,6 +14,7 @@
 #include "core/filecache.h"
 #include "core/globals.h"
 #include "core/log.h"
+#include "core/safedir.h"
 #include "core/strfmt.h"
 #include "core/util.h"
 #include "mail/mailfile.h"
@@ -25,6 +26,45 @@ namespace {
 std::list<Mailbox> g_boxes;  // lives as long as the process
 
 std::time_t now() { return server_now ? server_now : std::time(nullptr); }
+
+// ---- files below the home ---------------------------------------------------
+
+// The home of a mailbox path when none is given: the folder above "mail".
+std::string home_of(const std::string& path) { return std::string(path_dir(path_dir(path))); }
+
+// A path below the home, relative to it; "" (which opens nothing) for a
+// path that is not below it.
+std::string below_home(const std::string& home, std::string_view path) {
+  if (!home.empty()) {
+    if (path.substr(0, home.size()) != home) return {};
+    path.remove_prefix(home.size());
+    if (home.back() != '/' && !path.empty() && path.front() != '/') return {};
+  }
+  while (!path.empty() && path.front() == '/') path.remove_prefix(1);
+  return std::string(path);
+}
+
+void log_refusal(const std::string& home, const SafeResult& r) {
+  if (r.refused()) log_write("Mailbox refused: " + safe_describe(home, r), logchan::errors);
+}
+
+// A file below a home, opened without following links (refusals logged).
+SafeResult open_below(const std::string& home, std::string_view path, int flags, UniqueFd& fd) {
+  SafeDir root;
+  SafeResult r = SafeDir::open_root(home, root);
+  if (r.ok()) r = root.open_file(below_home(home, path), flags, fd);
+  log_refusal(home, r);
+  return r;
+}
+
+// The folder that holds `path`, below a home; made when missing if `create`.
+SafeResult open_folder_of(const std::string& home, std::string_view path, bool create, SafeDir& dir) {
+  SafeDir root;
+  SafeResult r = SafeDir::open_root(home, root);
+  if (r.ok()) r = root.open_dir(path_dir(below_home(home, path)), create, dir);
+  log_refusal(home, r);
+  return r;
+}
 
 
 bool is_blank(char c) { return c == ' ' || c == '\t'; }
@@ -232,54 +272,72 @@ void reset(Mailbox& box) {
 // Parses the whole mailbox file again and writes a fresh overview. The next
 // identifier never goes down, so a client that remembers identifiers never
 // sees one reused.
-void rebuild(Mailbox& box) {
+void rebuild(Mailbox& box, ByteSource& in) {
   std::uint32_t next = std::max<std::uint32_t>(box.next_uid, 1);
   reset(box);
   box.next_uid = 1;
-  FileSource in(box.path);
   parse_all(box, in, 0);
   box.next_uid = std::max(box.next_uid, next);
   recount(box);
   mailbox_overview_write(box);
 }
 
-struct FileStamp {
-  bool exists = false;
-  bool regular = false;
-  std::uint64_t size = 0;
-  struct timespec mtime {};
-};
-
-FileStamp stamp(const std::string& path) {
-  FileStamp s;
-  struct stat st {};
-  if (::stat(path.c_str(), &st) == 0) {
-    s.exists = true;
-    s.regular = S_ISREG(st.st_mode);
-    s.size = static_cast<std::uint64_t>(st.st_size);
-    s.mtime = st.st_mtim;
-  }
-  return s;
-}
-
 bool newer(const struct timespec& a, const struct timespec& b) {
   return a.tv_sec > b.tv_sec || (a.tv_sec == b.tv_sec && a.tv_nsec > b.tv_nsec);
 }
 
-// Brings a cached record in line with the file: messages appended behind
-// our back are parsed; a file that shrank is read again unless a session
-// is using it (its message numbers must not move under it).
-void refresh(Mailbox& box, std::uint64_t file_size) {
+// Whole messages from `from` to the end: a separator line first, the "."
+// line that ends a message last.
+bool whole_messages(ByteSource& in, std::uint64_t from) {
+  if (in.size() < from + 5) return false;
+  if (mailbox_separator_date(read_line(in, from, 1024).text) == kBadDate) return false;
+  return in.view(in.size() - 5, 5).substr(0, 5) == "\r\n.\r\n";
+}
+
+// Cuts the mailbox back to `length`, unless it was replaced since `seen`
+// was taken of it.
+void cut_back(const Mailbox& box, const struct stat& seen, std::uint64_t length) {
+  UniqueFd fd;
+  if (!open_below(box.home, box.path, O_WRONLY, fd).ok()) return;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0 || st.st_ino != seen.st_ino || st.st_dev != seen.st_dev) return;
+  int rc = sysio::ftruncate(fd.get(), static_cast<off_t>(length)) == 0 && sysio::fsync(fd.get()) == 0 ? 0 : errno;
+  log_write(strprintf("Mailbox %s cut back to its last whole message, %llu bytes dropped%s", box.path.c_str(),
+                      static_cast<unsigned long long>(static_cast<std::uint64_t>(st.st_size) - length),
+                      rc ? (": " + error_text(rc)).c_str() : ""),
+            logchan::errors);
+}
+
+// Brings a record in line with its file. A file longer than the records
+// holds either whole messages added behind our back, which are parsed, or
+// what an interrupted append left, which is cut off so that no later
+// message is glued to it. A file that shrank is read again unless a
+// session is using it (its message numbers must not move under it).
+void settle(Mailbox& box, FileSource& in, const struct stat& st) {
   std::uint64_t known = mailbox_size(box);
-  if (file_size == known) return;
-  if (file_size > known) {
-    FileSource in(box.path);
+  if (in.size() == known) return;
+  if (in.size() < known) {
+    if (!(box.flags & boxflag::in_use)) rebuild(box, in);
+  } else if (whole_messages(in, known)) {
     parse_all(box, in, known);
     recount(box);
     mailbox_overview_write(box);
-  } else if (!(box.flags & boxflag::in_use)) {
-    rebuild(box);
+  } else {
+    cut_back(box, st, known);
   }
+}
+
+// Reads the overview file; 0 and its time of writing, or non-zero.
+int read_overview(Mailbox& box, struct timespec& written) {
+  UniqueFd fd;
+  if (!open_below(box.home, mailbox_overview_path(box.path), O_RDONLY, fd).ok()) return 1;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0) return 1;
+  written = st.st_mtim;
+  FileSource in(std::move(fd));
+  std::string_view text = in.view(0, static_cast<std::size_t>(in.size()));
+  if (text.size() != in.size()) return 1;
+  return mailbox_overview_parse(box, text);
 }
 
 }  // namespace
@@ -425,7 +483,8 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
           if (v.find('A') != std::string_view::npos) rec.flags |= msgflag::answered;
         } else if (str_istarts_with(h, "X-UID:")) {
           uid = parse_u32(value_after_colon(h));
-        } else if (str_istarts_with(h.substr(2), "read-receipt: yes") || str_istarts_with(h.substr(2), "return-receipt-to:")) {
+        } else if (h.size() > 2 && (str_istarts_with(h.substr(2), "read-receipt: yes") ||
+                                    str_istarts_with(h.substr(2), "return-receipt-to:"))) {
           rec.flags |= msgflag::receipt_wanted;
         }
         break;
@@ -486,6 +545,20 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
   return end < in.size() ? end : kNoMessage;
 }
 
+int mailbox_commit(Mailbox& box, ByteSource& in, std::uint64_t from) {
+  std::size_t before = box.messages.size();
+  std::uint32_t next = box.next_uid;
+  parse_all(box, in, from);
+  recount(box);
+  int rc = in.failed() ? EIO : mailbox_overview_write(box);
+  if (rc) {
+    box.messages.resize(before);
+    box.next_uid = next;
+    recount(box);
+  }
+  return rc;
+}
+
 // ---- overview -----------------------------------------------------------------
 
 std::string mailbox_overview_text(const Mailbox& box) {
@@ -503,7 +576,8 @@ std::string mailbox_overview_text(const Mailbox& box) {
   std::string out;
   // The next identifier is kept too, so identifiers are never reused after
   // the newest messages were removed.
-  strappendf(out, "#uidnext %u\n", box.next_uid);
+  strappendf(out, "#uidnext %u\n#length %llu\n", box.next_uid,
+             static_cast<unsigned long long>(mailbox_size(box)));
   for (const auto& m : box.messages) {
     strappendf(out, "#msg\n%llu,%llu,%llu,%llu,%u,%u,%llu\n", date(m.internal_date),
                static_cast<unsigned long long>(m.sent_date), static_cast<unsigned long long>(m.total_length),
@@ -529,6 +603,7 @@ std::string mailbox_overview_text(const Mailbox& box) {
 int mailbox_overview_parse(Mailbox& box, std::string_view text) {
   std::list<MessageRecord> messages;
   std::uint32_t next = 1;
+  std::optional<std::uint64_t> committed;
   auto next_line = [&](std::string_view& line) {
     if (text.empty()) return false;
     std::size_t lf = text.find('\n');
@@ -556,6 +631,10 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
   while (next_line(line)) {
     if (line.substr(0, 9) == "#uidnext ") {
       next = std::max(next, parse_u32(line.substr(9)));
+    } else if (line.substr(0, 8) == "#length ") {
+      std::uint64_t v = 0;
+      if (std::from_chars(line.data() + 8, line.data() + line.size(), v).ec != std::errc()) return 1;
+      committed = v;
     } else if (line == "#msg") {
       std::string_view nums, from, to, subject, reply_to;
       unsigned long long v[7];
@@ -601,6 +680,9 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
     }
   }
   if (current) return 1;  // the last message's block was cut off
+  std::uint64_t sum = 0;
+  for (const auto& m : messages) sum += m.total_length;
+  if (committed && *committed != sum) return 1;  // whole message blocks are missing
   box.messages = std::move(messages);
   box.next_uid = next;
   box.loaded = now();
@@ -610,8 +692,9 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
 
 int mailbox_overview_write(Mailbox& box) {
   std::string path = mailbox_overview_path(box.path);
-  make_parent_dirs(path);
-  int rc = file_write_atomic(path, mailbox_overview_text(box), false, 0600);
+  SafeDir dir;
+  SafeResult where = open_folder_of(box.home, path, true, dir);
+  int rc = where.ok() ? dir.replace_file(path_leaf(path), mailbox_overview_text(box), 0600) : where.error;
   if (rc == 0) {
     box.overview_written = now();
     box.changed = false;
@@ -622,37 +705,51 @@ int mailbox_overview_write(Mailbox& box) {
 }
 
 int mailbox_overview_read(Mailbox& box) {
-  std::string path = mailbox_overview_path(box.path);
-  FileSource in(path);
-  if (!in.is_open()) return 1;
-  std::string_view text = in.view(0, static_cast<std::size_t>(in.size()));
-  if (text.size() != in.size()) return 1;
-  return mailbox_overview_parse(box, text);
+  struct timespec written {};
+  return read_overview(box, written);
 }
 
 // ---- the cache ----------------------------------------------------------------
 
-Mailbox* mailbox_lookup(const std::string& path) {
-  FileStamp file = stamp(path);
-  if (!file.regular) return nullptr;
+Mailbox* mailbox_lookup(const std::string& path, const std::string& home) {
+  UniqueFd fd;
+  if (!open_below(home, path, O_RDONLY, fd).ok()) return nullptr;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0) return nullptr;
+  FileSource in(std::move(fd));
   for (auto& box : g_boxes) {
     if (box.path != path) continue;  // paths are case-sensitive here
-    refresh(box, file.size);
+    settle(box, in, st);
     recount(box);
     box.looked_up = now();
     return &box;
   }
   Mailbox& box = g_boxes.emplace_front();
   box.path = path;
+  box.home = home;
   box.looked_up = now();
-  // The overview is trusted only when it describes this very file: same
-  // total length, and written after the mailbox last changed. Anything else
-  // (a crash between the two writes, a hand edit) is parsed again.
-  FileStamp overview = stamp(mailbox_overview_path(path));
-  bool read = overview.exists && mailbox_overview_read(box) == 0;
-  if (read && !newer(file.mtime, overview.mtime) && mailbox_size(box) == file.size) return &box;
-  rebuild(box);  // keeps the next identifier the overview knew
+  // The overview is trusted when it describes this very file: the same
+  // length, written after the mailbox last changed; or a shorter length,
+  // which the file is then settled to. Anything else (a hand edit, a crash
+  // inside an expunge) is parsed again.
+  struct timespec written {};
+  if (read_overview(box, written) == 0) {
+    std::uint64_t known = mailbox_size(box);
+    if (known < in.size() || (known == in.size() && !newer(st.st_mtim, written))) {
+      settle(box, in, st);
+      return &box;
+    }
+  }
+  rebuild(box, in);  // keeps the next identifier the overview knew
   return &box;
+}
+
+Mailbox* mailbox_lookup(const std::string& path) { return mailbox_lookup(path, home_of(path)); }
+
+UniqueFd mailbox_open(const Mailbox& box) {
+  UniqueFd fd;
+  open_below(box.home, box.path, O_RDONLY, fd);
+  return fd;
 }
 
 void mailbox_cache_clear() { g_boxes.clear(); }
@@ -677,18 +774,25 @@ int mailbox_expunge(Mailbox& box) {
   bool any = std::any_of(box.messages.begin(), box.messages.end(),
                          [](const MessageRecord& m) { return m.flags & msgflag::deleted; });
   if (!any) return 0;
-  UniqueFd old(::open(box.path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!old) return errno;
+  // Everything happens inside the mailbox's folder, reached the safe way;
+  // nothing is looked up by path again.
+  SafeDir dir;
+  if (SafeResult r = open_folder_of(box.home, box.path, false, dir); !r.ok()) return r.error;
+  std::string leaf(path_leaf(box.path));
+  UniqueFd old;
+  if (SafeResult r = dir.open_file(leaf, O_RDONLY, old); !r.ok()) {
+    log_refusal(box.home, r);
+    return r.error;
+  }
   struct stat st {};
   if (::fstat(old.get(), &st) != 0) return errno;
   if (static_cast<std::uint64_t>(st.st_size) < mailbox_size(box)) return EIO;  // records do not fit the file
 
   // The new mailbox is written beside the old one, synced, and renamed over
   // it: a crash at any point leaves the old mailbox or the new one, whole.
-  std::string leaf(path_leaf(box.path));
-  std::string tmp = std::string(path_dir(box.path)) + "/" + leaf.substr(0, 10) + "~";
-  UniqueFd out(::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, st.st_mode & 0777));
-  if (!out) return errno;
+  std::string tmp = leaf.substr(0, 10) + "~";
+  UniqueFd out;
+  if (SafeResult r = dir.create_new(tmp, st.st_mode & 0777, out); !r.ok()) return r.error;
   if (::fchown(out.get(), st.st_uid, st.st_gid) != 0) {
     // Only root may give the file away; the mailbox then keeps our owner.
   }
@@ -705,24 +809,30 @@ int mailbox_expunge(Mailbox& box) {
     offset += m.total_length;
   }
   if (run_length && !rc) rc = copy_range(old.get(), run_start, run_length, out.get());
-  // Messages appended behind the records (none while the mark is held) stay.
+  // Whole messages appended behind the records (none while the mark is
+  // held) stay; the rest of an interrupted append does not.
   std::uint64_t tail = static_cast<std::uint64_t>(st.st_size) - offset;
+  FileSource old_text(old.get());
+  if (tail && !whole_messages(old_text, offset)) tail = 0;
   if (tail && !rc) rc = copy_range(old.get(), offset, tail, out.get());
   if (!rc && sysio::fsync(out.get()) != 0) rc = errno;
   if (int c = out.close(); !rc) rc = c;
-  if (!rc && sysio::rename(tmp.c_str(), box.path.c_str()) != 0) rc = errno;
+  if (!rc) rc = dir.rename(tmp, leaf);
   if (rc) {
-    ::unlink(tmp.c_str());
+    dir.remove(tmp);
     log_message("Mailbox expunge failed:", box.path + " " + error_text(rc), logfac::maildebatch);
     return rc;
   }
-  sync_parent_dir(box.path);
+  dir.sync();
   box.messages.remove_if([](const MessageRecord& m) { return m.flags & msgflag::deleted; });
   recount(box);
   if (tail) {
-    FileSource in(box.path);
-    parse_all(box, in, mailbox_size(box));
-    recount(box);
+    UniqueFd now_fd;
+    if (dir.open_file(leaf, O_RDONLY, now_fd).ok()) {
+      FileSource in(std::move(now_fd));
+      parse_all(box, in, mailbox_size(box));
+      recount(box);
+    }
   }
   box.changed = true;
   mailbox_overview_write(box);

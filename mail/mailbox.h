@@ -14,6 +14,8 @@
 #include <string>
 #include <string_view>
 
+#include "core/fileio.h"
+
 namespace velmor {
 
 class CacheFile;
@@ -59,6 +61,10 @@ inline constexpr std::uint32_t delivered = 0x10000;
 
 struct Mailbox {
   std::string path;
+  // The user's home the mailbox lies below. The home is trusted (it comes
+  // from the users file); everything below it belongs to the user and is
+  // reached without following links (core/safedir.h).
+  std::string home;
   std::uint32_t flags = 0;
   int in_use_by = -1;  // descriptor (or other session id) holding the in-use mark
   int count = 0, unseen = 0;
@@ -78,14 +84,24 @@ inline constexpr int kAppendTemporaryFailure = 2;
 int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender);
 std::string mailbox_path_for_name(std::string_view home, std::string_view name);
 std::string mailbox_overview_path(std::string_view mailbox_path);
-// The cached record of a mailbox (loading or rebuilding its overview);
-// nullptr when the path is not a regular file.
+// The cached record of the mailbox `path` below the home `home` (loading
+// or rebuilding its overview); nullptr when the path is not a regular file
+// or is refused (a link, another user's file; logged). A mailbox longer
+// than its records is settled first: a tail of whole messages is taken in,
+// what an interrupted append left is cut off.
+Mailbox* mailbox_lookup(const std::string& path, const std::string& home);
+// The same for a mailbox in <home>/mail/: the home is the folder above.
 Mailbox* mailbox_lookup(const std::string& path);
+// The mailbox file opened for reading the safe way; an empty descriptor
+// when it is missing or refused.
+UniqueFd mailbox_open(const Mailbox& box);
 // The in-use mark shared by POP3, IMAP and web mail: true when taken.
 bool mailbox_take(Mailbox& box, int owner);
 void mailbox_release(Mailbox& box, int owner);
 // Removes the deleted messages, rewriting the mailbox through a temporary
-// file and a rename. 0 or an errno value (the old mailbox is then intact).
+// file (made O_EXCL beside it, synced, given the old owner through its
+// descriptor) and a rename. 0 or an errno value (the old mailbox is then
+// intact).
 int mailbox_expunge(Mailbox& box);
 int mailbox_overview_write(Mailbox& box);
 int mailbox_overview_read(Mailbox& box);
@@ -104,6 +120,11 @@ inline constexpr std::uint64_t kNoMessage = ~std::uint64_t{0};
 // kNoMessage at the end. A "From " line starts a message only at the start
 // of the file or right after the "." line that ends the previous message.
 std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbox& box);
+// Takes the messages written to the mailbox from `from` on into its record
+// and records the new committed length in the overview (synced). 0, or an
+// errno value: the record is then as before and the caller cuts the file
+// back to `from`.
+int mailbox_commit(Mailbox& box, ByteSource& in, std::uint64_t from);
 // The separator line for a queue file's first line ("From sender date").
 std::string mailbox_separator(std::string_view envelope_line, std::time_t when);
 // The date of a separator line; kBadDate when the line is none.
@@ -113,7 +134,12 @@ bool mailbox_header_dropped(std::string_view line);
 // The box a recipient address names by its sub-address ("ann_work@site" ->
 // "work"); "inbox" for anything that is not a plain name.
 std::string mailbox_box_for_address(std::string_view address);
+// The overview text. Beside the messages it records the next identifier
+// ("#uidnext") and the mailbox's committed length ("#length", the sum of
+// the messages' lengths; the last such line counts), so that what an
+// interrupted append left behind the committed length is recognised.
 std::string mailbox_overview_text(const Mailbox& box);
+// 0, or 1 for a text that is cut off or does not add up.
 int mailbox_overview_parse(Mailbox& box, std::string_view text);
 // Offset of a message in the mailbox file (the sum of the lengths before it).
 std::uint64_t mailbox_size(const Mailbox& box);

@@ -12,6 +12,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "core/fileio.h"
 #include "core/util.h"
 #include "mail/mailfile.h"
 #include "core/test_files.h"
@@ -174,6 +175,12 @@ TEST(MailboxParse, MimePartsWithNestingAndClosingDelimiters) {
   EXPECT_EQ(two.messages.front().parts.back().level, 1);
 }
 
+TEST(MailboxParse, DamagedLastLinesNeverThrow) {
+  for (const char* text : {"From a@x Tue Nov 14 22:13:20 2023\r\nSubject: s\r\nX", "X", "\r\nx"}) {
+    EXPECT_NO_THROW(parse(text)) << text;
+  }
+}
+
 TEST(MailboxOverview, RoundTripAndCutOffFilesAreRefused) {
   std::string m = message("a@x", "Content-Type: multipart/mixed; boundary=b\r\nSubject: s\r\nX-UID: 9\r\n",
                           "--b\r\nContent-Type: text/plain\r\n\r\nx\r\n--b--\r\n") +
@@ -186,7 +193,7 @@ TEST(MailboxOverview, RoundTripAndCutOffFilesAreRefused) {
   EXPECT_EQ(mailbox_overview_text(back), text);
   EXPECT_EQ(back.next_uid, 40u);
   EXPECT_EQ(back.count, 2);
-  for (std::size_t cut : {text.size() - 1, text.find("#mime") + 7, text.rfind("#end")}) {
+  for (std::size_t cut : {text.size() - 1, text.find("#mime") + 7, text.rfind("#end"), text.rfind("#msg")}) {
     Mailbox partial;
     EXPECT_NE(mailbox_overview_parse(partial, text.substr(0, cut)), 0) << cut;
   }
@@ -300,6 +307,40 @@ TEST_F(TempDir, KilledExpungeLeavesTheOldOrTheNewMailboxWhole) {
   Mailbox* reread = mailbox_lookup(inbox());
   EXPECT_EQ(reread->count, after == old_text ? 30 : 29);
   EXPECT_EQ(mailbox_size(*reread), after.size());
+}
+
+TEST_F(TempDir, AnInterruptedAppendIsCutBackBeforeAnythingElse) {
+  std::string m1 = message("a@x", "Subject: one\r\n", "1\r\n"), m2 = message("b@x", "Subject: two\r\n", "2\r\n");
+  write_file(inbox(), m1);
+  ASSERT_EQ(mailbox_lookup(inbox())->count, 1);
+  std::string fragment = m2.substr(0, m2.size() - 4);
+  write_file(inbox(), m1 + fragment);
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+  EXPECT_EQ(read_file(inbox()), m1);
+  // After a restart, the overview's committed length tells the same.
+  write_file(inbox(), m1 + fragment);
+  mailbox_cache_clear();
+  EXPECT_EQ(mailbox_lookup(inbox())->count, 1);
+  EXPECT_EQ(read_file(inbox()), m1);
+}
+
+TEST_F(TempDir, ExpungeSyncsTheNewMailboxBeforeItReplacesTheOld) {
+  std::string m1 = message("a@x", "Subject: one\r\n", "1\r\n"), m2 = message("b@x", "Subject: two\r\n", "2\r\n");
+  write_file(inbox(), m1 + m2);
+  Mailbox* box = mailbox_lookup(inbox());
+  box->messages.front().flags |= msgflag::deleted;
+  for (sysio::Op op : {sysio::Op::sync, sysio::Op::rename}) {
+    sysio::reset();
+    sysio::fail_nth(op, 1);
+    EXPECT_NE(mailbox_expunge(*box), 0);
+    EXPECT_EQ(read_file(inbox()), m1 + m2);
+    EXPECT_EQ(box->count, 2);
+    EXPECT_FALSE(fs::exists(dir_ / "mail" / "inbox~"));
+  }
+  sysio::reset();
+  ASSERT_EQ(mailbox_expunge(*box), 0);
+  EXPECT_EQ(read_file(inbox()), m2);
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 4u);  // the new mailbox and its folder, the overview and its folder
 }
 
 TEST_F(TempDir, InUseMarkBelongsToOneSession) {

@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <utility>
 
 namespace velmor {
 
@@ -24,6 +25,8 @@ FileSource::FileSource(const std::string& path)
 }
 
 FileSource::FileSource(int fd) : fd_(fd) { refresh(); }
+
+FileSource::FileSource(UniqueFd fd) : own_(std::move(fd)), fd_(own_.get()) { refresh(); }
 
 void FileSource::refresh() {
   window_.clear();

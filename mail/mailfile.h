@@ -38,6 +38,8 @@ class FileSource : public ByteSource {
   explicit FileSource(const std::string& path);
   // Reads through a descriptor owned by the caller.
   explicit FileSource(int fd);
+  // Reads through a descriptor it takes over (one opened safely below a home).
+  explicit FileSource(UniqueFd fd);
   bool is_open() const { return fd_ >= 0; }
   std::uint64_t size() const override { return size_; }
   std::string_view view(std::uint64_t offset, std::size_t want) override;

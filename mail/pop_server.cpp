@@ -166,7 +166,7 @@ void pass(SocketRecord& r, PopSession& s, std::string_view password, bool& disca
     return;
   }
   s.box = box;
-  s.file = UniqueFd(::open(box->path.c_str(), O_RDONLY | O_CLOEXEC));
+  s.file = mailbox_open(*box);
   if (!s.file) {
     drop_mailbox(r, s);
     reply(r, strprintf("+OK 0 messages waiting for %s (no mbox)\r\n", user->login.c_str()));
