@@ -604,6 +604,8 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
   std::list<MessageRecord> messages;
   std::uint32_t next = 1;
   std::optional<std::uint64_t> committed;
+  // Numbers must fit their fields, or what is written back would differ.
+  constexpr unsigned long long kU32 = 0xffffffffULL, kInt = 0x7fffffffULL;
   auto next_line = [&](std::string_view& line) {
     if (text.empty()) return false;
     std::size_t lf = text.find('\n');
@@ -638,7 +640,7 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
     } else if (line == "#msg") {
       std::string_view nums, from, to, subject, reply_to;
       unsigned long long v[7];
-      if (!next_line(nums) || !numbers(nums, v, 7) || !next_line(from) || !next_line(to) ||
+      if (!next_line(nums) || !numbers(nums, v, 7) || v[4] > kU32 || v[5] > kU32 || !next_line(from) || !next_line(to) ||
           !next_line(subject) || !next_line(reply_to)) {
         return 1;
       }
@@ -660,7 +662,8 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
     } else if (line == "#mime") {
       std::string_view nums, type, desc, id;
       unsigned long long v[6];
-      if (!current || !next_line(nums) || !numbers(nums, v, 6) || !next_line(type) || !next_line(desc) ||
+      if (!current || !next_line(nums) || !numbers(nums, v, 6) || std::any_of(v, v + 6, [](auto n) { return n > kU32; }) ||
+          v[3] > kInt || v[4] > kInt || v[5] > kInt || !next_line(type) || !next_line(desc) ||
           !next_line(id)) {
         return 1;
       }
