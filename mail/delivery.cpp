@@ -505,7 +505,8 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
   struct stat st {};
   std::uint64_t old_size = mailbox_size(*box);
   if (::fstat(fd.get(), &st) != 0 || static_cast<std::uint64_t>(st.st_size) != old_size) {
-    log_write("Mail delivery waits, the mailbox does not match its records: " + path, logchan::errors);
+    log_write("Mail delivery for `" + r.user->login + "' waits: " + path + " does not match its records",
+              logchan::errors);
     return kAppendTemporaryFailure;
   }
   std::uint32_t uid = box->next_uid ? box->next_uid : 1;
@@ -516,7 +517,7 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
     if (rc) take_back(fd.get(), old_size);
   }
   if (rc) {
-    log_message("Mailbox append failed:", path + " " + error_text(rc), logfac::maildebatch);
+    log_write("Mail delivery for `" + r.user->login + "' waits: " + path + ": " + error_text(rc), logchan::errors);
     return kAppendTemporaryFailure;
   }
   box->flags |= boxflag::new_mail | boxflag::delivered;
