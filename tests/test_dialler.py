@@ -2,21 +2,15 @@
 
 import os
 import select
-import signal
 import threading
-import time
 import unittest
 
-from harness import Suite
+from harness import Suite, wait_for as wait_briefly
 
 
-def wait_for(predicate, timeout=20.0):
-    deadline = time.monotonic() + timeout
-    while time.monotonic() < deadline:
-        if predicate():
-            return True
-        time.sleep(0.05)
-    return predicate()
+def wait_for(predicate):
+    # A script takes a step every half second; a few steps, with room to spare.
+    return wait_briefly(predicate, timeout=20.0)
 
 
 class FakeModem(threading.Thread):
