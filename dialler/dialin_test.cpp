@@ -2,11 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include "core/config.h"
-#include "core/filecache.h"
-#include "core/globals.h"
-#include "core/test_files.h"
-
 namespace velmor {
 namespace {
 
@@ -34,22 +29,6 @@ TEST(Dialin, EntriesLastLineFirst) {
   EXPECT_EQ(e.extra, 7);
   EXPECT_EQ(e.script, "login.scr");
   EXPECT_TRUE(e.enabled);
-}
-
-TEST(Dialin, LoadsTheConfiguredFile) {
-  testing_files::ScratchDir dir;
-  paths.tmp_dir = (dir.path() / "tmp").string();
-  config_reset();
-  filecache_init();
-  config.dialin_file = (dir.path() / "dialin").string();
-  dialin_load();
-  EXPECT_TRUE(dialin_entries().empty());  // a missing file leaves the list empty
-  testing_files::write_file(dir.path() / "dialin", "a 1\nb 2\n");
-  dialin_load();
-  ASSERT_EQ(dialin_entries().size(), 2u);
-  EXPECT_EQ(dialin_entries()[0].driver, "b");
-  filecache_shutdown();
-  config_reset();
 }
 
 }  // namespace
