@@ -44,6 +44,18 @@ struct SuiteHooks {
   // The group set every new socket record starts with (none until the
   // groups are loaded).
   std::function<std::shared_ptr<const GroupOptions>()> default_group;
+
+  // The dial-up link, between the dialler and the link monitor.
+  // Filled by the dialler: hangs up when the link has stayed down too long
+  // while on line. The link monitor runs it on its polls and when a response
+  // first proves the link (before setting link_up).
+  std::function<void()> link_watch;
+  // Filled by the link monitor. The dialler's script has ended: forget when
+  // the link was declared broken, so probing starts at once.
+  std::function<void()> link_probe_restart;
+  // The dialler has hung up (link_up cleared, link_probe_due set): the probe
+  // counter becomes 2.
+  std::function<void()> link_hung_up;
 };
 extern SuiteHooks hooks;
 

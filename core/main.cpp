@@ -30,6 +30,8 @@
 #include "core/scheduler.h"
 #include "core/sockets.h"
 #include "core/strfmt.h"
+#include "dialler/dialin.h"
+#include "dialler/dialler.h"
 #include "mail/queue.h"
 #include "users/admin.h"
 
@@ -289,6 +291,7 @@ void tick() {
   mail_poll();
   log_poll();
   schedule_poll();
+  dialler_poll();
   process_poll();
   sockets_check_timeouts();
 }
@@ -318,6 +321,8 @@ void shutdown_suite() {
   log_message("Shutting down");
   if (pid_file_written) ::unlink(paths.pid_file.c_str());
   control_remove();
+  log_message("Shutting down dialler");
+  dialler_shutdown();
   log_message("Shutting down sockets");
   sockets_close_all();
   log_message("Shutting down filecache");
@@ -389,6 +394,10 @@ int start_and_run() {
     return rc;
   };
 
+  log_message("Initialising dialler");
+  if (dialler_init() != 0) return fail(nullptr, 1);
+  log_message("Loading modem dial-in entries");
+  dialin_load();
   log_message("Loading scheduler task entries");
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // "Loading user database", "Loading user group options"; users_init says what failed.

@@ -45,6 +45,16 @@ _PORT_KEY = re.compile(r'^%([a-z.]+)\.sock\.port\s*:', re.IGNORECASE)
 _NOT_OURS = {'proxy.external'}
 
 
+def wait_for(predicate, timeout=5.0):
+    """Polls `predicate` until it is true or `timeout` seconds pass; its last value."""
+    deadline = time.monotonic() + timeout
+    while time.monotonic() < deadline:
+        if predicate():
+            return True
+        time.sleep(0.05)
+    return predicate()
+
+
 def free_port():
     """A TCP and UDP port on 127.0.0.1 that nobody uses right now."""
     while True:

@@ -7,7 +7,7 @@ import subprocess
 import time
 import unittest
 
-from harness import Suite, SuiteTestCase, VELMORCTL_BIN
+from harness import Suite, SuiteTestCase, VELMORCTL_BIN, wait_for
 
 
 def client(timeout=3.0):
@@ -16,15 +16,6 @@ def client(timeout=3.0):
     s.bind('')  # autobind
     s.settimeout(timeout)
     return s
-
-
-def wait_for(predicate, timeout=5.0):
-    deadline = time.monotonic() + timeout
-    while time.monotonic() < deadline:
-        if predicate():
-            return True
-        time.sleep(0.05)
-    return predicate()
 
 
 class ControlChannelTest(SuiteTestCase):
