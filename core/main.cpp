@@ -30,6 +30,7 @@
 #include "core/scheduler.h"
 #include "core/sockets.h"
 #include "core/strfmt.h"
+#include "dns/service.h"
 #include "mail/queue.h"
 #include "users/admin.h"
 
@@ -290,6 +291,7 @@ void tick() {
   log_poll();
   schedule_poll();
   process_poll();
+  dns_poll();  // resends, time-outs, and the link monitor while the link is down or in doubt
   sockets_check_timeouts();
 }
 
@@ -318,6 +320,7 @@ void shutdown_suite() {
   log_message("Shutting down");
   if (pid_file_written) ::unlink(paths.pid_file.c_str());
   control_remove();
+  dns_shutdown();
   log_message("Shutting down sockets");
   sockets_close_all();
   log_message("Shutting down filecache");
@@ -393,6 +396,7 @@ int start_and_run() {
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // "Loading user database", "Loading user group options"; users_init says what failed.
   if (int rc = users_init()) return fail(nullptr, rc);
+  dns_init();  // its sockets open with the listeners
   log_message("Initialising mail system");
   mail_init();
   log_message("Starting listening sockets");

@@ -7,7 +7,9 @@
 // a fresh abstract address chosen by the kernel, so nothing is left behind
 // in the file system. Exit status: 0 done; 1 the suite did not answer a
 // command that has a reply (or could not be reached); 2 usage; 3 a password
-// change was refused.
+// change was refused. "lookup NAME" is answered when the lookup ends, which
+// may take a while: velmorctl waits as long as the suite still answers
+// "test" in between.
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -65,7 +67,8 @@ int main(int argc, char** argv) {
 
   const bool listing = iequals_prefix(command, "listmq", true) || iequals_prefix(command, "listnq", true);
   const bool password = iequals_prefix(command, "change pass", false);
-  const bool answered = listing || password || iequals_prefix(command, "test", true) ||
+  const bool lookup = iequals_prefix(command, "lookup ", false);
+  const bool answered = listing || password || lookup || iequals_prefix(command, "test", true) ||
                         iequals_prefix(command, "status", true);
 
   sockaddr_un to{};
@@ -95,9 +98,15 @@ int main(int argc, char** argv) {
     return 0;
   }
   int status = 0;
+  bool alive_asked = false;  // a lookup's wait: "test" sent, its answer not yet seen
   for (;;) {
     pollfd p{fd, POLLIN, 0};
     if (poll(&p, 1, kReplyWaitMs) <= 0) {
+      if (lookup && !alive_asked &&
+          sendto(fd, "test", 4, 0, reinterpret_cast<sockaddr*>(&to), sizeof to) == 4) {
+        alive_asked = true;  // still running? then the lookup is still going
+        continue;
+      }
       std::fprintf(stderr, "velmorctl: no answer from the suite at %s\n", control.c_str());
       status = 1;
       break;
@@ -110,6 +119,10 @@ int main(int argc, char** argv) {
       break;
     }
     std::string_view reply(buf, static_cast<std::size_t>(n));
+    if (lookup && !reply.starts_with("lookup:")) {
+      alive_asked = false;  // the answer to "test"
+      continue;
+    }
     std::fwrite(reply.data(), 1, reply.size(), stdout);
     if (!reply.empty() && reply.back() != '\n') std::fputc('\n', stdout);
     if (password && reply != "2") status = 3;
