@@ -107,10 +107,15 @@ class ResolverTest : public ::testing::Test {
 TEST_F(ResolverTest, TriesEachServerInTurnThenTimesOutAndAsksForProbes) {
   QueryId q = resolver.client_start("www.example.org", 1, 1);
   ASSERT_EQ(resolver.state(q), QueryState::waiting);
+  ASSERT_EQ(net.sent.size(), 1u);  // the first datagram leaves at once
+  QueryId other = resolver.client_start("ftp.example.org", 1, 1);
   for (std::time_t t = 1001; t <= 1019; ++t) at(t);
   std::vector<std::uint32_t> servers;
-  for (const auto& s : net.sent) servers.push_back(s.server);
+  for (const auto& s : net.sent)
+    if (s.socket == net.sent[0].socket) servers.push_back(s.server);
   EXPECT_EQ(servers, (std::vector<std::uint32_t>{kServer1, kServer2, kServer1, kServer2}));
+  EXPECT_EQ(net.sent.size(), 8u);  // both lookups' due resends leave in the same pass
+  resolver.client_discard(other);
   EXPECT_EQ(resolver.state(q), QueryState::waiting);
   EXPECT_EQ(link_probe_due, 0);
   at(1020);
@@ -189,10 +194,12 @@ TEST(DnsCache, KeepsTenThousandNamesDroppingTheLeastRecentlyUsed) {
   // A fresh answer replaces the name's records of that type.
   Record fresh = record(0);
   fresh.data = "wxyz";
+  fresh.ttl = 7 * 86400;
   cache.store({fresh}, 1);
   auto kept = cache.find("n0", 1);
   ASSERT_EQ(kept.size(), 1u);
   EXPECT_EQ(kept[0].data, "wxyz");
+  EXPECT_TRUE(cache.find("n0", 1 + 86400).empty());  // a TTL counts a day at most
 }
 
 // The binding to the dispatcher: a lookup belongs to the record that started
