@@ -70,7 +70,7 @@ std::optional<std::size_t> skip_name(std::span<const std::uint8_t> msg, std::siz
     }
     switch (c & 0xc0) {
       case 0x00:
-        if (c + 1 > msg.size() - cur) return std::nullopt;
+        if (c + 1u > msg.size() - cur) return std::nullopt;
         octets += c + 1u;
         if (octets + 1 > NS_MAXCDNAME) return std::nullopt;
         cur += c + 1u;
