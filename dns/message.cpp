@@ -26,11 +26,6 @@ std::uint32_t get32(std::span<const std::uint8_t> msg, std::size_t pos) {
 
 char ascii_lower(char c) { return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c; }
 
-std::string_view without_final_dot(std::string_view name) {
-  if (name.size() > 1 && name.back() == '.') name.remove_suffix(1);
-  return name;
-}
-
 // A name that lies inside RDATA must end exactly where the RDATA ends.
 bool name_fills(std::span<const std::uint8_t> msg, std::size_t pos, std::size_t rdata_end, std::string& out) {
   auto name = expand_name(msg, pos);
@@ -180,6 +175,11 @@ std::optional<std::vector<std::uint8_t>> build_query(std::uint16_t id, std::stri
   decode_header(packet, h);
   if (h.qdcount != 1 || h.ancount || h.nscount || h.arcount) return std::nullopt;
   return packet;
+}
+
+std::string_view without_final_dot(std::string_view name) {
+  if (name.size() > 1 && name.back() == '.') name.remove_suffix(1);
+  return name;
 }
 
 bool same_name(std::string_view a, std::string_view b) {

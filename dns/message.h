@@ -98,6 +98,7 @@ std::optional<std::pair<std::string, std::size_t>> expand_name(std::span<const s
 std::optional<std::vector<std::uint8_t>> build_query(std::uint16_t id, std::string_view name,
                                                      std::uint16_t type, std::uint16_t qclass);
 
+std::string_view without_final_dot(std::string_view name);
 // ASCII case-insensitive equality of two names, a final dot ignored on both.
 bool same_name(std::string_view a, std::string_view b);
 // The cache key of a name: lower case, without a final dot.

@@ -52,11 +52,6 @@ std::optional<std::uint16_t> random_id() {
 
 bool class_matches(std::uint16_t asked, std::uint16_t rclass) { return asked == kClassAny || asked == rclass; }
 
-std::string_view without_final_dot(std::string_view name) {
-  if (name.size() > 1 && name.back() == '.') name.remove_suffix(1);
-  return name;
-}
-
 }  // namespace
 
 std::vector<std::uint32_t> parse_servers(std::string_view text) {
