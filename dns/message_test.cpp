@@ -49,30 +49,18 @@ TEST(DnsMessage, NamesMayOnlyPointBackwardsOutOfTheirOwnPiece) {
   EXPECT_FALSE(skip_name(cut, base.size()));
 }
 
-TEST(DnsMessage, RecordsAreCheckedAgainstTheEnd) {
+// (Counts beyond the data, RDLENGTH past the end and an 8-byte A record are
+// driven end to end in tests/test_dns.py.)
+TEST(DnsMessage, RecordDataIsDecodedByType) {
   std::vector<Record> records;
-  const Bytes a_record = {0xc0, 12, 0, 1, 0, 1, 0, 0, 0, 60, 0, 4, 10, 0, 0, 1};
-  ASSERT_EQ(decode_all(with_records(1, a_record), records), DecodeResult::ok);
-  ASSERT_EQ(records.size(), 1u);
-  EXPECT_EQ(records[0].data, std::string("\x0a\x00\x00\x01", 4));
-
-  EXPECT_EQ(decode_all(with_records(2, a_record), records), DecodeResult::bad_name);  // count beyond the data
-  Bytes long_rdlength = a_record;
-  long_rdlength[11] = 5;
-  EXPECT_EQ(decode_all(with_records(1, long_rdlength), records), DecodeResult::bad_record);
-  Bytes eight = {0xc0, 12, 0, 1, 0, 1, 0, 0, 0, 60, 0, 8, 10, 0, 0, 1, 10, 0, 0, 2};
-  EXPECT_EQ(decode_all(with_records(1, eight), records), DecodeResult::bad_record);
   // A CNAME whose name runs past its RDATA.
   Bytes cname = {0xc0, 12, 0, 5, 0, 1, 0, 0, 0, 60, 0, 2, 1, 'c', 0xc0, 12};
   EXPECT_EQ(decode_all(with_records(1, cname), records), DecodeResult::bad_record);
   Bytes mx = {0xc0, 12, 0, 15, 0, 1, 0, 0, 0, 60, 0, 6, 0, 10, 2, 'm', 'x', 0};
-  mx[11] = 6;
   ASSERT_EQ(decode_all(with_records(1, mx), records), DecodeResult::ok);
   EXPECT_EQ(records[0].preference, 10);
   EXPECT_EQ(records[0].data, "mx");
-
-  Bytes big = with_records(0, Bytes(kMaxDatagram, 0));
-  EXPECT_EQ(decode_all(big, records), DecodeResult::too_large);
+  EXPECT_EQ(decode_all(with_records(0, Bytes(kMaxDatagram, 0)), records), DecodeResult::too_large);
 }
 
 TEST(DnsMessage, QueryCarriesOurIdentifierAndQuestion) {
