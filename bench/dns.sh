@@ -15,7 +15,18 @@ ADDRESS=${ADDRESS:-127.54.0.1}
 
 . ./scripts/deps.sh
 VELMOR_PACKAGES="$VELMOR_PACKAGES libbenchmark-dev unbound dnsperf"
+# The package must not start a system resolver (on 127.0.0.1:53, and through
+# resolvconf into the machine's own resolv.conf): only ours below runs.
+made_policy=
+if [ ! -e /usr/sbin/policy-rc.d ] && ! command -v unbound >/dev/null 2>&1; then
+  sudo=""
+  [ "$(id -u)" -eq 0 ] || sudo="sudo"
+  printf '#!/bin/sh\nexit 101\n' | $sudo tee /usr/sbin/policy-rc.d >/dev/null
+  $sudo chmod 755 /usr/sbin/policy-rc.d
+  made_policy=1
+fi
 velmor_install_deps
+[ -z "$made_policy" ] || $sudo rm -f /usr/sbin/policy-rc.d
 
 cmake -S . -B build-bench -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo -DVELMOR_SANITIZE=OFF \
   -DVELMOR_FUZZ=OFF -DVELMOR_TESTS=OFF -DVELMOR_BENCH=ON >/dev/null
