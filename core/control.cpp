@@ -32,6 +32,7 @@ struct ControlSocket {
   dev_t dev = 0;  // the socket file this process made
   ino_t ino = 0;
   bool made = false;
+  int fd = -1;  // the socket now open, for replies sent after the request's pass
 };
 ControlSocket& control() {
   static ControlSocket c;
@@ -69,7 +70,7 @@ std::time_t last_send_failure_log = -1;
 // once a second, so a client that never reads cannot flood the log.
 void send_reply(int fd, const sockaddr_un& to, socklen_t to_len, std::string_view text,
                 const char* failure_text) {
-  if (to_len <= sizeof(sa_family_t)) return;  // an unbound sender cannot be answered
+  if (fd < 0 || to_len <= sizeof(sa_family_t)) return;  // an unbound sender cannot be answered
   if (::sendto(fd, text.data(), text.size(), MSG_DONTWAIT | MSG_NOSIGNAL,
                reinterpret_cast<const sockaddr*>(&to), to_len) >= 0)
     return;
@@ -153,10 +154,12 @@ int control_read(SocketRecord& record, long) {
     }
     std::string_view text(buf, static_cast<std::size_t>(n));
     text = text.substr(0, text.find('\0'));
-    control_command(text, [&](std::string_view reply) {
-      bool pass = str_istarts_with(text, "change pass");
-      send_reply(record.fd, from, from_len, reply,
-                 pass ? "domain send failed (change pass) " : "domain send failed");
+    // A reply may also come later (a lookup's end), so it takes the
+    // sender's address along and the socket open at that time.
+    const char* failure = str_istarts_with(text, "change pass") ? "domain send failed (change pass) "
+                                                                 : "domain send failed";
+    control_command(text, [from, from_len, failure](std::string_view reply) {
+      send_reply(control().fd, from, from_len, reply, failure);
     });
   }
   return 0;
@@ -172,6 +175,19 @@ void list_queue(const std::function<void(const std::function<void(std::string_vi
   }
   reply("start mq\n");
   reply(end_line);
+}
+
+// "lookup NAME": one datagram when the lookup ends, "lookup:NAME:a.b.c.d\n"
+// or "lookup:NAME:failed\n".
+void lookup(std::string_view name, const std::function<void(std::string_view)>& reply) {
+  auto answer = [reply, name = std::string(name)](std::string_view address) {
+    reply("lookup:" + name + ":" + (address.empty() ? std::string("failed") : std::string(address)) + "\n");
+  };
+  if (!hooks.lookup || name.empty()) {
+    answer({});
+    return;
+  }
+  hooks.lookup(name, answer);
 }
 
 }  // namespace
@@ -194,6 +210,8 @@ void control_command(std::string_view text, const std::function<void(std::string
     status_bits &= ~status::mail_queue_changed;
   } else if (str_iequals(text, "clear nqcng")) {
     status_bits &= ~status::news_queue_changed;
+  } else if (str_istarts_with(text, "lookup ")) {
+    lookup(trim_blanks(text.substr(7)), reply);
   } else if (str_istarts_with(text, "log") || str_istarts_with(text, "nolog")) {
     switch_facility(text);
   } else if (str_iequals(text, "listmq")) {
@@ -213,6 +231,7 @@ void control_command(std::string_view text, const std::function<void(std::string
 
 void control_open() {
   auto& c = control();
+  c.fd = -1;  // listeners_open has closed the old one
   const std::string& path = paths.control;
   sockaddr_un a;
   socklen_t len;
@@ -250,7 +269,9 @@ void control_open() {
     register_service(svc::control | kDatagram, ServiceHandlers{.read = control_read});
   if (!record_create(fd, svc::control | kDatagram, sockstate::initial)) {
     ::close(fd);
+    return;
   }
+  c.fd = fd;
 }
 
 void control_remove() {

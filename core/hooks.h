@@ -36,6 +36,9 @@ struct SuiteHooks {
   std::function<void(const std::function<void(std::string_view)>& send)> list_mail_queue;
   std::function<void(const std::function<void(std::string_view)>& send)> list_news_queue;
   std::function<std::size_t()> outgoing_mail_count;
+  // "lookup NAME": resolves an address and calls `done` once, when the
+  // lookup ends, with the dotted address or an empty text when it failed.
+  std::function<void(std::string_view name, std::function<void(std::string_view address)> done)> lookup;
 
   // Connection counts of the mail clients, for the mail transfer sequence.
   std::function<int()> pop_client_count;

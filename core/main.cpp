@@ -32,6 +32,7 @@
 #include "core/strfmt.h"
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
+#include "dns/service.h"
 #include "mail/queue.h"
 #include "users/admin.h"
 
@@ -293,6 +294,7 @@ void tick() {
   schedule_poll();
   dialler_poll();
   process_poll();
+  dns_poll();  // resends, time-outs, and the link monitor while the link is down or in doubt
   sockets_check_timeouts();
 }
 
@@ -323,6 +325,7 @@ void shutdown_suite() {
   control_remove();
   log_message("Shutting down dialler");
   dialler_shutdown();
+  dns_shutdown();
   log_message("Shutting down sockets");
   sockets_close_all();
   log_message("Shutting down filecache");
@@ -402,6 +405,7 @@ int start_and_run() {
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // "Loading user database", "Loading user group options"; users_init says what failed.
   if (int rc = users_init()) return fail(nullptr, rc);
+  dns_init();  // its sockets open with the listeners
   log_message("Initialising mail system");
   mail_init();
   log_message("Starting listening sockets");

@@ -7,7 +7,9 @@
 // a fresh abstract address chosen by the kernel, so nothing is left behind
 // in the file system. Exit status: 0 done; 1 the suite did not answer a
 // command that has a reply (or could not be reached); 2 usage; 3 a password
-// change was refused.
+// change was refused. "lookup NAME" is answered when the lookup ends, which
+// may take a while: velmorctl waits as long as the suite still answers
+// "test" in between.
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -22,6 +24,8 @@
 namespace {
 
 constexpr int kReplyWaitMs = 3000;
+constexpr int kLookupWaitMs = 600000;  // far beyond the slowest lookup a configuration allows
+constexpr std::size_t kMaxCommand = 250;  // the suite ignores longer requests
 
 bool iequals_prefix(std::string_view text, std::string_view prefix, bool whole) {
   if (text.size() < prefix.size() || (whole && text.size() != prefix.size())) return false;
@@ -62,10 +66,15 @@ int main(int argc, char** argv) {
     command += argv[i];
   }
   if (command.empty()) return usage();
+  if (command.size() > kMaxCommand) {
+    std::fprintf(stderr, "velmorctl: a command has %zu characters at most\n", kMaxCommand);
+    return 2;
+  }
 
   const bool listing = iequals_prefix(command, "listmq", true) || iequals_prefix(command, "listnq", true);
   const bool password = iequals_prefix(command, "change pass", false);
-  const bool answered = listing || password || iequals_prefix(command, "test", true) ||
+  const bool lookup = iequals_prefix(command, "lookup ", false);
+  const bool answered = listing || password || lookup || iequals_prefix(command, "test", true) ||
                         iequals_prefix(command, "status", true);
 
   sockaddr_un to{};
@@ -95,9 +104,16 @@ int main(int argc, char** argv) {
     return 0;
   }
   int status = 0;
-  for (;;) {
+  bool alive_asked = false;  // a lookup's wait: "test" sent, its answer not yet seen
+  for (int waited = 0;;) {
     pollfd p{fd, POLLIN, 0};
     if (poll(&p, 1, kReplyWaitMs) <= 0) {
+      waited += kReplyWaitMs;
+      if (lookup && !alive_asked && waited < kLookupWaitMs &&
+          sendto(fd, "test", 4, 0, reinterpret_cast<sockaddr*>(&to), sizeof to) == 4) {
+        alive_asked = true;  // still running? then the lookup is still going
+        continue;
+      }
       std::fprintf(stderr, "velmorctl: no answer from the suite at %s\n", control.c_str());
       status = 1;
       break;
@@ -110,6 +126,10 @@ int main(int argc, char** argv) {
       break;
     }
     std::string_view reply(buf, static_cast<std::size_t>(n));
+    if (lookup && !reply.starts_with("lookup:")) {
+      alive_asked = false;  // the answer to "test"
+      continue;
+    }
     std::fwrite(reply.data(), 1, reply.size(), stdout);
     if (!reply.empty() && reply.back() != '\n') std::fputc('\n', stdout);
     if (password && reply != "2") status = 3;
