@@ -1,4 +1,4 @@
-// The table of the 231 master-configuration keys: name, kind, storage and
+// The table of the 232 master-configuration keys: name, kind, storage and
 // multiplier. The defaults are the initial values of the fields in config.h.
 #include "core/config.h"
 
@@ -224,6 +224,7 @@ const std::vector<ConfigKeyInfo>& config_keys() {
       {"admin.email", ConfigKind::string, &config.admin_email, 1},
       {"server.name", ConfigKind::string, &config.server_name, 1},
       {"sock.buffer", ConfigKind::integer, &config.sock_buffer, 1},
+      {"sock.session.max", ConfigKind::integer, &config.sock_session_max, 1},
       {"cache.big", ConfigKind::integer, &config.cache_big, 1024},
       {"cache.max", ConfigKind::integer, &config.cache_max, 1024},
       {"store.state", ConfigKind::integer, &config.store_state, 1},

@@ -15,6 +15,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <exception>
 #include <string>
 #include <string_view>
 
@@ -277,20 +278,33 @@ std::int64_t monotonic_ms() {
       .count();
 }
 
+// Runs one poll of the main loop. An exception from it skips the rest of
+// that poll, is logged, and the loop goes on.
+template <class F>
+void guarded_poll(const char* name, F&& poll_step) {
+  try {
+    poll_step();
+  } catch (const std::exception& e) {
+    log_write(std::string("The ") + name + " poll failed: " + e.what(), logchan::errors, kLogUnbuffered);
+  } catch (...) {
+    log_write(std::string("The ") + name + " poll failed", logchan::errors, kLogUnbuffered);
+  }
+}
+
 // Waits for socket readiness, or for a signal, until the next tick.
 void wait_until(std::int64_t tick) {
   std::int64_t ms = std::max<std::int64_t>(0, tick - monotonic_ms());
-  dispatcher(static_cast<int>(ms));  // a signal ends the wait early
+  guarded_poll("dispatcher", [ms] { dispatcher(static_cast<int>(ms)); });  // a signal ends the wait early
 }
 
 // Every half second; each poll returns quickly.
 void tick() {
-  if (mail_transfer_state) mail_transfer_poll();
-  mail_poll();
-  log_poll();
-  schedule_poll();
-  process_poll();
-  sockets_check_timeouts();
+  if (mail_transfer_state) guarded_poll("mail transfer", mail_transfer_poll);
+  guarded_poll("mail", mail_poll);
+  guarded_poll("logger", log_poll);
+  guarded_poll("scheduler", schedule_poll);
+  guarded_poll("child process", process_poll);
+  guarded_poll("idle time-out", sockets_check_timeouts);
 }
 
 void poll() {
