@@ -657,17 +657,17 @@ Mailbox* mailbox_lookup(const std::string& path) {
 
 void mailbox_cache_clear() { g_boxes.clear(); }
 
-bool mailbox_take(Mailbox& box, int owner) {
+bool mailbox_take(Mailbox& box, std::uint64_t owner) {
   if (box.flags & boxflag::in_use) return box.in_use_by == owner;
   box.flags |= boxflag::in_use;
   box.in_use_by = owner;
   return true;
 }
 
-void mailbox_release(Mailbox& box, int owner) {
+void mailbox_release(Mailbox& box, std::uint64_t owner) {
   if ((box.flags & boxflag::in_use) && box.in_use_by == owner) {
     box.flags &= ~boxflag::in_use;
-    box.in_use_by = -1;
+    box.in_use_by = 0;
   }
 }
 

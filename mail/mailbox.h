@@ -60,7 +60,7 @@ inline constexpr std::uint32_t delivered = 0x10000;
 struct Mailbox {
   std::string path;
   std::uint32_t flags = 0;
-  int in_use_by = -1;  // descriptor (or other session id) holding the in-use mark
+  std::uint64_t in_use_by = 0;  // SocketRecord::id of the in-use mark's holder; 0 = none
   int count = 0, unseen = 0;
   std::uint32_t next_uid = 1;
   bool changed = false;
@@ -81,9 +81,11 @@ std::string mailbox_overview_path(std::string_view mailbox_path);
 // The cached record of a mailbox (loading or rebuilding its overview);
 // nullptr when the path is not a regular file.
 Mailbox* mailbox_lookup(const std::string& path);
-// The in-use mark shared by POP3, IMAP and web mail: true when taken.
-bool mailbox_take(Mailbox& box, int owner);
-void mailbox_release(Mailbox& box, int owner);
+// The in-use mark shared by POP3, IMAP and web mail: true when taken (or
+// already held by `owner`). The owner is a connection's never-reused id, so
+// a mark can never pass to a later connection on the same descriptor.
+bool mailbox_take(Mailbox& box, std::uint64_t owner);
+void mailbox_release(Mailbox& box, std::uint64_t owner);
 // Removes the deleted messages, rewriting the mailbox through a temporary
 // file and a rename. 0 or an errno value (the old mailbox is then intact).
 int mailbox_expunge(Mailbox& box);
