@@ -6,6 +6,7 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -47,11 +48,9 @@ constexpr const char* kUsage =
     "       velmor [--root DIR] --passwd NAME [--password PW]\n"
     "       velmor [--root DIR] --deluser NAME\n"
     "\n"
-    "  --root DIR        the installation folder (default /usr/local/velmor); the pid file\n"
-    "                    and the control socket then default to DIR/run/velmor.pid and\n"
-    "                    DIR/run/control\n"
-    "  --pid-file PATH   where the process id is written (default /var/run/velmor.pid)\n"
-    "  --control PATH    the control socket (default /tmp/velmor)\n"
+    "  --root DIR        the installation folder (default /usr/local/velmor)\n"
+    "  --pid-file PATH   where the process id is written (default DIR/run/velmor.pid)\n"
+    "  --control PATH    the control socket (default DIR/run/control)\n"
     "  --bind ADDR       listen on this IPv4 address only (default: every address)\n"
     "  --init            write the default installation into the root folder and exit;\n"
     "                    files that exist are left alone. Services listen on unprivileged\n"
@@ -131,9 +130,11 @@ int parse_command_line(int argc, char** argv, Options& options) {
     root = absolute(root);
     while (root.size() > 1 && root.back() == '/') root.pop_back();
     paths.root = root;
-    paths.pid_file = root + "/run/velmor.pid";
-    paths.control = root + "/run/control";
   }
+  // Both live in the installation's own run/, which belongs to the suite:
+  // nobody else can put a socket or a pid file there first.
+  paths.pid_file = paths.root + "/run/velmor.pid";
+  paths.control = paths.root + "/run/control";
   if (!pid_file.empty()) paths.pid_file = absolute(pid_file);
   if (!control.empty()) paths.control = absolute(control);
   paths.tmp_dir = paths.root + "/tmp";
@@ -164,8 +165,9 @@ int init_installation(const Options& options) {
     std::printf("Cannot make the installation folder %s: %s\n", paths.root.c_str(), std::strerror(errno));
     return 1;
   }
-  for (const char* dir : {"logs", "tmp", "run", "mail/in", "mail/out", "mail/odd", "home"})
+  for (const char* dir : {"logs", "tmp", "mail/in", "mail/out", "mail/odd", "home"})
     make_path(path_join(paths.root, dir));
+  ::mkdir(path_join(paths.root, "run").c_str(), 0750);  // the control socket's folder
 
   int written = 0, kept = 0;
   auto install = [&](std::string_view relative, std::string_view data) {

@@ -777,7 +777,9 @@ int listeners_open() {
     return h && h->open_sockets ? guarded(nullptr, service, "open", h->open_sockets) : 0;
   };
   if (open_own(svc::dns | kDatagram) != 0) return 1;
-  control_open();
+  // Without its control channel the suite could not be steered, and a
+  // squatter on the path would get what local tools send: no start.
+  if (control_open() != 0) return 1;
   return open_own(svc::multiport) != 0 ? 1 : 0;
 }
 
