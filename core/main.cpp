@@ -28,6 +28,7 @@
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/mime.h"
+#include "core/privileges.h"
 #include "core/process.h"
 #include "core/scheduler.h"
 #include "core/sockets.h"
@@ -42,7 +43,7 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: velmor [--root DIR] [--pid-file PATH] [--control PATH] [--bind ADDR]\n"
-    "              [--init [--standard-ports]] [--help] [--version]\n"
+    "              [--init [--standard-ports] [--user NAME]] [--help] [--version]\n"
     "       velmor [--root DIR] --adduser NAME [--password PW] [--full-name TEXT]\n"
     "              [--home DIR] [--group N]\n"
     "       velmor [--root DIR] --passwd NAME [--password PW]\n"
@@ -56,6 +57,8 @@ constexpr const char* kUsage =
     "                    files that exist are left alone. Services listen on unprivileged\n"
     "                    ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119, web 8000)\n"
     "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80\n"
+    "  --user NAME       with --init: server.user, the user the suite runs as once its\n"
+    "                    listeners are bound when started as root\n"
     "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
     "                    --password the password is read from standard input\n"
     "  --passwd NAME     set a user's password; --deluser NAME removes a user. A running\n"
@@ -66,6 +69,7 @@ constexpr const char* kUsage =
 struct Options {
   bool init = false;
   bool standard_ports = false;
+  std::string user;  // --init --user
 };
 
 std::string absolute(const std::string& path) {
@@ -113,6 +117,13 @@ int parse_command_line(int argc, char** argv, Options& options) {
       options.init = true;
     } else if (arg == "--standard-ports") {
       options.standard_ports = true;
+    } else if (arg == "--user") {
+      ok = value(options.user);
+      if (ok && options.user.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-") !=
+                    std::string::npos) {
+        std::fprintf(stderr, "velmor: --user needs a user name, not '%s'\n", options.user.c_str());
+        return 2;
+      }
     } else {
       std::fprintf(stderr, "velmor: unknown option '%s'\n%s", argv[i], kUsage);
       return 2;
@@ -122,8 +133,8 @@ int parse_command_line(int argc, char** argv, Options& options) {
       return 2;
     }
   }
-  if (options.standard_ports && !options.init) {
-    std::fprintf(stderr, "velmor: --standard-ports goes with --init\n");
+  if ((options.standard_ports || !options.user.empty()) && !options.init) {
+    std::fprintf(stderr, "velmor: --standard-ports and --user go with --init\n");
     return 2;
   }
   if (!root.empty()) {
@@ -159,6 +170,7 @@ int init_installation(const Options& options) {
       {"@IMAP_PORT@", standard ? "143" : "1143"},
       {"@NNTP_PORT@", standard ? "119" : "1119"},
       {"@WEB_PORT@", standard ? "80" : "8000"},
+      {"@SERVER_USER@", options.user},
   };
   make_path(paths.root);
   if (!file_is_directory(paths.root)) {
@@ -373,6 +385,10 @@ int start_and_run() {
   }
   std::printf("loaded config\n");
   log_mask = static_cast<std::uint32_t>(config.store_state);
+  if (std::string error = privileges_assume(text_of(config.server_user)); !error.empty()) {
+    std::printf("%s\n", error.c_str());
+    return 1;
+  }
 
   std::printf("initing filecache\n");
   if (int rc = filecache_init()) {
@@ -417,6 +433,13 @@ int start_and_run() {
     sockets_close_all();
     return fail("Socket initialisation failed - see logs for more info", 1);
   }
+  if (std::string error = privileges_drop(); !error.empty()) {
+    log_message(error);
+    sockets_close_all();
+    control_remove();
+    return fail(error.c_str(), 1);
+  }
+  if (!text_of(config.server_user).empty()) log_message("Running as user ", text_of(config.server_user));
 
   log_message("Suite started: ", kVersion);
   progress_code = 0;
@@ -439,7 +462,19 @@ int main(int argc, char** argv) {
   int users_command = users_command_options(argc, argv);  // --adduser, --passwd, --deluser
   if (users_command == 2) return 2;
   if (int rc = parse_command_line(argc, argv, options); rc >= 0) return rc;
-  if (users_command == 1) return users_command_run();
+  if (users_command == 1) {
+    // As root on an installation that runs as server.user, the user file
+    // and the homes made stay that user's.
+    if (geteuid() == 0 && file_is_regular(paths.master()) && config_load() == 0) {
+      std::string error = privileges_assume(text_of(config.server_user));
+      if (error.empty()) error = privileges_drop();
+      if (!error.empty()) {
+        std::printf("%s\n", error.c_str());
+        return 1;
+      }
+    }
+    return users_command_run();
+  }
   if (options.init) return init_installation(options);
   return start_and_run();
 }

@@ -27,6 +27,7 @@
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
+#include "core/privileges.h"
 #include "core/strfmt.h"
 
 namespace velmor {
@@ -704,7 +705,12 @@ int listener_open(int port, int service, int protocol, int* descriptor_out) {
       ::close(fd);
       return 1;
     }
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
+    int bound;
+    {
+      BindingPrivileges root;  // the only step that may need root
+      bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
+    }
+    if (bound != 0) {
       std::string msg = strprintf("Bind Failed - is another server running on this port: %d", port);
       serious(msg, kLogUnbuffered);
       log_message(msg);
