@@ -149,6 +149,7 @@ void md5_init(Md5& ctx) {
 }
 
 void md5_update(Md5& ctx, std::string_view data) {
+  if (data.empty()) return;  // an empty view may have no data pointer at all
   std::size_t used = ctx.count % 64;
   ctx.count += data.size();
   const auto* p = reinterpret_cast<const unsigned char*>(data.data());

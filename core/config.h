@@ -257,7 +257,9 @@ struct Config {
   ConfigText util_bootp_addr;  // util.bootp.addr
   ConfigText admin_email;  // admin.email
   ConfigText server_name;  // server.name
+  ConfigText server_user;  // server.user: started as root, run as this user once bound
   std::int32_t sock_buffer = 0;  // sock.buffer
+  std::int32_t sock_session_max = 3600;  // sock.session.max: seconds a connection may last (0 = no limit)
   std::int32_t cache_big = 0;  // cache.big (kilobytes in the file)
   std::int32_t cache_max = 0;  // cache.max (kilobytes in the file)
   std::int32_t store_state = 1;  // store.state

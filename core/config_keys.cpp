@@ -1,4 +1,4 @@
-// The table of the 231 master-configuration keys: name, kind, storage and
+// The table of the 233 master-configuration keys: name, kind, storage and
 // multiplier. The defaults are the initial values of the fields in config.h.
 #include "core/config.h"
 
@@ -223,7 +223,9 @@ const std::vector<ConfigKeyInfo>& config_keys() {
       {"util.bootp.addr", ConfigKind::string, &config.util_bootp_addr, 1},
       {"admin.email", ConfigKind::string, &config.admin_email, 1},
       {"server.name", ConfigKind::string, &config.server_name, 1},
+      {"server.user", ConfigKind::string, &config.server_user, 1},
       {"sock.buffer", ConfigKind::integer, &config.sock_buffer, 1},
+      {"sock.session.max", ConfigKind::integer, &config.sock_session_max, 1},
       {"cache.big", ConfigKind::integer, &config.cache_big, 1024},
       {"cache.max", ConfigKind::integer, &config.cache_max, 1024},
       {"store.state", ConfigKind::integer, &config.store_state, 1},

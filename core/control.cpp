@@ -14,6 +14,7 @@
 
 #include "core/commands.h"
 #include "core/config.h"
+#include "core/fileio.h"
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
@@ -229,7 +230,7 @@ void control_command(std::string_view text, const std::function<void(std::string
   }
 }
 
-void control_open() {
+int control_open() {
   auto& c = control();
   c.fd = -1;  // listeners_open has closed the old one
   const std::string& path = paths.control;
@@ -238,13 +239,21 @@ void control_open() {
   if (!make_address(path, a, len)) {
     log_write("Control socket path too long: " + path, logchan::errors);
     log_message("Control socket path too long: ", path);
-    return;
+    return 1;
   }
   int fd = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (fd < 0) {
     log_write("UDP socket create for UNIX domain failed", logchan::errors);
     log_message("UDP socket create for UNIX domain failed");
-    return;
+    return 1;
+  }
+  // A folder made here is the suite's alone (group members may use velmorctl).
+  if (std::size_t slash = path.find_last_of('/'); slash != std::string::npos && slash > 0) {
+    std::string dir = path.substr(0, slash);
+    if (::mkdir(dir.c_str(), 0750) != 0 && errno == ENOENT) {
+      make_parent_dirs(dir);
+      ::mkdir(dir.c_str(), 0750);
+    }
   }
   remove_stale_socket(path);
   // The socket file is born with mode 0660: nobody else may steer the suite.
@@ -255,8 +264,9 @@ void control_open() {
   if (bound != 0) {
     log_write("bind() for UNIX domain failed", logchan::errors);
     log_message("bind() for UNIX domain failed:", std::to_string(error));
+    log_message("The control socket cannot be made: ", path + ": " + std::strerror(error));
     ::close(fd);
-    return;
+    return 1;
   }
   chmod(path.c_str(), 0660);
   struct stat st{};
@@ -269,9 +279,11 @@ void control_open() {
     register_service(svc::control | kDatagram, ServiceHandlers{.read = control_read});
   if (!record_create(fd, svc::control | kDatagram, sockstate::initial)) {
     ::close(fd);
-    return;
+    control_remove();
+    return 1;
   }
   c.fd = fd;
+  return 0;
 }
 
 void control_remove() {

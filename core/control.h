@@ -9,9 +9,10 @@
 
 namespace velmor {
 
-// Creates and binds the socket at paths.control and makes its record. A
-// failure is logged; the suite then runs without a control channel.
-void control_open();
+// Creates and binds the socket at paths.control and makes its record.
+// 0 = done; 1 = it failed (logged), and the suite must not start: a path
+// someone else holds would otherwise receive what local tools send.
+int control_open();
 // Removes the socket path, only when this process made it.
 void control_remove();
 // Handles one command text; every reply datagram goes to `reply`.

@@ -50,13 +50,13 @@ inline constexpr std::uint32_t link_established = 0x10000;
 inline constexpr std::uint32_t news_queue_changed = 0x20000;
 }  // namespace status
 
-// Every path the daemon uses. Without command-line options they are the
-// classic ones; --root moves the installation, and with it the pid file and
-// the control socket unless those are given separately.
+// Every path the daemon uses. --root moves the installation, and with it
+// the pid file and the control socket (in its run/ folder, which belongs to
+// the suite) unless those are given separately.
 struct SuitePaths {
   std::string root = "/usr/local/velmor";         // the daemon chdir()s here
-  std::string pid_file = "/var/run/velmor.pid";
-  std::string control = "/tmp/velmor";           // control-channel socket
+  std::string pid_file = "/usr/local/velmor/run/velmor.pid";
+  std::string control = "/usr/local/velmor/run/control";  // control-channel socket
   std::string tmp_dir = "/usr/local/velmor/tmp";  // private temporary files
   std::string bind_address;                       // empty = every address
   std::string master() const { return root + "/config/master"; }

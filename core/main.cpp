@@ -6,6 +6,7 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,6 +16,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <exception>
 #include <string>
 #include <string_view>
 
@@ -26,6 +28,7 @@
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/mime.h"
+#include "core/privileges.h"
 #include "core/process.h"
 #include "core/scheduler.h"
 #include "core/sockets.h"
@@ -43,22 +46,22 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: velmor [--root DIR] [--pid-file PATH] [--control PATH] [--bind ADDR]\n"
-    "              [--init [--standard-ports]] [--help] [--version]\n"
+    "              [--init [--standard-ports] [--user NAME]] [--help] [--version]\n"
     "       velmor [--root DIR] --adduser NAME [--password PW] [--full-name TEXT]\n"
     "              [--home DIR] [--group N]\n"
     "       velmor [--root DIR] --passwd NAME [--password PW]\n"
     "       velmor [--root DIR] --deluser NAME\n"
     "\n"
-    "  --root DIR        the installation folder (default /usr/local/velmor); the pid file\n"
-    "                    and the control socket then default to DIR/run/velmor.pid and\n"
-    "                    DIR/run/control\n"
-    "  --pid-file PATH   where the process id is written (default /var/run/velmor.pid)\n"
-    "  --control PATH    the control socket (default /tmp/velmor)\n"
+    "  --root DIR        the installation folder (default /usr/local/velmor)\n"
+    "  --pid-file PATH   where the process id is written (default DIR/run/velmor.pid)\n"
+    "  --control PATH    the control socket (default DIR/run/control)\n"
     "  --bind ADDR       listen on this IPv4 address only (default: every address)\n"
     "  --init            write the default installation into the root folder and exit;\n"
     "                    files that exist are left alone. Services listen on unprivileged\n"
     "                    ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119, web 8000)\n"
     "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80\n"
+    "  --user NAME       with --init: server.user, the user the suite runs as once its\n"
+    "                    listeners are bound when started as root\n"
     "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
     "                    --password the password is read from standard input\n"
     "  --passwd NAME     set a user's password; --deluser NAME removes a user. A running\n"
@@ -69,6 +72,7 @@ constexpr const char* kUsage =
 struct Options {
   bool init = false;
   bool standard_ports = false;
+  std::string user;  // --init --user
 };
 
 std::string absolute(const std::string& path) {
@@ -116,6 +120,13 @@ int parse_command_line(int argc, char** argv, Options& options) {
       options.init = true;
     } else if (arg == "--standard-ports") {
       options.standard_ports = true;
+    } else if (arg == "--user") {
+      ok = value(options.user);
+      if (ok && options.user.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-") !=
+                    std::string::npos) {
+        std::fprintf(stderr, "velmor: --user needs a user name, not '%s'\n", options.user.c_str());
+        return 2;
+      }
     } else {
       std::fprintf(stderr, "velmor: unknown option '%s'\n%s", argv[i], kUsage);
       return 2;
@@ -125,17 +136,19 @@ int parse_command_line(int argc, char** argv, Options& options) {
       return 2;
     }
   }
-  if (options.standard_ports && !options.init) {
-    std::fprintf(stderr, "velmor: --standard-ports goes with --init\n");
+  if ((options.standard_ports || !options.user.empty()) && !options.init) {
+    std::fprintf(stderr, "velmor: --standard-ports and --user go with --init\n");
     return 2;
   }
   if (!root.empty()) {
     root = absolute(root);
     while (root.size() > 1 && root.back() == '/') root.pop_back();
     paths.root = root;
-    paths.pid_file = root + "/run/velmor.pid";
-    paths.control = root + "/run/control";
   }
+  // Both live in the installation's own run/, which belongs to the suite:
+  // nobody else can put a socket or a pid file there first.
+  paths.pid_file = paths.root + "/run/velmor.pid";
+  paths.control = paths.root + "/run/control";
   if (!pid_file.empty()) paths.pid_file = absolute(pid_file);
   if (!control.empty()) paths.control = absolute(control);
   paths.tmp_dir = paths.root + "/tmp";
@@ -160,14 +173,16 @@ int init_installation(const Options& options) {
       {"@IMAP_PORT@", standard ? "143" : "1143"},
       {"@NNTP_PORT@", standard ? "119" : "1119"},
       {"@WEB_PORT@", standard ? "80" : "8000"},
+      {"@SERVER_USER@", options.user},
   };
   make_path(paths.root);
   if (!file_is_directory(paths.root)) {
     std::printf("Cannot make the installation folder %s: %s\n", paths.root.c_str(), std::strerror(errno));
     return 1;
   }
-  for (const char* dir : {"logs", "tmp", "run", "mail/in", "mail/out", "mail/odd", "home"})
+  for (const char* dir : {"logs", "tmp", "mail/in", "mail/out", "mail/odd", "home"})
     make_path(path_join(paths.root, dir));
+  ::mkdir(path_join(paths.root, "run").c_str(), 0750);  // the control socket's folder
 
   int written = 0, kept = 0;
   auto install = [&](std::string_view relative, std::string_view data) {
@@ -280,22 +295,36 @@ std::int64_t monotonic_ms() {
       .count();
 }
 
+// Runs one poll of the main loop. An exception from it skips the rest of
+// that poll, is logged, and the loop goes on.
+template <class F>
+void guarded_poll(const char* name, F&& poll_step) {
+  try {
+    poll_step();
+  } catch (const std::exception& e) {
+    log_write(std::string("The ") + name + " poll failed: " + e.what(), logchan::errors, kLogUnbuffered);
+  } catch (...) {
+    log_write(std::string("The ") + name + " poll failed", logchan::errors, kLogUnbuffered);
+  }
+}
+
 // Waits for socket readiness, or for a signal, until the next tick.
 void wait_until(std::int64_t tick) {
   std::int64_t ms = std::max<std::int64_t>(0, tick - monotonic_ms());
-  dispatcher(static_cast<int>(ms));  // a signal ends the wait early
+  guarded_poll("dispatcher", [ms] { dispatcher(static_cast<int>(ms)); });  // a signal ends the wait early
 }
 
 // Every half second; each poll returns quickly.
 void tick() {
-  if (mail_transfer_state) mail_transfer_poll();
-  mail_poll();
-  log_poll();
-  schedule_poll();
-  dialler_poll();
-  process_poll();
-  dns_poll();  // resends, time-outs, and the link monitor while the link is down or in doubt
-  sockets_check_timeouts();
+  if (mail_transfer_state) guarded_poll("mail transfer", mail_transfer_poll);
+  guarded_poll("mail", mail_poll);
+  guarded_poll("logger", log_poll);
+  guarded_poll("scheduler", schedule_poll);
+  guarded_poll("dialler", dialler_poll);
+  guarded_poll("child process", process_poll);
+  // resends, time-outs, and the link monitor while the link is down or in doubt
+  guarded_poll("resolver", dns_poll);
+  guarded_poll("idle time-out", sockets_check_timeouts);
 }
 
 void poll() {
@@ -365,6 +394,10 @@ int start_and_run() {
   }
   std::printf("loaded config\n");
   log_mask = static_cast<std::uint32_t>(config.store_state);
+  if (std::string error = privileges_assume(text_of(config.server_user)); !error.empty()) {
+    std::printf("%s\n", error.c_str());
+    return 1;
+  }
 
   std::printf("initing filecache\n");
   if (int rc = filecache_init()) {
@@ -414,6 +447,13 @@ int start_and_run() {
     sockets_close_all();
     return fail("Socket initialisation failed - see logs for more info", 1);
   }
+  if (std::string error = privileges_drop(); !error.empty()) {
+    log_message(error);
+    sockets_close_all();
+    control_remove();
+    return fail(error.c_str(), 1);
+  }
+  if (!text_of(config.server_user).empty()) log_message("Running as user ", text_of(config.server_user));
 
   log_message("Suite started: ", kVersion);
   progress_code = 0;
@@ -436,7 +476,19 @@ int main(int argc, char** argv) {
   int users_command = users_command_options(argc, argv);  // --adduser, --passwd, --deluser
   if (users_command == 2) return 2;
   if (int rc = parse_command_line(argc, argv, options); rc >= 0) return rc;
-  if (users_command == 1) return users_command_run();
+  if (users_command == 1) {
+    // As root on an installation that runs as server.user, the user file
+    // and the homes made stay that user's.
+    if (geteuid() == 0 && file_is_regular(paths.master()) && config_load() == 0) {
+      std::string error = privileges_assume(text_of(config.server_user));
+      if (error.empty()) error = privileges_drop();
+      if (!error.empty()) {
+        std::printf("%s\n", error.c_str());
+        return 1;
+      }
+    }
+    return users_command_run();
+  }
   if (options.init) return init_installation(options);
   return start_and_run();
 }

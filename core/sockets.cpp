@@ -16,14 +16,18 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
+#include <exception>
 #include <map>
+#include <utility>
 #include <vector>
 
 #include "core/control.h"
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
+#include "core/privileges.h"
 #include "core/strfmt.h"
 
 namespace velmor {
@@ -133,6 +137,17 @@ struct Dispatcher {
   std::map<int, std::uint64_t> bytes_in;
   std::uint64_t accepted = 0;
   std::uint32_t generation = 0;
+  std::uint64_t last_id = 0;
+  // Connections of each (service, peer address), for the peer's share.
+  std::map<std::pair<int, std::uint32_t>, int> peers;
+  std::time_t share_logged = 0;
+  // Records with a timer set; an entry whose record is gone or whose timer
+  // was cancelled is dropped when met.
+  struct TimerRef {
+    int fd;
+    std::uint64_t id;
+  };
+  std::vector<TimerRef> timers;
   std::vector<epoll_event> events = std::vector<epoll_event>(256);
 };
 Dispatcher& state() {
@@ -162,11 +177,48 @@ std::uint64_t event_key(const SocketRecord& r) {
 bool is_datagram(const SocketRecord& r) { return (r.service & kDatagram) != 0; }
 bool is_listener(const SocketRecord& r) { return !is_datagram(r) && r.state == sockstate::listening; }
 
+std::int64_t monotonic_ms() {
+  return std::chrono::duration_cast<std::chrono::milliseconds>(
+             std::chrono::steady_clock::now().time_since_epoch())
+      .count();
+}
+
+// A handler that threw: one line to the error log, and its connection is
+// closed. Listening and datagram sockets serve everyone, so they stay.
+void handler_failed(SocketRecord* r, int service, const char* step, const char* what) {
+  serious(strprintf("Service %d: the %s handler failed: %s", service, step, what),
+          kLogUnbuffered);
+  if (r && !r->closed && !is_datagram(*r) && !is_listener(*r)) socket_close(r->fd);
+}
+
+// Runs one handler call: its result, or `failed` when it throws.
+template <class F>
+int guarded(SocketRecord* r, int service, const char* step, F&& call, int failed = 1) {
+  try {
+    return call();
+  } catch (const std::exception& e) {
+    handler_failed(r, service, step, e.what());
+  } catch (...) {
+    handler_failed(r, service, step, "unknown exception");
+  }
+  return failed;
+}
+
+// The command protocols count a connection as active when a whole line
+// arrives, not at every byte.
+bool paced_by_lines(int service) {
+  switch (service) {
+    case svc::smtp: case svc::pop: case svc::imap: case svc::nntp: case svc::web: return true;
+    default: return false;
+  }
+}
+
 int service_limit(int service) {
-  if (const ServiceHandlers* h = service_handlers(service); h && h->max_connections)
-    return h->max_connections();
   const ListenerKey* key = listener_key(service);
-  return key ? *key->max : -1;  // -1: no limit
+  int standard = key ? *key->max : -1;  // -1: no limit
+  if (const ServiceHandlers* h = service_handlers(service); h && h->max_connections)
+    return guarded(nullptr, service, "limit", h->max_connections, standard);
+  return standard;
 }
 
 // Connections that count against a listener's limit.
@@ -223,7 +275,8 @@ bool sync_interest(SocketRecord& r) {
 void peer_gone(SocketRecord& r, long n) {
   const ServiceHandlers* h = service_handlers(r.service);
   if (h && h->peer_closed) {
-    if (h->peer_closed(r, n) != 0 && !r.closed) socket_close(r.fd);
+    if (guarded(&r, r.service, "peer-closed", [&] { return h->peer_closed(r, n); }) != 0 && !r.closed)
+      socket_close(r.fd);
     return;
   }
   if (n == 0 && (!r.write_buf.empty() || r.want_write) && !r.closed) {
@@ -251,7 +304,7 @@ void write_step(SocketRecord& r) {
   const ServiceHandlers* h = service_handlers(r.service);
   if (h && h->write && !r.closed) {
     progress_code = 141010;
-    if (h->write(r) != 0 && !r.closed) {
+    if (guarded(&r, r.service, "write", [&] { return h->write(r); }) != 0 && !r.closed) {
       socket_close(r.fd);
       return;
     }
@@ -264,18 +317,19 @@ void read_step(SocketRecord& r) {
   const ServiceHandlers* h = service_handlers(r.service);
   if (is_datagram(r)) {
     // Datagram services receive for themselves.
-    if (h && h->read) h->read(r, 0);
+    if (h && h->read) guarded(&r, r.service, "read", [&] { return h->read(r, 0); });
     return;
   }
   if (r.read_buf.room() == 0 || r.dispatch.peer_eof) return;  // never read into a full buffer
   ssize_t n = ::recv(r.fd, r.read_buf.tail(), r.read_buf.room(), 0);
   if (n > 0) {
+    if (!paced_by_lines(r.service) || std::memchr(r.read_buf.tail(), '\n', static_cast<std::size_t>(n)))
+      r.last_active = server_now;
     r.read_buf.commit(static_cast<std::size_t>(n));
-    r.last_active = server_now;
     r.bytes_received += static_cast<std::uint64_t>(n);
     state().bytes_in[r.service] += static_cast<std::uint64_t>(n);
     progress_code = 141120;
-    if (h && h->read && h->read(r, n) != 0) {
+    if (h && h->read && guarded(&r, r.service, "read", [&] { return h->read(r, n); }) != 0) {
       if (!r.closed) socket_close(r.fd);
       return;
     }
@@ -317,16 +371,26 @@ void accept_step(SocketRecord& listener) {
       ::close(fd);
       continue;
     }
+    std::uint32_t peer_ip = peer.sin_family == AF_INET ? peer.sin_addr.s_addr : 0;
+    if (!peer_may_connect(service, peer_ip)) {
+      if (d.share_logged != server_now) {  // at most a line a second, however hard a peer tries
+        d.share_logged = server_now;
+        log_message(strprintf("Service %d: connection refused, too many from ", service), peer_text);
+      }
+      ::close(fd);
+      continue;
+    }
     SocketRecord* r = record_create(fd, service, sockstate::initial);
     if (!r) {
       serious(strprintf("Record create failed, service:%d", service));
       ::close(fd);
       continue;
     }
-    r->peer_addr = std::move(peer_text);
-    r->peer_ip = peer.sin_family == AF_INET ? peer.sin_addr.s_addr : 0;
+    record_set_peer(*r, peer_ip);
+    if (peer.sin_family != AF_INET) r->peer_addr = std::move(peer_text);
+    r->dispatch.accepted = true;
     ++d.accepted;
-    if (h && h->accept && h->accept(*r) != 0) {
+    if (h && h->accept && guarded(r, service, "accept", [&] { return h->accept(*r); }) != 0) {
       if (!r->closed) socket_close(r->fd);
       continue;
     }
@@ -342,13 +406,13 @@ void connect_step(SocketRecord& r) {
   if (error == EINPROGRESS || error == EALREADY) return;
   const ServiceHandlers* h = service_handlers(r.service);
   if (error != 0) {
-    if (h && h->connect_failed) h->connect_failed(r);
+    if (h && h->connect_failed) guarded(&r, r.service, "connect-failed", [&] { return h->connect_failed(r), 0; });
     else socket_close(r.fd);
     return;
   }
   r.state = sockstate::connected;
   r.last_active = server_now;
-  if (h && h->connect_done) h->connect_done(r);
+  if (h && h->connect_done) guarded(&r, r.service, "connect", [&] { return h->connect_done(r), 0; });
   if (!r.closed && !r.write_buf.empty()) write_step(r);
 }
 
@@ -356,10 +420,10 @@ void lookup_step(SocketRecord& r) {
   r.dispatch.lookup_ended = false;
   const ServiceHandlers* h = service_handlers(r.service);
   if (r.dispatch.lookup_ok) {
-    if (h && h->lookup_done) h->lookup_done(r);
+    if (h && h->lookup_done) guarded(&r, r.service, "lookup", [&] { return h->lookup_done(r), 0; });
     return;
   }
-  if (h && h->lookup_failed) h->lookup_failed(r);
+  if (h && h->lookup_failed) guarded(&r, r.service, "lookup-failed", [&] { return h->lookup_failed(r), 0; });
   else socket_close(r.fd);
 }
 
@@ -387,6 +451,39 @@ void deliver(SocketRecord& r, std::uint32_t ev) {
 }
 
 void free_released() { state().released.clear(); }
+
+// Runs the timers that are due; returns the milliseconds until the next one
+// (-1 = none).
+int run_timers() {
+  auto& d = state();
+  std::int64_t now = monotonic_ms(), next = -1;
+  std::vector<Dispatcher::TimerRef> due;
+  std::erase_if(d.timers, [&](const Dispatcher::TimerRef& t) {
+    SocketRecord* r = record_for(t.fd);
+    if (!r || r->id != t.id || r->dispatch.timer_due == 0) return true;
+    if (r->dispatch.timer_due <= now) {
+      due.push_back(t);
+      return true;
+    }
+    if (next < 0 || r->dispatch.timer_due < next) next = r->dispatch.timer_due;
+    return false;
+  });
+  for (const auto& t : due) {
+    SocketRecord* r = record_for(t.fd);
+    if (!r || r->id != t.id || r->dispatch.timer_due == 0) continue;
+    r->dispatch.timer_due = 0;
+    const ServiceHandlers* h = service_handlers(r->service);
+    if (h && h->timer && guarded(r, r->service, "timer", [&] { return h->timer(*r); }) != 0) {
+      if (!r->closed) socket_close(r->fd);
+      continue;
+    }
+    if (!r->closed && !r->write_buf.empty()) write_step(*r);
+    else close_when_done(*r);
+    if (!r->closed && r->dispatch.timer_due != 0 && (next < 0 || r->dispatch.timer_due < next))
+      next = r->dispatch.timer_due;  // set again by its own handler
+  }
+  return next < 0 ? -1 : static_cast<int>(std::max<std::int64_t>(0, next - monotonic_ms()));
+}
 
 }  // namespace
 
@@ -425,6 +522,7 @@ SocketRecord* record_create(int fd, int service, int st) {
   r->service = service;
   r->state = st;
   r->created = r->last_active = server_now;
+  r->id = ++d.last_id;
   r->dispatch.generation = ++d.generation;
   if (hooks.default_group) r->group_opts = hooks.default_group();
   bool bare = (service & kDatagram) != 0 || st == sockstate::listening;
@@ -444,6 +542,29 @@ SocketRecord* record_create(int fd, int service, int st) {
   d.table[static_cast<std::size_t>(fd)] = std::move(r);
   ++d.records;
   return d.table[static_cast<std::size_t>(fd)].get();
+}
+
+void record_set_peer(SocketRecord& record, std::uint32_t peer_nbo) {
+  record.peer_ip = peer_nbo;
+  record.peer_addr = dotted(peer_nbo);
+  if (record.dispatch.peer_counted || peer_nbo == 0) return;
+  ++state().peers[{record.service, peer_nbo}];
+  record.dispatch.peer_counted = true;
+}
+
+bool peer_may_connect(int service, std::uint32_t peer_nbo) {
+  if ((ntohl(peer_nbo) >> 24) == 127) return true;  // loopback: this machine's own programs
+  int limit = service_limit(service);
+  if (limit < 0) return true;
+  auto& peers = state().peers;
+  auto it = peers.find({service, peer_nbo});
+  return it == peers.end() || it->second < std::max(1, limit / 4);
+}
+
+void socket_timer(SocketRecord& record, int ms) {
+  bool listed = record.dispatch.timer_due != 0;
+  record.dispatch.timer_due = ms > 0 ? monotonic_ms() + ms : 0;
+  if (ms > 0 && !listed) state().timers.push_back({record.fd, record.id});
 }
 
 void record_lookup_complete(SocketRecord& record, bool ok) {
@@ -467,12 +588,17 @@ int record_close(int fd) {
   if (r->dispatch.watched) epoll_ctl(d.epoll_fd, EPOLL_CTL_DEL, fd, nullptr);
   if (r->state != sockstate::listening) {
     const ServiceHandlers* h = service_handlers(r->service);
-    if (h && h->release) h->release(*r);
+    if (h && h->release) guarded(r, r->service, "release", [&] { return h->release(*r), 0; });
   }
   if (int counted = r->dispatch.counted_service; counted != 0) {
     int& c = d.counts[counted];
     if (c > 0) --c;
     r->dispatch.counted_service = 0;
+  }
+  if (r->dispatch.peer_counted) {
+    auto it = d.peers.find({r->service, r->peer_ip});
+    if (it != d.peers.end() && --it->second <= 0) d.peers.erase(it);
+    r->dispatch.peer_counted = false;
   }
   r->file = CacheFile();
   r->send_file = CacheFile();
@@ -579,7 +705,12 @@ int listener_open(int port, int service, int protocol, int* descriptor_out) {
       ::close(fd);
       return 1;
     }
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
+    int bound;
+    {
+      BindingPrivileges root;  // the only step that may need root
+      bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
+    }
+    if (bound != 0) {
       std::string msg = strprintf("Bind Failed - is another server running on this port: %d", port);
       serious(msg, kLogUnbuffered);
       log_message(msg);
@@ -641,17 +772,20 @@ int listeners_open() {
   for (const auto& key : kListeners) {
     const ServiceHandlers* h = service_handlers(key.service);
     if (!h || !*key.enabled) continue;  // a service not built yet gets no listener
-    int result = h->open_sockets ? h->open_sockets() : listener_open(*key.port, key.service, 6);
+    int result = h->open_sockets ? guarded(nullptr, key.service, "open", h->open_sockets)
+                                 : listener_open(*key.port, key.service, 6);
     if (result != 0) return 1;
   }
   // Services of their own kind (the resolver, the multi-port relays) open
   // their sockets when they are registered.
   auto open_own = [](int service) {
     const ServiceHandlers* h = service_handlers(service);
-    return h && h->open_sockets ? h->open_sockets() : 0;
+    return h && h->open_sockets ? guarded(nullptr, service, "open", h->open_sockets) : 0;
   };
   if (open_own(svc::dns | kDatagram) != 0) return 1;
-  control_open();
+  // Without its control channel the suite could not be steered, and a
+  // squatter on the path would get what local tools send: no start.
+  if (control_open() != 0) return 1;
   return open_own(svc::multiport) != 0 ? 1 : 0;
 }
 
@@ -681,6 +815,7 @@ void dispatcher(int timeout_ms) {
   free_released();
   if (!ensure_epoll()) return;
   progress_code = 140100;
+  const int timer_ms = run_timers();  // first, so that what they queue is watched
   // Lookups that ended since the last pass, and the interest of every record.
   bool lookups = false;
   for (std::size_t fd = 0; fd < d.table.size(); ++fd) {
@@ -694,6 +829,7 @@ void dispatcher(int timeout_ms) {
     sync_interest(*r);
   }
   if (lookups) timeout_ms = 0;
+  if (timer_ms >= 0 && (timeout_ms < 0 || timer_ms < timeout_ms)) timeout_ms = timer_ms;
   int n = epoll_wait(d.epoll_fd, d.events.data(), static_cast<int>(d.events.size()), timeout_ms);
   for (int i = 0; i < n; ++i) {
     const epoll_event& e = d.events[static_cast<std::size_t>(i)];
@@ -714,9 +850,13 @@ void sockets_check_timeouts() {
     SocketRecord* r = t[fd].get();
     if (!r || is_datagram(*r) || is_listener(*r)) continue;
     const ServiceHandlers* h = service_handlers(r->service);
-    int limit = h && h->idle_timeout ? h->idle_timeout() : default_idle_timeout(r->service);
-    if (limit <= 0 || server_now - r->last_active <= limit) continue;
-    if (h && h->timed_out) h->timed_out(*r);
+    int idle = default_idle_timeout(r->service);
+    if (h && h->idle_timeout) idle = guarded(nullptr, r->service, "idle time-out", h->idle_timeout, idle);
+    int session = r->dispatch.accepted ? config.sock_session_max : 0;
+    if (h && h->session_limit) session = guarded(nullptr, r->service, "session limit", h->session_limit, session);
+    bool idle_out = idle > 0 && server_now - r->last_active > idle;
+    if (!idle_out && (session <= 0 || server_now - r->created <= session)) continue;
+    if (h && h->timed_out) guarded(r, r->service, "time-out", [&] { return h->timed_out(*r), 0; });
     else socket_close(r->fd);
   }
 }

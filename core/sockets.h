@@ -101,11 +101,17 @@ struct SessionData {
 
 struct SocketRecord {
   int fd = -1;
+  // Never reused: tells this connection from every other, also from a later
+  // one on the same descriptor (owner of marks such as a mailbox's in-use).
+  std::uint64_t id = 0;
   int service = 0;
   int state = 0;
   std::uint32_t flags = 0;
   IoBuffer read_buf;
   IoBuffer write_buf;
+  // The idle time-out runs from here: the last send, or the last receive
+  // that completed a line for the command protocols (SMTP, POP3, IMAP, NNTP,
+  // web), so a client that trickles bytes cannot hold its slot.
   std::time_t last_active = 0;
   std::time_t created = 0;
   std::string peer_addr;       // dotted form, set on accept
@@ -134,6 +140,9 @@ struct SocketRecord {
     std::uint32_t events = 0;      // the readiness interest registered
     std::uint32_t generation = 0;  // tells a reused descriptor from its predecessor
     int counted_service = 0;       // the counter this record raised (0 = none)
+    bool accepted = false;         // made by accept: sock.session.max applies
+    bool peer_counted = false;     // counted in its peer's share (record_set_peer)
+    std::int64_t timer_due = 0;    // socket_timer: monotonic ms, 0 = none
     bool peer_eof = false;         // the peer finished sending: no more reads
     bool lookup_ended = false;     // record_lookup_complete() was called ...
     bool lookup_ok = false;        // ... with this result
@@ -142,7 +151,9 @@ struct SocketRecord {
 };
 
 // What a service plugs in. Handlers return 0 to keep the connection and
-// non-zero to have it closed; they may also close it themselves.
+// non-zero to have it closed; they may also close it themselves. A handler
+// that throws has its connection closed (datagram and listening sockets
+// stay) and one line written to the error log; the suite goes on.
 struct ServiceHandlers {
   // A new connection of this service was accepted (peer_addr is set).
   std::function<int(SocketRecord&)> accept{};
@@ -162,6 +173,8 @@ struct ServiceHandlers {
   std::function<void(SocketRecord&)> lookup_done{};
   // The per-service release when the record closes (files, locks, counts).
   std::function<void(SocketRecord&)> release{};
+  // The time set with socket_timer() has come. Non-zero: close.
+  std::function<int(SocketRecord&)> timer{};
   // Seconds of inactivity after which the record is closed (0 = never).
   // Unset: the service's sock.timeout key (120 s for the HTTP proxy).
   std::function<int()> idle_timeout{};
@@ -169,6 +182,9 @@ struct ServiceHandlers {
   std::function<void(SocketRecord&)> timed_out{};
   // Simultaneous connections allowed. Unset: the service's sock.max key.
   std::function<int()> max_connections{};
+  // Seconds an accepted connection may last in all (0 = no limit). Unset:
+  // sock.session.max.
+  std::function<int()> session_limit{};
   // Set by services that open their own sockets (several listeners, datagram
   // sockets): listeners_open calls it in the service's place in the order
   // instead of opening the standard listener. 0 = done.
@@ -192,9 +208,13 @@ void service_switch(int service, bool on);
 
 // One pass: wait up to `timeout_ms` for readiness and deliver every event.
 void dispatcher(int timeout_ms);
-// Closes every connected record idle for longer than its service's time-out;
-// run once per main-loop tick.
+// Closes every connected record idle for longer than its service's time-out,
+// and every accepted one older than its session limit; run once per tick.
 void sockets_check_timeouts();
+// Calls the service's `timer` handler once `ms` milliseconds have passed,
+// without holding up anything else (a later call replaces the time; 0
+// cancels). The dispatcher's wait ends in time for it.
+void socket_timer(SocketRecord& record, int ms);
 
 SocketRecord* record_for(int fd);
 // Makes the record for a descriptor (with I/O buffers unless a datagram or
@@ -204,6 +224,13 @@ SocketRecord* record_create(int fd, int service, int state);
 // The resolver's end of a host lookup for a record in state 80: the
 // dispatcher calls the service's lookup_done or lookup_failed on its next pass.
 void record_lookup_complete(SocketRecord& record, bool ok);
+// Sets the peer of an accepted record and counts the record in the peer's
+// share of its service (see peer_may_connect).
+void record_set_peer(SocketRecord& record, std::uint32_t peer_nbo);
+// One peer address may hold at most a quarter of a service's connection
+// slots (at least one); loopback peers are not limited. True when `peer`
+// may open one more connection of `service`; accept closes it otherwise.
+bool peer_may_connect(int service, std::uint32_t peer_nbo);
 // Sends from the front of write_buf; the unsent rest stays at its front.
 // Returns bytes sent (0 when the socket is full) or -1 on a real error.
 long socket_send(SocketRecord& record);

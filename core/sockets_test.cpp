@@ -11,6 +11,7 @@
 
 #include <chrono>
 #include <cstdlib>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -80,6 +81,13 @@ struct Client {
   }
   void send(std::string_view text) { ASSERT_EQ(::send(fd, text.data(), text.size(), 0), static_cast<ssize_t>(text.size())); }
 };
+
+// The first accepted connection's record.
+SocketRecord* first_connection() {
+  for (int fd = 0; fd < 4096; ++fd)
+    if (SocketRecord* x = record_for(fd); x && x->state == sockstate::initial) return x;
+  return nullptr;
+}
 
 int bound_port(int fd) {
   sockaddr_in a{};
@@ -210,6 +218,37 @@ TEST_F(DispatcherTest, IdleConnectionsAreClosedEveryTick) {
   ASSERT_TRUE(c.wait_eof());
 }
 
+TEST_F(DispatcherTest, ABusySessionStillEndsAtItsLimit) {
+  Client c(port);
+  ASSERT_TRUE(c.wait_for("hello"));
+  SocketRecord* r = first_connection();
+  ASSERT_NE(r, nullptr);
+  r->created = server_now - 3601;  // an hour old, active just now
+  config.sock_session_max = 0;  // no limit
+  sockets_check_timeouts();
+  EXPECT_EQ(connection_count(svc::smtp), 1);
+  config.sock_session_max = 3600;
+  sockets_check_timeouts();
+  EXPECT_EQ(connection_count(svc::smtp), 0);
+}
+
+TEST_F(DispatcherTest, AHandlerThatThrowsLosesItsConnectionOnly) {
+  ServiceHandlers h = echo_handlers();
+  h.read = [echo = h.read](SocketRecord& r, long n) -> int {
+    if (r.read_buf.view().starts_with("boom")) throw std::runtime_error("boom");
+    return echo(r, n);
+  };
+  register_service(svc::smtp, h);
+  Client a(port), b(port);
+  ASSERT_TRUE(a.wait_for("hello"));
+  ASSERT_TRUE(b.wait_for("hello"));
+  a.send("boom\n");
+  ASSERT_TRUE(a.wait_eof());
+  EXPECT_EQ(released, 1);
+  b.send("still here\n");
+  ASSERT_TRUE(b.wait_for("echo still here\n"));
+}
+
 TEST_F(DispatcherTest, AFullInputBufferIsNeverReadInto) {
   consume = false;
   Client c(port);
@@ -256,9 +295,7 @@ TEST_F(DispatcherTest, PartialSendsKeepTheRestInOrder) {
 TEST_F(DispatcherTest, SocketSendMovesTheUnsentRestToTheFront) {
   Client c(port);  // never reads, so the socket fills up
   ASSERT_TRUE(c.wait_for("hello"));
-  SocketRecord* r = nullptr;
-  for (int fd = 0; fd < 4096 && !r; ++fd)
-    if (SocketRecord* x = record_for(fd); x && x->state == sockstate::initial) r = x;
+  SocketRecord* r = first_connection();
   ASSERT_NE(r, nullptr);
   auto byte_at = [](std::size_t k) { return static_cast<char>('a' + k % 23); };
   std::size_t appended = 0, sent = 0;
@@ -416,6 +453,23 @@ TEST(ManyConnections, TwoThousandIdleClientsAndTheControlChannelAnswers) {
   control_remove();
   EXPECT_EQ(::access(paths.control.c_str(), F_OK), -1);
   ::rmdir(dir);
+}
+
+TEST(PeerShare, OneAddressHoldsAQuarterOfTheSlotsAndLoopbackAny) {
+  register_service(svc::nntp, {.max_connections = [] { return 8; }});
+  const std::uint32_t stranger = inet_addr("192.0.2.7");
+  int fds[2];
+  for (int& fd : fds) {
+    EXPECT_TRUE(peer_may_connect(svc::nntp, stranger));
+    fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    record_set_peer(*record_create(fd, svc::nntp, sockstate::initial), stranger);
+  }
+  EXPECT_FALSE(peer_may_connect(svc::nntp, stranger));
+  EXPECT_TRUE(peer_may_connect(svc::nntp, inet_addr("192.0.2.8")));
+  EXPECT_TRUE(peer_may_connect(svc::nntp, inet_addr("127.0.0.9")));
+  socket_close(fds[0]);
+  EXPECT_TRUE(peer_may_connect(svc::nntp, stranger));
+  sockets_close_all();
 }
 
 TEST(Telnet, NegotiationIsAnsweredAndStripped) {

@@ -1,23 +1,28 @@
 // velmorctl: sends one command to a running suite over its control channel
 // and prints the replies.
 //
-//   velmorctl [--root DIR | --control PATH] COMMAND...
+//   velmorctl [--root DIR] [--control PATH] COMMAND...
 //
 // The words of COMMAND are joined with blanks. The reply socket is bound to
 // a fresh abstract address chosen by the kernel, so nothing is left behind
-// in the file system. Exit status: 0 done; 1 the suite did not answer a
-// command that has a reply (or could not be reached); 2 usage; 3 a password
-// change was refused. "lookup NAME" is answered when the lookup ends, which
-// may take a while: velmorctl waits as long as the suite still answers
-// "test" in between.
+// in the file system. A socket owned by anyone but root, the suite's user
+// (server.user in DIR/config/master) or the caller is refused: a password
+// change must not reach a squatter. Exit status: 0 done; 1 the suite did not
+// answer a command that has a reply (or could not be reached, or the socket
+// was refused); 2 usage; 3 a password change was refused. "lookup NAME" is
+// answered when the lookup ends, which may take a while: velmorctl waits as
+// long as the suite still answers "test" in between.
 #include <poll.h>
+#include <pwd.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <fstream>
 #include <string>
 #include <string_view>
 
@@ -39,15 +44,46 @@ bool iequals_prefix(std::string_view text, std::string_view prefix, bool whole) 
 
 int usage() {
   std::fprintf(stderr,
-               "usage: velmorctl [--root DIR | --control PATH] COMMAND...\n"
+               "usage: velmorctl [--root DIR] [--control PATH] COMMAND...\n"
                "  e.g. velmorctl --root /srv/velmor status\n");
   return 2;
+}
+
+// The user the suite runs as: server.user of the installation's master
+// file, when it is set and readable. -1 when unknown.
+long suite_uid(const std::string& root) {
+  std::ifstream master(root + "/config/master");
+  std::string line;
+  while (std::getline(master, line)) {
+    if (!iequals_prefix(line, "%server.user:", false)) continue;
+    std::string name = line.substr(13);
+    name.erase(0, name.find_first_not_of(" \t"));
+    name.erase(name.find_last_not_of(" \t\r") + 1);
+    if (name.empty()) return -1;
+    const passwd* pw = getpwnam(name.c_str());
+    return pw ? static_cast<long>(pw->pw_uid) : -1;
+  }
+  return -1;
+}
+
+// Whether the socket at `path` may be trusted with a command.
+bool trusted_socket(const std::string& path, const std::string& root) {
+  struct stat st {};
+  if (lstat(path.c_str(), &st) != 0) return true;  // nobody there: sending fails and says so
+  if (!S_ISSOCK(st.st_mode)) {
+    std::fprintf(stderr, "velmorctl: %s is not a socket\n", path.c_str());
+    return false;
+  }
+  if (st.st_uid == 0 || st.st_uid == getuid() || static_cast<long>(st.st_uid) == suite_uid(root)) return true;
+  std::fprintf(stderr, "velmorctl: refusing %s: its owner (uid %ld) is neither root nor the suite's user\n",
+               path.c_str(), static_cast<long>(st.st_uid));
+  return false;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  std::string control = "/tmp/velmor";
+  std::string root = "/usr/local/velmor", control;
   int i = 1;
   for (; i < argc && argv[i][0] == '-'; ++i) {
     std::string_view opt = argv[i];
@@ -56,10 +92,11 @@ int main(int argc, char** argv) {
       return 0;
     }
     if (i + 1 >= argc) return usage();
-    if (opt == "--root") control = std::string(argv[++i]) + "/run/control";
+    if (opt == "--root") root = argv[++i];
     else if (opt == "--control") control = argv[++i];
     else return usage();
   }
+  if (control.empty()) control = root + "/run/control";
   std::string command;
   for (; i < argc; ++i) {
     if (!command.empty()) command += ' ';
@@ -84,6 +121,7 @@ int main(int argc, char** argv) {
     return 1;
   }
   std::memcpy(to.sun_path, control.data(), control.size());
+  if (!trusted_socket(control, root)) return 1;
 
   int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
   sockaddr_un self{};

@@ -757,17 +757,17 @@ UniqueFd mailbox_open(const Mailbox& box) {
 
 void mailbox_cache_clear() { g_boxes.clear(); }
 
-bool mailbox_take(Mailbox& box, int owner) {
+bool mailbox_take(Mailbox& box, std::uint64_t owner) {
   if (box.flags & boxflag::in_use) return box.in_use_by == owner;
   box.flags |= boxflag::in_use;
   box.in_use_by = owner;
   return true;
 }
 
-void mailbox_release(Mailbox& box, int owner) {
+void mailbox_release(Mailbox& box, std::uint64_t owner) {
   if ((box.flags & boxflag::in_use) && box.in_use_by == owner) {
     box.flags &= ~boxflag::in_use;
-    box.in_use_by = -1;
+    box.in_use_by = 0;
   }
 }
 

@@ -66,7 +66,7 @@ struct Mailbox {
   // reached without following links (core/safedir.h).
   std::string home;
   std::uint32_t flags = 0;
-  int in_use_by = -1;  // descriptor (or other session id) holding the in-use mark
+  std::uint64_t in_use_by = 0;  // SocketRecord::id of the in-use mark's holder; 0 = none
   int count = 0, unseen = 0;
   std::uint32_t next_uid = 1;
   bool changed = false;
@@ -95,9 +95,11 @@ Mailbox* mailbox_lookup(const std::string& path);
 // The mailbox file opened for reading the safe way; an empty descriptor
 // when it is missing or refused.
 UniqueFd mailbox_open(const Mailbox& box);
-// The in-use mark shared by POP3, IMAP and web mail: true when taken.
-bool mailbox_take(Mailbox& box, int owner);
-void mailbox_release(Mailbox& box, int owner);
+// The in-use mark shared by POP3, IMAP and web mail: true when taken (or
+// already held by `owner`). The owner is a connection's never-reused id, so
+// a mark can never pass to a later connection on the same descriptor.
+bool mailbox_take(Mailbox& box, std::uint64_t owner);
+void mailbox_release(Mailbox& box, std::uint64_t owner);
 // Removes the deleted messages, rewriting the mailbox through a temporary
 // file (made O_EXCL beside it, synced, given the old owner through its
 // descriptor) and a rename. 0 or an errno value (the old mailbox is then

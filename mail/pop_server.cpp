@@ -35,6 +35,11 @@ constexpr int closing = 999;  // send, then close
 
 constexpr std::size_t kNameLimit = 64;
 constexpr std::size_t kPasswordLimit = 64;
+// A refused password is answered this much later (other clients are served
+// meanwhile), and the connection ends after this many refusals, so guessing
+// is slow.
+constexpr int kFailedLoginDelayMs = 1000;
+constexpr int kFailedLoginLimit = 3;
 // Commands are not run while the output buffer has less room than the
 // longest reply, so pipelined commands can never overrun it.
 constexpr std::size_t kReplyRoom = 600;
@@ -50,6 +55,8 @@ struct PopSession : SessionData {
   char phase = 'd';  // 'd' authorization, 'e' user name given, 'f' transaction
   std::string user;
   bool user_ok = false;
+  int failed_logins = 0;
+  bool answer_pending = false;  // a refused login's reply waits for its timer
   Mailbox* box = nullptr;
   UniqueFd file;
   // This session's deletions, by message number - 1; nobody else sees them
@@ -112,8 +119,7 @@ std::optional<std::size_t> message_number(const PopSession& s, std::string_view 
 }
 
 void drop_mailbox(SocketRecord& r, PopSession& s) {
-  if (s.box && s.box->changed) mailbox_overview_write(*s.box);  // the seen marks
-  if (s.box) mailbox_release(*s.box, r.fd);
+  if (s.box) mailbox_release(*s.box, r.id);
   s.box = nullptr;
   s.file.close();
   s.deleted.clear();
@@ -140,9 +146,16 @@ void pass(SocketRecord& r, PopSession& s, std::string_view password, bool& disca
   }
   const UserRecord* user = s.user_ok ? user_find(s.user) : nullptr;
   if (!user || password.size() > kPasswordLimit || user_check_password(user->login, password) != 0) {
-    log_message("Login failed for:", s.user.substr(0, kNameLimit), logfac::pop);
-    reply(r, "-ERR Invalid username or password, please try again\r\n");
+    // Logged whatever store.state says; the password never is.
+    std::string name = s.user.substr(0, kNameLimit);
+    for (char& c : name) {
+      if (static_cast<unsigned char>(c) < ' ' || c == 0x7f) c = '?';
+    }
+    log_write("POP: Login failed for: " + name + " from " + r.peer_addr, logchan::main, kLogUnbuffered);
     s.phase = 'd';
+    ++s.failed_logins;
+    s.answer_pending = true;
+    socket_timer(r, kFailedLoginDelayMs);
     return;
   }
   auto group = user_group(user->login);
@@ -159,7 +172,7 @@ void pass(SocketRecord& r, PopSession& s, std::string_view password, bool& disca
     reply(r, "+OK 0 messages waiting\r\n");
     return;
   }
-  if (!mailbox_take(*box, r.fd)) {
+  if (!mailbox_take(*box, r.id)) {
     s.phase = 'd';
     reply(r, "-ERR mailbox already in use: another POP or IMAP session is currently active\r\n");
     discard = true;
@@ -222,8 +235,7 @@ void retr(SocketRecord& r, PopSession& s, std::string_view arg) {
   s.range_at = 0;
   s.trailer = missing_terminator(tail);
   r.state = popstate::message;
-  // Retrieved is read: a sender who asked gets the receipt, once.
-  mailbox_mark_seen(*s.box, *s.index[*i], s.offsets[*i], r.user_name);
+  // A download is not a reading: no seen mark, and no read receipt.
 }
 
 bool starts_status(std::string_view line) {
@@ -351,8 +363,13 @@ void command(SocketRecord& r, PopSession& s, std::string_view line, bool& discar
     return;
   }
   auto is = [&](std::string_view name) { return str_iequals(verb, name); };
+  if (s.phase == 'f' && (is("USER") || is("PASS"))) {
+    // One login per session: the mailbox taken stays the only one.
+    reply(r, "-ERR Invalid command; valid commands:  STAT, LIST, UIDL, TOP, RETR, DELE, RSET, NOOP, QUIT\r\n");
+    discard = true;
+    return;
+  }
   if (is("USER")) {
-    if (s.phase == 'f') drop_mailbox(r, s);
     arg = trim_blanks(arg);
     s.user_ok = !arg.empty() && arg.size() <= kNameLimit;
     s.user.assign(arg.substr(0, kNameLimit));
@@ -447,7 +464,8 @@ void overlong(PopSession& s, SocketRecord& r) {
 // Runs the complete command lines in the input until one starts a stream
 // or the output buffer could not take another reply.
 void process(SocketRecord& r, PopSession& s) {
-  while (!s.streaming() && r.state != popstate::closing && r.write_buf.room() >= kReplyRoom) {
+  while (!s.streaming() && !s.answer_pending && r.state != popstate::closing &&
+         r.write_buf.room() >= kReplyRoom) {
     std::string_view in = r.read_buf.view();
     if (s.last_cr && !in.empty()) {
       s.last_cr = false;
@@ -576,7 +594,7 @@ int pump(SocketRecord& r) {
 }  // namespace
 
 int pop_accept(SocketRecord& r) {
-  if (!address_list_match(config.pop_allow, r.peer_ip) && address_list_match(config.pop_block, r.peer_ip)) {
+  if (peer_rule(r.peer_ip, config.pop_allow, config.pop_block) == PeerRule::blocked) {
     socket_send(r, "-ERR Connection refused\r\n");
     return 1;
   }
@@ -592,7 +610,7 @@ int pop_accept(SocketRecord& r) {
 int pop_read(SocketRecord& r, long) {
   if (!r.session) return 1;
   PopSession& s = session(r);
-  if (s.streaming() || !r.write_buf.empty()) {
+  if (s.streaming() || !r.write_buf.empty() || s.answer_pending) {
     // Commands wait until the current reply is out; the input stays.
     if (r.read_buf.room() == 0 && r.read_buf.view().find_first_of("\r\n") == std::string_view::npos) {
       overlong(s, r);
@@ -609,6 +627,16 @@ int pop_write(SocketRecord& r) {
   return pump(r);
 }
 
+int pop_timer(SocketRecord& r) {
+  if (!r.session) return 1;
+  PopSession& s = session(r);
+  if (!s.answer_pending) return 0;
+  s.answer_pending = false;
+  reply(r, "-ERR Invalid username or password, please try again\r\n");
+  if (s.failed_logins >= kFailedLoginLimit) r.state = popstate::closing;
+  return pump(r);
+}
+
 void pop_release(SocketRecord& r) {
   if (!r.session) return;
   PopSession& s = session(r);
@@ -621,6 +649,7 @@ void pop_server_init() {
   h.accept = pop_accept;
   h.read = pop_read;
   h.write = pop_write;
+  h.timer = pop_timer;
   h.release = pop_release;
   register_service(svc::pop, std::move(h));
 }

@@ -15,6 +15,7 @@ void pop_server_init();
 int pop_accept(SocketRecord& record);
 int pop_read(SocketRecord& record, long n);
 int pop_write(SocketRecord& record);
+int pop_timer(SocketRecord& record);
 void pop_release(SocketRecord& record);
 
 }  // namespace velmor

@@ -149,6 +149,26 @@ class ControlSocketLifetimeTest(unittest.TestCase):
         self.assertEqual(suite.stop(), 0)
         self.assertFalse(os.path.exists(path))
 
+    def test_a_path_someone_holds_stops_start_up_and_velmorctl_refuses_a_strangers_socket(self):
+        suite = Suite()
+        self.addCleanup(suite.cleanup)
+        path = suite.path('run/control')
+        with socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as squatter:
+            squatter.bind(path)  # alive, so not taken for a crashed suite's
+            suite.spawn()
+            self.assertEqual(suite.wait(timeout=10), 1)
+            self.assertIn('Socket initialisation failed', suite.output())
+            if os.geteuid() != 0:
+                self.skipTest('making a socket of another user needs root')
+            os.chown(path, 54321, 54321)
+            r = subprocess.run([VELMORCTL_BIN, '--root', suite.root, 'change', 'pass', 'demo', 'old', 'new'],
+                               capture_output=True, timeout=10)
+            self.assertEqual(r.returncode, 1)
+            self.assertIn(b'neither root nor the suite', r.stderr)
+            squatter.setblocking(False)
+            with self.assertRaises(BlockingIOError):
+                squatter.recv(100)
+
 
 if __name__ == '__main__':
     unittest.main()

@@ -3,6 +3,7 @@ smtplib in, poplib, fetchmail and curl out."""
 
 import os
 import poplib
+import select
 import shutil
 import signal
 import smtplib
@@ -12,7 +13,7 @@ import tempfile
 import time
 import unittest
 
-from harness import Suite, VELMOR_BIN
+from harness import Suite, VELMOR_BIN, set_keys
 
 DOMAIN = 'example.test'
 PASSWORD = 'sesame-42'
@@ -40,11 +41,16 @@ def split_message(data):
     return header.split(b'\r\n'), body
 
 
+BAD_LOGIN = b'-ERR Invalid username or password, please try again\r\n'
+IN_SESSION = b'-ERR Invalid command; valid commands:  STAT, LIST, UIDL, TOP, RETR, DELE, RSET, NOOP, QUIT\r\n'
+
+
 class MailSuite(unittest.TestCase):
     """A suite with the user alice (full name Alice Liddell) and her home."""
+    config = {}
 
     def setUp(self):
-        self.suite = Suite(config={'mail.domains': DOMAIN, 'pop.sock.timeout': '30'})
+        self.suite = Suite(config=dict({'mail.domains': DOMAIN, 'pop.sock.timeout': '30'}, **self.config))
         self.addCleanup(self.suite.cleanup)
         self.home = self.suite.path('home/alice')
         Suite._run([VELMOR_BIN, '--root', self.suite.root, '--adduser', 'alice', '--password', PASSWORD,
@@ -84,6 +90,22 @@ class MailSuite(unittest.TestCase):
         p.user(user)
         p.pass_(password)
         return p
+
+    def pop_when_free(self):
+        """Logs alice in as soon as a closed session has let go of her mailbox."""
+        deadline = time.monotonic() + 10
+        while True:
+            p = poplib.POP3('127.0.0.1', self.suite.port('pop'), timeout=10)
+            try:
+                p.user('alice')
+                p.pass_(PASSWORD)
+                self.addCleanup(p.close)
+                return p
+            except poplib.error_proto:
+                p.close()
+                if time.monotonic() > deadline:
+                    raise
+                time.sleep(0.05)
 
     def raw(self):
         """A plain connection: send lines, read reply lines."""
@@ -154,23 +176,23 @@ class RoundTrip(MailSuite):
         self.assertEqual(str(refused.exception),
                          str(b'-ERR mailbox already in use: another POP or IMAP session is currently active'))
         first.close()  # gone without QUIT
-        deadline = time.monotonic() + 10
-        while True:
-            p = poplib.POP3('127.0.0.1', self.suite.port('pop'), timeout=10)
-            try:
-                p.user('alice')
-                p.pass_(PASSWORD)
-                again = p
-                self.addCleanup(p.close)
-                break
-            except poplib.error_proto:
-                p.close()
-                if time.monotonic() > deadline:
-                    raise
-                time.sleep(0.05)
+        again = self.pop_when_free()
         self.assertEqual(again.stat()[0], 2)
         again.quit()
         self.assertEqual(self.delivered(), 2)
+
+    def test_one_login_per_session(self):
+        self.send(make_message('mine'))
+        s, f, talk = self.raw()
+        talk(b'USER alice')
+        self.assertEqual(talk(b'PASS ' + PASSWORD.encode()), [b'+OK 1 messages waiting for alice\r\n'])
+        # Neither a second PASS nor another user can take over the session.
+        self.assertEqual(talk(b'PASS ' + PASSWORD.encode()), [IN_SESSION])
+        self.assertEqual(talk(b'USER demo'), [IN_SESSION])
+        self.assertEqual(talk(b'STAT')[0][:6], b'+OK 1 ')
+        f.close()
+        s.close()
+        self.assertEqual(self.pop_when_free().stat()[0], 1)  # the mark went with the connection
 
     def test_mail_arriving_during_a_session_joins_at_the_end(self):
         self.send(make_message('early'))
@@ -194,12 +216,14 @@ class BadInput(MailSuite):
         self.assertEqual(talk(b'PASS x'), [invalid_first])  # PASS without USER
         self.assertEqual(talk(b'USER alice'), [b'+OK please send PASS command\r\n'])
         self.assertEqual(talk(b'LIST'), [b'-ERR Invalid command; valid commands:  USER, PASS, QUIT\r\n'])
-        bad = [b'-ERR Invalid username or password, please try again\r\n']
+        bad = [BAD_LOGIN]
         self.assertEqual(talk(b'USER alice') + talk(b'PASS wrong'), [b'+OK please send PASS command\r\n'] + bad)
         self.assertEqual(talk(b'USER nobody-here') + talk(b'PASS ' + PASSWORD.encode()),
                          [b'+OK please send PASS command\r\n'] + bad)
         self.assertEqual(talk(b'USER ' + b'a' * 200) + talk(b'PASS ' + PASSWORD.encode()),
                          [b'+OK please send PASS command\r\n'] + bad)
+        self.assertEqual(f.readline(), b'')  # the third failure ends the connection
+        s, f, talk = self.raw()
         self.assertEqual(talk(b'X' * 1000), [b'-ERR Bad command - too long\r\n'])
         self.assertEqual(talk(b'CAPA'), [b'-ERR Unknown command: CAPA\r\n'])
         self.assertEqual(talk(b'NOOP'), [b'+OK\r\n'])
@@ -248,9 +272,46 @@ class BadInput(MailSuite):
         self.assertTrue(data.endswith(b'shutdown (5 messages left)\r\n'))
 
 
+class PasswordGuessing(MailSuite):
+    config = {'store.state': '0'}
+
+    def test_failures_are_answered_late_logged_and_the_third_ends_the_connection(self):
+        s, f, talk = self.raw()
+        start = time.monotonic()
+        talk(b'USER alice')
+        s.sendall(b'PASS guess-1\r\n')
+        # While that answer waits, another client is served.
+        _, _, other = self.raw()
+        self.assertEqual(other(b'NOOP'), [b'+OK\r\n'])
+        self.assertEqual(select.select([s], [], [], 0)[0], [])  # still waiting
+        self.assertEqual(f.readline(), BAD_LOGIN)
+        self.assertEqual(talk(b'USER alice') + talk(b'PASS guess-2'), [b'+OK please send PASS command\r\n', BAD_LOGIN])
+        self.assertEqual(talk(b'USER bert') + talk(b'PASS guess-3'), [b'+OK please send PASS command\r\n', BAD_LOGIN])
+        self.assertEqual(f.readline(), b'')
+        self.assertGreaterEqual(time.monotonic() - start, 2.9)  # a second per failure
+        log = self.suite.log('main')
+        self.assertEqual(log.count('Login failed for: alice from 127.0.0.1'), 2, log)
+        self.assertIn('Login failed for: bert from 127.0.0.1', log)
+        self.assertNotIn('guess-', log)
+
+
+class PeerLists(unittest.TestCase):
+    def test_a_blocked_peer_is_refused_unless_allowed(self):
+        suite = Suite(config={'pop.block': '127.0.0.0/8'})
+        self.addCleanup(suite.cleanup)
+        suite.start()
+        with socket.create_connection(('127.0.0.1', suite.port('pop')), timeout=10) as c:
+            self.assertEqual(c.makefile('rb').read(), b'-ERR Connection refused\r\n')
+        set_keys(suite.path('config/master'), {'pop.allow': '127.0.0.1'})
+        suite.ctl('reload config')
+        suite.ctl('test')  # requests are served in order: the reload is done
+        self.assertTrue(poplib.POP3('127.0.0.1', suite.port('pop'), timeout=10).quit().startswith(b'+OK '))
+
+
 class OtherClients(MailSuite):
     def test_fetchmail_and_curl(self):
-        self.send(make_message('for fetchmail'), make_message('second for fetchmail'))
+        # Copying a message is not reading it: no read receipt goes out.
+        self.send(make_message('for fetchmail', extra=b'X-Read-Receipt: yes\r\n'), make_message('second for fetchmail'))
         port = str(self.suite.port('pop'))
         url = 'pop3://alice:%s@127.0.0.1:%s' % (PASSWORD, port)
         listing = subprocess.run(['curl', '-sS', '--max-time', '10', url + '/'], capture_output=True, timeout=20)
@@ -283,6 +344,8 @@ class OtherClients(MailSuite):
         self.assertIn(b'Subject: second for fetchmail', got)
         # fetchmail hands the MDA the message with its dots unstuffed.
         self.assertIn(b'\n.\nFrom here on the body goes on\n', got.replace(b'\r\n', b'\n'))
+        for queue in ('mail/in', 'mail/out'):
+            self.assertEqual([n for n in os.listdir(self.suite.path(queue)) if not n.startswith('.')], [], queue)
 
 
 class Faults(MailSuite):

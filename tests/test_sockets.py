@@ -65,6 +65,23 @@ class IdleTimeoutTest(SmtpSuiteTestCase):
         self.assertLess(time.monotonic() - start, 5)
         c.close()
 
+    def test_a_client_that_trickles_bytes_is_dropped_too(self):
+        c = connect(self.suite.port('smtp'))
+        self.addCleanup(c.close)
+        self.assertTrue(greeting(c, 5).startswith('220 '))
+        c.settimeout(0.3)
+        deadline = time.monotonic() + 10
+        try:
+            while True:  # a byte every 0.3 s, never a whole line
+                self.assertLess(time.monotonic(), deadline, 'a client sending single bytes kept its slot')
+                c.send(b'N')
+                try:
+                    if c.recv(100) == b'':
+                        break
+                except socket.timeout:
+                    pass
+        except ConnectionError:
+            pass  # reset by the suite
 
 class ManyIdleConnectionsTest(SmtpSuiteTestCase):
     config = {'smtp.sock.max': '3000', 'smtp.sock.timeout': '600'}

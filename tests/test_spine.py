@@ -201,7 +201,7 @@ class Init(unittest.TestCase):
         for d in ('logs', 'tmp', 'run', 'mail/in', 'mail/out', 'mail/odd', 'home'):
             self.assertTrue(os.path.isdir(os.path.join(self.root, d)), d)
         keys = self.master()
-        self.assertEqual(len(keys), 231)
+        self.assertEqual(len(keys), 233)
         self.assertEqual([keys[k] for k in ('smtp.sock.port', 'pop.sock.port', 'imap.sock.port', 'nntp.sock.port',
                                             'web.sock.port', 'proxy.http.sock.port')],
                          ['2525', '1110', '1143', '1119', '8000', '8080'])
@@ -210,7 +210,7 @@ class Init(unittest.TestCase):
         self.assertEqual(keys['mail.domains'], keys['server.name'] + ', localhost')
         self.assertEqual(keys['sock.buffer'], '16384')
         with open(os.path.join(self.root, 'config/templates/master')) as f:
-            self.assertEqual(f.read().count('\n%'), 231)
+            self.assertEqual(f.read().count('\n%'), 233)
 
         path = os.path.join(self.root, 'config/mimemap')
         with open(path, 'w') as f:
