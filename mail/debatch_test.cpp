@@ -131,5 +131,57 @@ TEST_F(DebatchTest, AFileWithoutRecipientsOrBodyGoesToOddments) {
   EXPECT_TRUE(folder_names(root + "/in", true).empty());
 }
 
+TEST_F(DebatchTest, FetchedMailGoesByTheListedHeaderAndOutwardUnderTheForcedSender) {
+  config.pop_headers = "X-Envelope-To, Delivered-To";
+  config.mail_from_force = "relay@site.example";
+  const std::string fetched = "POP3 MAIL FROM:<x@far.example>\r\nRCPT TO:<bob@site.example>\r\nDATA\r\n";
+  write_file(in("1"), fetched + "Delivered-To: Ann <ann@site.example>\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
+  debatch_file(in("1"));
+  EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("Subject: s"), std::string::npos);
+  EXPECT_EQ(read_file(root + "/home/bob/mail/inbox"), "");
+  // No listed header: the envelope decides; outward the sender is forced.
+  write_file(in("2"), fetched.substr(0, 35) + "RCPT TO:<b@far.example>\r\n" + kMessage);
+  debatch_file(in("2"));
+  std::vector<std::string> out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 1u);
+  EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<relay@site.example>\r\nRCPT TO:<b@far.example>\r\n") + kMessage);
+}
+
+TEST_F(DebatchTest, GroupMailReachesEveryMemberOnlyFromAPermittedSender) {
+  write_file(in("1"), std::string("MAIL FROM:<ann@site.example>\r\nRCPT TO:<+1>\r\n") + kMessage);
+  debatch_file(in("1"));
+  EXPECT_NE(read_file(root + "/home/bob/mail/inbox").find("X-RCPT-TO: bob"), std::string::npos);
+  EXPECT_NE(read_file(root + "/home/carl/mail/inbox").find("X-RCPT-TO: carl"), std::string::npos);
+  write_file(in("2"), std::string("MAIL FROM:<bob@site.example>\r\nRCPT TO:<+0>\r\n") + kMessage);
+  debatch_file(in("2"));
+  EXPECT_EQ(read_file(root + "/home/ann/mail/inbox"), "");
+  std::string reports;
+  for (const std::string& p : queue_incoming()) reports += read_file(p);
+  EXPECT_NE(reports.find("RCPT TO:<bob@site.example>"), std::string::npos);
+  EXPECT_NE(reports.find("You do not have the permission to email group 0"), std::string::npos);
+}
+
+TEST_F(DebatchTest, DebatchStartsAfterTheQuietTimeAndRetriesAMinuteAfterAFailure) {
+  config.mail_debatch_time = 30;
+  server_now = 100000;
+  mail_poll();  // settles what earlier tests left
+  mail_note_traffic();
+  write_file(in("1"), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage);
+  queue_scan_incoming();
+  server_now += 30;
+  mail_poll();
+  EXPECT_EQ(queue_incoming().size(), 1u);  // not quiet for long enough yet
+  server_now += 1;
+  debatch_with_full_disk_during([] { mail_poll(); });
+  EXPECT_TRUE(queue_incoming().empty());  // tried and left in the folder
+  server_now += kRetrySeconds - 1;
+  mail_poll();
+  EXPECT_EQ(read_file(root + "/home/ann/mail/inbox"), std::string(200000, 'x'));
+  server_now += 1;
+  mail_poll();
+  EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("X-RCPT-TO: ann"), std::string::npos);
+  EXPECT_EQ(file_size(in("1")), -1);
+}
+
 }  // namespace
 }  // namespace velmor
