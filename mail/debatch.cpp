@@ -1,14 +1,20 @@
 // Debatching: one incoming file is checked against the sender's group
 // limits, every recipient is resolved through the alias table, local
 // recipients get the message in their mailbox and outside ones a file of the
-// outgoing queue. The incoming file is deleted only when every copy made of
-// it is safely on disk; otherwise it stays for a later try (nothing was
-// delivered yet) or goes to the oddments folder with its reason.
+// outgoing queue. The recipients of a file are handled one per step, and the
+// poll works for a bounded time, so a message for many never holds up the
+// connections. Each mailbox and each outside address gets one copy however
+// often it is named. The incoming file is deleted only when every copy made
+// of it is safely on disk; after a temporary failure it stays for a later
+// try, holding only the recipients still to do; anything else sends it to
+// the oddments folder with its reason.
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
 #include <cstdlib>
 #include <ctime>
 #include <memory>
+#include <set>
 
 #include "core/config.h"
 #include "core/globals.h"
@@ -18,6 +24,7 @@
 #include "core/textfile.h"
 #include "core/util.h"
 #include "mail/alias.h"
+#include "mail/delivery.h"
 #include "mail/mailbox.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
@@ -30,29 +37,43 @@ namespace velmor {
 
 namespace {
 
+using Clock = std::chrono::steady_clock;
+
 std::time_t g_last_traffic = 0;
 std::time_t g_retry_at = 0;  // rescan for files left after a temporary failure
 bool g_debatch_pending = false;
 
 // A message that has passed this many relays is looping.
 constexpr int kMaxReceived = 30;
+// How long one poll may debatch before the connections are served again.
+constexpr auto kDebatchSlice = std::chrono::milliseconds(100);
 
 class Debatch final : public AliasSink {
  public:
-  Debatch(const std::string& path, CacheFile& file, const QueueEnvelope& env)
-      : path_(path), file_(file), env_(env) {}
+  Debatch(std::string path, CacheFile file) : path_(std::move(path)), file_(std::move(file)) {}
+  ~Debatch() override {
+    if (outgoing_) filecache_destroy(outgoing_);
+  }
 
-  const std::string& path_;
-  CacheFile& file_;
-  const QueueEnvelope& env_;
+  const std::string path_;
+  CacheFile file_;
+  QueueEnvelope env_;
   std::shared_ptr<const GroupOptions> sender_group;  // a local sender's group
   bool sender_local = false;
+  std::size_t next = 0;     // the envelope recipient to handle next
 
   int copies = 0;           // copies safely made (mailboxes, files, error mails)
   std::string failure;      // the first reason the file cannot simply be deleted
   bool only_temporary = true;
   bool moved = false;       // an error mail moved the file to oddments
   std::string trace;        // the mail-log record
+  // Recipients to try again later (each as an envelope address that leads
+  // to the same mailbox or outside address again).
+  std::vector<std::string> retry;
+
+  bool more() const { return !moved && next < env_.recipients.size(); }
+  // False for an envelope recipient named before (in any case).
+  bool first_mention(std::string_view address) { return named_.insert(str_lower(address)).second; }
 
   void fail(std::string reason, bool temporary = false) {
     if (failure.empty()) failure = std::move(reason);
@@ -83,7 +104,11 @@ class Debatch final : public AliasSink {
 
   bool deliver_local(std::string_view user, std::string_view to_address) override {
     if (moved) return true;
-    int rc = mailbox_append(path_, to_address.empty() ? user : to_address, env_.sender);
+    std::string recipient(to_address.empty() ? user : to_address);
+    // One copy per mailbox, however many names lead there.
+    std::string box = str_lower(user) + "/" + mailbox_box_for_address(recipient);
+    if (!mailboxes_.insert(box).second) return true;
+    int rc = mailbox_append(path_, recipient, env_.sender);
     // Delivery may have moved the file aside (a mailbox it cannot open).
     if (file_size(path_) < 0) moved = true;
     if (rc == 1) {
@@ -93,13 +118,15 @@ class Debatch final : public AliasSink {
     if (rc == kAppendTemporaryFailure) {
       fail(strprintf("Temporary failure delivering to `%.*s'", static_cast<int>(user.size()), user.data()),
            true);
+      retry.push_back(std::move(recipient));
       return true;
     }
+    mailboxes_.erase(box);
     return false;
   }
 
   void deliver_remote(std::string_view address) override {
-    if (moved) return;
+    if (moved || !remote_.emplace(address).second) return;
     std::string_view domain = address_domain(address);
     if (!domain.empty() && config.smtp_direct && wildcard_match(domain, *config.smtp_direct)) {
       send_direct(address);
@@ -110,12 +137,14 @@ class Debatch final : public AliasSink {
       if (!name.empty()) outgoing_ = filecache_open(name, FileMode::write);
       if (!outgoing_) {
         log_write("Mail add RCPT TO: Couldn't open outgoing mail file", logchan::errors);
-        fail("Outgoing mail file could not be created");
+        fail("Outgoing mail file could not be created", true);
+        retry.emplace_back(address);
         return;
       }
       write_out(outgoing_, "MAIL FROM:<" + outgoing_sender() + ">\r\n");
     }
     write_out(outgoing_, "RCPT TO:<" + std::string(address) + ">\r\n");
+    outgoing_rcpts_.emplace_back(address);
   }
 
   bool deliver_file(std::string_view target) override {
@@ -168,14 +197,16 @@ class Debatch final : public AliasSink {
 
   // ---- the outgoing file ----
   // Writes the message (from the DATA line) behind the envelope, syncs it and
-  // puts it in the outgoing list.
+  // puts it in the outgoing list. When it cannot be written, its recipients
+  // are tried again later.
   void finish_outgoing() {
     if (!outgoing_) return;
     if (moved) {
       filecache_destroy(outgoing_);
       return;
     }
-    commit_outgoing(outgoing_, !write_failed_);
+    if (!commit_outgoing(outgoing_, !write_failed_))
+      retry.insert(retry.end(), outgoing_rcpts_.begin(), outgoing_rcpts_.end());
   }
 
  private:
@@ -202,35 +233,39 @@ class Debatch final : public AliasSink {
       return;
     }
     int rc = filecache_write(out, "MAIL FROM:<" + outgoing_sender() + ">\r\nRCPT TO:<" + std::string(address) + ">\r\n");
-    commit_outgoing(out, rc == 0);
+    if (!commit_outgoing(out, rc == 0)) retry.emplace_back(address);
   }
 
   // Copies the message (from its DATA line) behind an outgoing envelope,
-  // syncs the file into place and lists it; any failure is recorded.
-  void commit_outgoing(CacheFile& out, bool ok) {
+  // syncs the file into place and lists it; a failure is temporary (the
+  // disk may be full) and false.
+  bool commit_outgoing(CacheFile& out, bool ok) {
     if (ok && filecache_copy(file_, env_.data_offset, out, kToEnd) != 0) ok = false;
     std::string name = filecache_path(out);
-    if (!ok) {
-      filecache_destroy(out);
-      fail("Outgoing mail file could not be written");
-      return;
-    }
-    if (filecache_close(out) != 0) {
-      fail("Outgoing mail file could not be written");
-      return;
+    if (!ok) filecache_destroy(out);
+    if (!ok || filecache_close(out) != 0) {
+      fail("Outgoing mail file could not be written", true);
+      return false;
     }
     ++copies;
     queue_add_outgoing(name);
+    return true;
   }
 
   CacheFile outgoing_;
+  std::vector<std::string> outgoing_rcpts_;
   bool write_failed_ = false;
+  std::set<std::string> mailboxes_;  // "user/box" of every copy made or tried
+  std::set<std::string> remote_;     // outside addresses already sent to
+  std::set<std::string> named_;      // envelope recipients seen (lower case)
 };
 
+// Received lines of the header (the start of each line is enough).
 int count_received(CacheFile& file, std::uint64_t offset) {
+  CacheSource in(file);
   int count = 0;
   std::string line;
-  while (count <= kMaxReceived && queue_read_line(file, offset, line, 64)) {
+  while (count <= kMaxReceived && queue_read_line(in, offset, line, 64) != LineRead::end) {
     if (line.empty() || line == ".") break;
     if (str_istarts_with(line, "Received:")) ++count;
   }
@@ -245,7 +280,8 @@ std::string first_address(std::string_view value) {
     if (start == std::string_view::npos) break;
     std::size_t end = value.find_first_of(" \t,<>()\"';:", start);
     std::string_view word = value.substr(start, end == std::string_view::npos ? std::string_view::npos : end - start);
-    if (word.find('@') != std::string_view::npos) return std::string(word.substr(0, kMaxAddress));
+    // A word too long to be an address is not guessed at.
+    if (word.find('@') != std::string_view::npos) return word.size() <= kMaxAddress ? std::string(word) : "";
     if (end == std::string_view::npos) break;
     pos = end;
   }
@@ -298,8 +334,10 @@ bool pop_header_filter(Debatch& d) {
     pos = end == std::string::npos ? list.size() : end;
     std::uint64_t offset = d.env_.body_offset;
     std::string line;
-    while (queue_read_line(d.file_, offset, line, 1024)) {
+    CacheSource in(d.file_);
+    for (LineRead got; (got = queue_read_line(in, offset, line, kHeaderLineKeep)) != LineRead::end;) {
       if (line.empty()) break;
+      if (got == LineRead::cut) continue;  // no address is taken from part of a line
       std::size_t colon = line.find(':');
       if (colon == std::string::npos || str_lower(trim_blanks(std::string_view(line).substr(0, colon))) != name)
         continue;
@@ -319,108 +357,165 @@ bool pop_header_filter(Debatch& d) {
   return false;
 }
 
-}  // namespace
-
-void debatch_file(const std::string& path) {
+// Opens an incoming file and runs the checks on the whole message. Nothing
+// when the file was dealt with at once (moved aside, refused, gone).
+std::unique_ptr<Debatch> debatch_start(const std::string& path) {
   CacheFile file = filecache_open(path, FileMode::read);
   if (!file) {
     if (file_size(path) >= 0) mail_move_to_oddments(path, "Mail debatch - Bad rewrite open");
-    return;
+    return nullptr;
   }
-  std::uint64_t size = filecache_length(file);
-  if (size < 30) {
-    filecache_close(file);
-    mail_move_to_oddments(path, "Article was too short");
-    return;
-  }
-  QueueEnvelope env = queue_read_envelope(file);
-  Debatch d(path, file, env);
+  auto d = std::make_unique<Debatch>(path, std::move(file));
   auto to_oddments = [&](std::string_view reason) {
-    filecache_close(file);
+    filecache_close(d->file_);
     mail_move_to_oddments(path, reason);
+    return nullptr;
   };
-  if (env.recipients.empty() && !env.has_data && env.data_offset == 0) {
-    to_oddments("Bad debatch read - unexpected end of file");
-    return;
-  }
-  if (env.recipients.empty()) {
-    to_oddments("No recipients");
-    return;
-  }
-  if (!env.has_data || filecache_at_end(file, env.body_offset)) {
-    to_oddments("Bad read in debatch - no message body");
-    return;
-  }
-  if (count_received(file, env.body_offset) > kMaxReceived) {
-    to_oddments("Too many Received headers - mail loop");
-    return;
-  }
+  std::uint64_t size = filecache_length(d->file_);
+  if (size < 30) return to_oddments("Article was too short");
+  d->env_ = queue_read_envelope(d->file_);
+  const QueueEnvelope& env = d->env_;
+  if (env.damaged) return to_oddments("Bad envelope - a line or an address is too long");
+  if (env.recipients.empty() && !env.has_data && env.data_offset == 0)
+    return to_oddments("Bad debatch read - unexpected end of file");
+  if (env.recipients.empty()) return to_oddments("No recipients");
+  if (!env.has_data || filecache_at_end(d->file_, env.body_offset))
+    return to_oddments("Bad read in debatch - no message body");
+  if (count_received(d->file_, env.body_offset) > kMaxReceived)
+    return to_oddments("Too many Received headers - mail loop");
 
-  std::string sender_user;
   if (env.fetched) {
     log_message("Article was POPed", {}, logfac::house);
   } else {
     std::optional<std::string> user = mail_local_user(env.sender);
-    d.sender_local = user.has_value();
-    if (user) sender_user = *user;
-    d.sender_group = user_group(sender_user);
-    if (d.sender_group && refused_by_group(d, *d.sender_group, user ? sender_user : env.sender, size)) {
-      filecache_close(file);
-      if (d.moved) return;
-      if (d.failure.empty()) {
+    d->sender_local = user.has_value();
+    d->sender_group = user_group(user.value_or(std::string()));
+    if (d->sender_group && refused_by_group(*d, *d->sender_group, user ? *user : env.sender, size)) {
+      filecache_close(d->file_);
+      if (d->moved) return nullptr;
+      if (d->failure.empty()) {
         filecache_delete(path);
       } else {
-        mail_move_to_oddments(path, d.failure);
+        mail_move_to_oddments(path, d->failure);
       }
-      return;
+      return nullptr;
     }
   }
+  d->trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
+                       env.sender.c_str());
+  return d;
+}
 
-  d.trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
-                      env.sender.c_str());
+// Handles the next envelope recipient. False when none was left.
+bool debatch_recipient(Debatch& d) {
+  if (!d.more()) return false;
+  std::size_t index = d.next++;
+  const std::string& address = d.env_.recipients[index];
+  if (!d.first_mention(address)) return true;
+  if (!d.env_.fetched) d.trace += " " + address;
   bool override = d.sender_group && (d.sender_group->mail_flags & gflag::mail_override);
-  bool first = true;
-  for (const std::string& address : env.recipients) {
-    if (d.moved) break;
-    if (!env.fetched) d.trace += " " + address;
-    if (d.sender_local && d.sender_group && !override) {
-      const std::string& block = d.sender_group->text("mail.address.send.block");
-      const std::string& allow = d.sender_group->text("mail.address.send.allow");
-      if (!block.empty() && wildcard_match(address, block) && !(!allow.empty() && wildcard_match(address, allow))) {
-        log_write("[Mail] Blocked recipient [" + address + "] for: " + env.sender, logchan::filter);
-        std::string redirect = d.redirect_or_sender("mail.block.redirect");
-        log_message("Recipient address forbidden, mail redirect to ", redirect.empty() ? env.sender : redirect,
-                    logfac::house);
-        d.error("The following email was sent to a forbidden user\r\n", redirect);
-        continue;
-      }
-    }
-    if (env.fetched && first) {
-      first = false;
-      if (pop_header_filter(d)) break;
-    }
-    std::optional<std::string> local = mail_local_user(address);
-    if (local) {
-      if (alias_resolve(alias_table(), *local, d)) continue;
-      if (user_exists(*local) && d.deliver_local(*local, address)) continue;
-      d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
-    } else if (!alias_resolve(alias_table(), address, d)) {
-      d.deliver_remote(address);
+  if (d.sender_local && d.sender_group && !override) {
+    const std::string& block = d.sender_group->text("mail.address.send.block");
+    const std::string& allow = d.sender_group->text("mail.address.send.allow");
+    if (!block.empty() && wildcard_match(address, block) && !(!allow.empty() && wildcard_match(address, allow))) {
+      log_write("[Mail] Blocked recipient [" + address + "] for: " + d.env_.sender, logchan::filter);
+      std::string redirect = d.redirect_or_sender("mail.block.redirect");
+      log_message("Recipient address forbidden, mail redirect to ", redirect.empty() ? d.env_.sender : redirect,
+                  logfac::house);
+      d.error("The following email was sent to a forbidden user\r\n", redirect);
+      return true;
     }
   }
+  if (d.env_.fetched && index == 0 && pop_header_filter(d)) {
+    d.next = d.env_.recipients.size();  // the header named the recipient
+    return true;
+  }
+  std::optional<std::string> local = mail_local_user(address);
+  if (local) {
+    if (alias_resolve(alias_table(), *local, d)) return true;
+    if (user_exists(*local) && d.deliver_local(*local, address)) return true;
+    d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
+  } else if (!alias_resolve(alias_table(), address, d)) {
+    d.deliver_remote(address);
+  }
+  return true;
+}
+
+// Settles the file by its outcome: deleted when every copy is made, kept
+// for a later try after a temporary failure (cut down to the recipients
+// still to do), otherwise moved to oddments.
+void debatch_finish(Debatch& d) {
   d.finish_outgoing();
   log_write(d.trace, logchan::mail_trace, kLogNoStamp);
-  filecache_close(file);
-
-  if (d.moved) return;
-  if (d.failure.empty()) {
+  const std::string& path = d.path_;
+  if (d.moved) {
+    filecache_close(d.file_);
+  } else if (d.failure.empty()) {
+    filecache_close(d.file_);
     filecache_delete(path);
-  } else if (d.copies == 0 && d.only_temporary) {
+  } else if (!d.only_temporary) {
+    filecache_close(d.file_);
+    mail_move_to_oddments(path, d.failure);
+  } else {
+    // Something was done: the file keeps only the recipients left. Should
+    // that fail (or an address not fit an envelope line), the whole file is
+    // tried again, and those done get it twice rather than anyone never.
+    if (d.copies > 0) {
+      // A fetched message keeps no "POP3" mark: its header has been read.
+      std::string first = d.env_.fetched ? "MAIL FROM:<" + d.env_.sender + ">" : d.env_.first_line;
+      int rc = std::all_of(d.retry.begin(), d.retry.end(), envelope_address_fits)
+                   ? queue_rewrite_envelope(d.file_, d.env_, first, d.retry)
+                   : EINVAL;
+      if (rc != 0)
+        log_write(strprintf("Mail debatch: %s not cut down to the recipients left (%s); those done may get it again",
+                            path.c_str(), error_text(rc).c_str()),
+                  logchan::errors);
+    }
+    filecache_close(d.file_);
     log_write("Mail debatch: " + d.failure + " - " + path + " left in the queue for a later try", logchan::errors);
     queue_retry_later();
-  } else {
-    mail_move_to_oddments(path, d.failure);
   }
+}
+
+std::unique_ptr<Debatch> g_job;  // the file in hand
+
+// Debatches until `deadline`; with `one_file`, stops at the end of a file.
+void debatch_for(Clock::time_point deadline, bool one_file) {
+  for (;;) {
+    DebatchStep step = debatch_step(deadline);
+    g_debatch_pending = g_job || !queue_incoming().empty();
+    if (step != DebatchStep::finished || one_file || !g_debatch_pending || Clock::now() >= deadline) return;
+  }
+}
+
+}  // namespace
+
+DebatchStep debatch_step(Clock::time_point deadline) {
+  if (!g_job) {
+    std::size_t left = queue_incoming().size();
+    std::optional<std::string> path = queue_pop_incoming();
+    if (!path) {
+      log_message("Debatching mail - no articles in queue", {}, logfac::house);
+      return DebatchStep::idle;
+    }
+    log_message("Debatching mail - articles left in queue: ", std::to_string(left), logfac::house);
+    g_job = debatch_start(*path);
+    if (!g_job) return DebatchStep::finished;
+  }
+  // One recipient at least, then the connections get their turn.
+  while (debatch_recipient(*g_job))
+    if (g_job->more() && Clock::now() >= deadline) return DebatchStep::working;
+  debatch_finish(*g_job);
+  g_job.reset();
+  return DebatchStep::finished;
+}
+
+void debatch_file(const std::string& path) {
+  std::unique_ptr<Debatch> d = debatch_start(path);
+  if (!d) return;
+  while (debatch_recipient(*d)) {
+  }
+  debatch_finish(*d);
 }
 
 // ---- start-up and the poll ------------------------------------------------
@@ -455,18 +550,7 @@ int mail_init() {
   return 0;
 }
 
-void mail_debatch_one() {
-  std::size_t left = queue_incoming().size();
-  std::optional<std::string> path = queue_pop_incoming();
-  if (!path) {
-    log_message("Debatching mail - no articles in queue", {}, logfac::house);
-    g_debatch_pending = false;
-    return;
-  }
-  log_message("Debatching mail - articles left in queue: ", std::to_string(left), logfac::house);
-  debatch_file(*path);
-  g_debatch_pending = !queue_incoming().empty();
-}
+void mail_debatch_one() { debatch_for(Clock::now() + kDebatchSlice, true); }
 
 void mail_poll() {
   if (g_retry_at && server_now >= g_retry_at) {
@@ -478,11 +562,7 @@ void mail_poll() {
     g_debatch_pending = true;
   // A batch per poll, bounded in time: a busy queue neither waits one
   // message per tick nor holds up the connections.
-  auto start = std::chrono::steady_clock::now();
-  while (g_debatch_pending) {
-    mail_debatch_one();
-    if (std::chrono::steady_clock::now() - start > std::chrono::milliseconds(100)) break;
-  }
+  if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
 }
 
 }  // namespace velmor

@@ -2,6 +2,7 @@
 
 #include <csignal>
 
+#include "mail/alias.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
 #include "users/users.h"
@@ -16,14 +17,17 @@ class DebatchTest : public QueueFixture {
     QueueFixture::SetUp();
     config.mail_domains = "site.example";
     for (const char* d : {"/home", "/home/ann", "/home/ann/mail"}) mkdir((root + d).c_str(), 0770);
-    write_file(root + "/users", "ann,x,Ann," + root + "/home/ann,0\n");
-    write_file(root + "/groups", "#0\n%group.name: all\n");
+    write_file(root + "/users", "ann,x,Ann," + root + "/home/ann,0\nbob,x,Bob," + root + "/home/bob,1\ncarl,x,Carl," +
+                                    root + "/home/carl,1\n");
+    write_file(root + "/groups", "#0\n%group.name: all\n%mail.override: yes\n#1\n%group.name: staff\n");
+    alias_table().clear();
     ASSERT_EQ(user_load(root + "/users"), 0);
     ASSERT_EQ(groups_load(root + "/groups"), 0);
   }
 
-  // Debatches `file` while no file may grow past the inbox's current size.
-  void debatch_with_full_disk(const std::string& file) {
+  // Runs `work` while no file may grow past the inbox's current size.
+  template <class Work>
+  void debatch_with_full_disk_during(Work work) {
     std::string inbox = root + "/home/ann/mail/inbox";
     write_file(inbox, std::string(200000, 'x'));
     std::signal(SIGXFSZ, SIG_IGN);
@@ -31,9 +35,12 @@ class DebatchTest : public QueueFixture {
     getrlimit(RLIMIT_FSIZE, &old);
     small.rlim_max = old.rlim_max;
     setrlimit(RLIMIT_FSIZE, &small);
-    debatch_file(file);
+    work();
     setrlimit(RLIMIT_FSIZE, &old);
     EXPECT_EQ(read_file(inbox), std::string(200000, 'x'));  // the mailbox as it was
+  }
+  void debatch_with_full_disk(const std::string& file) {
+    debatch_with_full_disk_during([&] { debatch_file(file); });
   }
 };
 
@@ -62,17 +69,50 @@ TEST_F(DebatchTest, ATemporaryFailureWithNoOtherCopyLeavesTheFileQueued) {
   EXPECT_TRUE(queue_incoming().empty());  // no error mail either
 }
 
-TEST_F(DebatchTest, ATemporaryFailureBesideACopyGoesToOddmentsWithItsReason) {
+TEST_F(DebatchTest, ATemporaryFailureKeepsTheFileForTheRecipientsLeft) {
   std::string text =
       std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<b@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage;
   std::string file = root + "/in/7";
   write_file(file, text);
   debatch_with_full_disk(file);
+  EXPECT_EQ(read_file(file), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage);
+  ASSERT_EQ(folder_names(root + "/out", true).size(), 1u);  // b got it
+  debatch_file(file);  // the later try reaches ann and nobody else
   EXPECT_EQ(file_size(file), -1);
-  std::vector<std::string> odd = folder_names(root + "/odd", true);
-  ASSERT_EQ(odd.size(), 1u);
-  EXPECT_EQ(read_file(odd[0]), text);
-  ASSERT_EQ(folder_names(root + "/out", true).size(), 1u);  // b still gets it
+  EXPECT_EQ(folder_names(root + "/out", true).size(), 1u);
+  EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("X-RCPT-TO: ann"), std::string::npos);
+
+  // The rewrite is renamed into place: failing, it leaves the whole file.
+  write_file(file, text);
+  sysio::reset();
+  sysio::fail_nth(sysio::Op::rename, 2);  // the outgoing file's is the first
+  debatch_with_full_disk(file);
+  sysio::reset();
+  EXPECT_EQ(read_file(file), text);
+  EXPECT_EQ(folder_names(root + "/in"), std::vector<std::string>{"7"});
+}
+
+TEST_F(DebatchTest, EachMailboxAndAddressGetsOneCopyAndRecipientsTakeOneStepEach) {
+  alias_table() = alias_parse("team ann,bob,x@far.example\n");
+  std::string file = root + "/in/10";
+  write_file(file, std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\nRCPT TO:<ANN@site.example>\r\n"
+                               "RCPT TO:<team@site.example>\r\nRCPT TO:<bob_work@site.example>\r\n"
+                               "RCPT TO:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") +
+                       kMessage);
+  queue_add_incoming(file);
+  EXPECT_EQ(debatch_step({}), DebatchStep::working);  // the deadline has passed: one recipient
+  EXPECT_EQ(read_file(root + "/home/bob/mail/inbox"), "");
+  int steps = 1;
+  while (debatch_step({}) == DebatchStep::working) ++steps;
+  EXPECT_EQ(steps, 5);
+  for (const char* box : {"ann/mail/inbox", "bob/mail/inbox", "bob/mail/work"}) {
+    std::string text = read_file(root + "/home/" + box);
+    EXPECT_TRUE(text.find("X-UID:") != std::string::npos && text.find("X-UID:") == text.rfind("X-UID:")) << box;
+  }
+  std::vector<std::string> out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 1u);
+  EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<x@far.example>\r\n") + kMessage);
+  EXPECT_EQ(file_size(file), -1);
 }
 
 TEST_F(DebatchTest, AFileWithoutRecipientsOrBodyGoesToOddments) {
@@ -80,8 +120,67 @@ TEST_F(DebatchTest, AFileWithoutRecipientsOrBodyGoesToOddments) {
   debatch_file(root + "/in/8");
   write_file(root + "/in/9", "MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n");
   debatch_file(root + "/in/9");
-  EXPECT_EQ(folder_names(root + "/odd", true).size(), 2u);
+  // Nor is a recipient guessed from a line too long to read whole.
+  write_file(root + "/in/10", "MAIL FROM:<x@far.example>\r\nRCPT TO:" + std::string(4072, ' ') +
+                                  "<victim@evil.org.example.com>\r\n" + kMessage);
+  debatch_file(root + "/in/10");
+  write_file(in("11"), "MAIL FROM:<x@far.example>\r\nRCPT TO:<" + std::string(300, 'x') + "@far.example>\r\n" + kMessage);
+  debatch_file(in("11"));
+  EXPECT_EQ(folder_names(root + "/odd", true).size(), 4u);
+  EXPECT_TRUE(folder_names(root + "/out", true).empty());
   EXPECT_TRUE(folder_names(root + "/in", true).empty());
+}
+
+TEST_F(DebatchTest, FetchedMailGoesByTheListedHeaderAndOutwardUnderTheForcedSender) {
+  config.pop_headers = "X-Envelope-To, Delivered-To";
+  config.mail_from_force = "relay@site.example";
+  const std::string fetched = "POP3 MAIL FROM:<x@far.example>\r\nRCPT TO:<bob@site.example>\r\nDATA\r\n";
+  write_file(in("1"), fetched + "Delivered-To: Ann <ann@site.example>\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
+  debatch_file(in("1"));
+  EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("Subject: s"), std::string::npos);
+  EXPECT_EQ(read_file(root + "/home/bob/mail/inbox"), "");
+  // No listed header: the envelope decides; outward the sender is forced.
+  write_file(in("2"), fetched.substr(0, 35) + "RCPT TO:<b@far.example>\r\n" + kMessage);
+  debatch_file(in("2"));
+  std::vector<std::string> out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 1u);
+  EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<relay@site.example>\r\nRCPT TO:<b@far.example>\r\n") + kMessage);
+}
+
+TEST_F(DebatchTest, GroupMailReachesEveryMemberOnlyFromAPermittedSender) {
+  write_file(in("1"), std::string("MAIL FROM:<ann@site.example>\r\nRCPT TO:<+1>\r\n") + kMessage);
+  debatch_file(in("1"));
+  EXPECT_NE(read_file(root + "/home/bob/mail/inbox").find("X-RCPT-TO: bob"), std::string::npos);
+  EXPECT_NE(read_file(root + "/home/carl/mail/inbox").find("X-RCPT-TO: carl"), std::string::npos);
+  write_file(in("2"), std::string("MAIL FROM:<bob@site.example>\r\nRCPT TO:<+0>\r\n") + kMessage);
+  debatch_file(in("2"));
+  EXPECT_EQ(read_file(root + "/home/ann/mail/inbox"), "");
+  std::string reports;
+  for (const std::string& p : queue_incoming()) reports += read_file(p);
+  EXPECT_NE(reports.find("RCPT TO:<bob@site.example>"), std::string::npos);
+  EXPECT_NE(reports.find("You do not have the permission to email group 0"), std::string::npos);
+}
+
+TEST_F(DebatchTest, DebatchStartsAfterTheQuietTimeAndRetriesAMinuteAfterAFailure) {
+  config.mail_debatch_time = 30;
+  server_now = 100000;
+  mail_poll();  // settles what earlier tests left
+  mail_note_traffic();
+  write_file(in("1"), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage);
+  queue_scan_incoming();
+  server_now += 30;
+  mail_poll();
+  EXPECT_EQ(queue_incoming().size(), 1u);  // not quiet for long enough yet
+  server_now += 1;
+  debatch_with_full_disk_during([] { mail_poll(); });
+  EXPECT_TRUE(queue_incoming().empty());  // tried and left in the folder
+  server_now += kRetrySeconds - 1;
+  mail_poll();
+  EXPECT_EQ(read_file(root + "/home/ann/mail/inbox"), std::string(200000, 'x'));
+  server_now += 1;
+  mail_poll();
+  EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("X-RCPT-TO: ann"), std::string::npos);
+  EXPECT_EQ(file_size(in("1")), -1);
 }
 
 }  // namespace

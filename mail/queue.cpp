@@ -102,10 +102,12 @@ std::string new_name(const std::string& dir, std::uint64_t& counter) {
   return {};
 }
 
-void unreserve(const std::string& path) {
-  std::string hidden = path_join(path_dir(path), "." + std::string(path_leaf(path)) + ".new");
-  unlink(hidden.c_str());
+// The hidden name a queue file is written under before it takes its name.
+std::string hidden_name(const std::string& path) {
+  return path_join(path_dir(path), "." + std::string(path_leaf(path)) + ".new");
 }
+
+void unreserve(const std::string& path) { unlink(hidden_name(path).c_str()); }
 
 OutgoingEntry outgoing_entry(const std::string& path) {
   OutgoingEntry e;
@@ -168,7 +170,7 @@ PendingIncoming queue_open_incoming_pending() {
   PendingIncoming p;
   p.path = queue_new_incoming_name();
   if (p.path.empty()) return p;
-  p.hidden = path_join(path_dir(p.path), "." + std::string(path_leaf(p.path)) + ".new");
+  p.hidden = hidden_name(p.path);
   p.file = filecache_open(p.hidden, FileMode::append);
   if (!p.file) unlink(p.hidden.c_str());
   return p;
@@ -221,6 +223,36 @@ void queue_commit(const std::function<void(int owner, int error)>& done) {
     }
     done(batch[i].owner, errors[i]);
   }
+}
+
+int queue_rewrite_envelope(CacheFile& file, const QueueEnvelope& env, std::string_view first_line,
+                           const std::vector<std::string>& recipients) {
+  std::string path = filecache_path(file);
+  std::string hidden = hidden_name(path);
+  unlink(hidden.c_str());  // a leftover of a rewrite that crashed
+  int fd = open(hidden.c_str(), O_CREAT | O_EXCL | O_WRONLY | O_CLOEXEC | O_NOFOLLOW, 0660);
+  if (fd < 0) return errno;
+  close(fd);
+  CacheFile out = filecache_open(hidden, FileMode::append);
+  if (!out) {
+    unlink(hidden.c_str());
+    return EIO;
+  }
+  std::string head = std::string(first_line) + "\r\n";
+  for (const std::string& r : recipients) head += "RCPT TO:<" + r + ">\r\n";
+  int rc = filecache_write(out, head);
+  if (rc == 0 && filecache_copy(file, env.data_offset, out, kToEnd) != 0) rc = EIO;
+  if (rc == 0) rc = filecache_sync(out);
+  int close_rc = filecache_purge(out);
+  if (rc == 0) rc = close_rc;
+  if (rc == 0 && sysio::rename(hidden.c_str(), path.c_str()) != 0) rc = errno;
+  if (rc != 0) {
+    unlink(hidden.c_str());
+    return rc;
+  }
+  // Should the folder sync fail, a crash may bring the old file back: its
+  // recipients then get the message twice, and nobody loses it.
+  return sync_parent_dir(path);
 }
 
 void queue_file_discard(CacheFile& file) {
@@ -344,39 +376,53 @@ bool smtp_reject_match(std::string_view sender) {
 
 // ---- files ------------------------------------------------------------------------
 
-bool queue_read_line(CacheFile& file, std::uint64_t& offset, std::string& line, std::size_t max) {
-  line.clear();
-  bool any = false;
-  for (;;) {
-    std::string_view v = filecache_view(file, offset);
-    if (v.empty()) break;
-    any = true;
-    std::size_t nl = v.find('\n');
-    std::string_view part = v.substr(0, nl);
-    if (line.size() < max) line += part.substr(0, max - line.size());
-    if (nl != std::string_view::npos) {
-      offset += nl + 1;
-      break;
-    }
-    offset += v.size();
+std::string_view CacheSource::view(std::uint64_t offset, std::size_t want) {
+  std::string_view v = filecache_view(file_, offset);
+  if (v.size() >= want || v.empty()) return v;
+  // The window ends early: join the next ones (each view lasts only until
+  // the next call on the file).
+  joined_.assign(v);
+  while (joined_.size() < want) {
+    std::string_view more = filecache_view(file_, offset + joined_.size());
+    if (more.empty()) break;
+    joined_ += more;
   }
-  if (!line.empty() && line.back() == '\r') line.pop_back();
-  return any;
+  return joined_;
 }
 
-QueueEnvelope queue_read_envelope(CacheFile& file) {
+LineRead queue_read_line(ByteSource& in, std::uint64_t& offset, std::string& line, std::size_t max) {
+  Line l = read_line(in, offset, max + 2);  // room for the CR LF
+  line.clear();
+  if (l.length == 0) return LineRead::end;
+  offset += l.length;
+  std::string_view body = l.text.size() == l.length ? line_body(l.text) : l.text;
+  line.assign(body.substr(0, max));
+  return l.text.size() == l.length && body.size() <= max ? LineRead::ok : LineRead::cut;
+}
+
+QueueEnvelope queue_read_envelope(ByteSource& in) {
   QueueEnvelope env;
   std::uint64_t offset = 0;
-  if (!queue_read_line(file, offset, env.first_line)) return env;
+  LineRead got = queue_read_line(in, offset, env.first_line, kMaxEnvelopeLine);
+  if (got == LineRead::end) return env;
+  env.damaged = got == LineRead::cut;
   env.fetched = env.first_line.compare(0, 3, "POP") == 0;
   env.has_sender_bracket = env.first_line.find('<') != std::string::npos;
-  env.sender = std::string(envelope_address(env.first_line).substr(0, kMaxAddress));
+  std::string_view sender = envelope_address(env.first_line);
+  if (sender.size() > kMaxAddress) env.damaged = true;
+  env.sender = std::string(sender.substr(0, kMaxAddress));
   std::string line;
   for (;;) {
     std::uint64_t start = offset;
-    if (!queue_read_line(file, offset, line)) break;
+    got = queue_read_line(in, offset, line, kMaxEnvelopeLine);
+    if (got == LineRead::end) break;
     if (!line.empty() && (line.front() == 'r' || line.front() == 'R')) {
-      env.recipients.emplace_back(envelope_address(line).substr(0, kMaxAddress));
+      std::string_view address = envelope_address(line);
+      if (got == LineRead::cut || address.size() > kMaxAddress) {
+        env.damaged = true;
+        continue;
+      }
+      env.recipients.emplace_back(address);
       continue;
     }
     if (!line.empty() && (line.front() == 'd' || line.front() == 'D')) {
@@ -389,6 +435,11 @@ QueueEnvelope queue_read_envelope(CacheFile& file) {
     break;
   }
   return env;
+}
+
+QueueEnvelope queue_read_envelope(CacheFile& file) {
+  CacheSource in(file);
+  return queue_read_envelope(in);
 }
 
 bool file_contains(CacheFile& file, const std::vector<std::string>& needles) {
@@ -510,11 +561,15 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
   if (attached) {
     head += "\r\n\r\n    ----- Unsent Message Follows -----\r\n\r\n";
     if (headers_only) {
-      std::uint64_t offset = env.body_offset;
+      // The header lines as they are, however long, up to the empty line.
+      CacheSource in(source);
+      std::uint64_t end = env.body_offset, next = end;
       std::string line;
-      while (queue_read_line(source, offset, line) && !line.empty() && line != ".") head += line + "\r\n";
-      head += ".\r\n";
+      for (LineRead got; (got = queue_read_line(in, next, line, 1)) != LineRead::end; end = next)
+        if (line.empty() || (got == LineRead::ok && line == ".")) break;
       rc = filecache_write(out, head);
+      if (rc == 0) rc = filecache_copy(source, env.body_offset, out, end - env.body_offset);
+      if (rc == 0) rc = filecache_write(out, ".\r\n");
     } else {
       rc = filecache_write(out, head);
       if (rc == 0) rc = filecache_copy(source, env.body_offset, out, kToEnd);

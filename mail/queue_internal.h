@@ -2,6 +2,7 @@
 // subsystems.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <ctime>
 #include <functional>
@@ -11,16 +12,39 @@
 #include <vector>
 
 #include "core/filecache.h"
+#include "mail/mailfile.h"
 
 namespace velmor {
 
 // filecache_copy's count for "up to the end of the file".
 inline constexpr std::uint64_t kToEnd = ~std::uint64_t{0};
 
+// A queue file read through the file cache, as a source for the line reader
+// of mail/mailfile.h. A view is at least as long as asked for unless the
+// file ends first, even across the cache's windows.
+class CacheSource final : public ByteSource {
+ public:
+  explicit CacheSource(CacheFile& file) : file_(file) {}
+  std::uint64_t size() const override { return filecache_length(file_); }
+  std::string_view view(std::uint64_t offset, std::size_t want) override;
+
+ private:
+  CacheFile& file_;
+  std::string joined_;
+};
+
+// How reading a line went.
+enum class LineRead {
+  ok,
+  cut,  // longer than the limit: `line` holds its start, `offset` is past all of it
+  end,  // no more lines
+};
 // Reads one line (without its CR LF) starting at `offset` and moves `offset`
-// past its line end. Lines longer than `max` are cut (the rest is skipped).
-// False at the end of the file.
-bool queue_read_line(CacheFile& file, std::uint64_t& offset, std::string& line, std::size_t max = 4096);
+// past its line end. A line is never cut silently: a longer one says so.
+LineRead queue_read_line(ByteSource& in, std::uint64_t& offset, std::string& line, std::size_t max);
+
+// Envelope lines are far shorter: "RCPT TO:<" and a path of kMaxAddress.
+inline constexpr std::size_t kMaxEnvelopeLine = 1024;
 
 // The envelope of a queue file.
 struct QueueEnvelope {
@@ -32,7 +56,11 @@ struct QueueEnvelope {
   bool has_data = false;          // the envelope ends with a DATA line
   std::uint64_t data_offset = 0;  // where the DATA line starts
   std::uint64_t body_offset = 0;  // the byte after the DATA line
+  // Set when a line or an address of the envelope is too long to be read
+  // whole: such a file is never delivered on a guess.
+  bool damaged = false;
 };
+QueueEnvelope queue_read_envelope(ByteSource& in);
 QueueEnvelope queue_read_envelope(CacheFile& file);
 
 // True when any needle occurs in the file (case-insensitive), searched block
@@ -69,6 +97,15 @@ bool queue_commit_pending();
 // the file is in place, durable and in the incoming list).
 void queue_commit(const std::function<void(int owner, int error)>& done);
 
+// Keeps a queue file for the recipients still to do: `first_line`, these
+// recipients and the message from its DATA line are written under the
+// hidden name, synced and renamed over the file, and the folder is synced.
+// A crash on the way leaves the old file, so a recipient already served may
+// get the message twice, but none loses it. 0 or an errno value (the old
+// file is then unchanged, unless only the folder sync failed).
+int queue_rewrite_envelope(CacheFile& file, const QueueEnvelope& env, std::string_view first_line,
+                           const std::vector<std::string>& recipients);
+
 // Throws away an unfinished queue file (and the name reserved for it).
 void queue_file_discard(CacheFile& file);
 
@@ -87,8 +124,13 @@ void queue_list(const std::function<void(std::string_view)>& send);
 // debatching runs from the last traffic).
 void mail_note_traffic();
 
-// Debatches one incoming file (the whole processing of one message).
+// Debatches one incoming file at once (the whole processing of one message).
 void debatch_file(const std::string& path);
+// Debatches from the incoming list until `deadline`, one recipient at
+// least: the file in hand is continued, or the next one taken. `working`
+// when the deadline came before the file's end.
+enum class DebatchStep { idle, working, finished };
+DebatchStep debatch_step(std::chrono::steady_clock::time_point deadline);
 // A file left queued after a temporary failure is tried again after this
 // many seconds.
 inline constexpr int kRetrySeconds = 60;

@@ -32,6 +32,22 @@ TEST_F(QueueTest, NamesAreNeverReusedAndUnfinishedFilesVanishAtStart) {
   EXPECT_EQ(queue_new_incoming_name(), in("10001"));
 }
 
+TEST_F(QueueTest, ATransferIsRequestedWhenTheOutgoingQueueReachesItsMarkOffline) {
+  config.mail_auto_send = 2;
+  link_up = 0;
+  mail_transfer_state = 0;
+  for (const char* n : {"1", "2", "3"}) write_file(root + "/out/" + n, "MAIL FROM:<a@b>\r\nRCPT TO:<c@d>\r\nDATA\r\nx\r\n.\r\n");
+  queue_add_outgoing(root + "/out/1");
+  EXPECT_EQ(mail_transfer_state, 0);
+  queue_add_outgoing(root + "/out/2");
+  EXPECT_EQ(mail_transfer_state, 4);
+  mail_transfer_state = 0;
+  link_up = 1;  // online, the send run takes the queue anyway
+  queue_add_outgoing(root + "/out/3");
+  EXPECT_EQ(mail_transfer_state, 0);
+  link_up = 0;
+}
+
 TEST_F(QueueTest, LocalUsersAndThePrimaryDomain) {
   EXPECT_EQ(mail_local_user("ann@site.example"), "ann");
   EXPECT_EQ(mail_local_user("<ann_work@LOCALHOST>"), "ann");

@@ -2,6 +2,8 @@
 
 #include <arpa/inet.h>
 
+#include <algorithm>
+
 #include "core/util.h"
 
 namespace velmor {
@@ -28,6 +30,26 @@ bool envelope_keyword(std::string_view argument, std::string_view keyword) {
   argument.remove_prefix(keyword.size());
   while (!argument.empty() && (argument.front() == ' ' || argument.front() == '\t')) argument.remove_prefix(1);
   return !argument.empty() && argument.front() == ':';
+}
+
+EnvelopePath parse_envelope_path(std::string_view argument, std::string_view keyword, bool allow_empty) {
+  EnvelopePath path;
+  if (!envelope_keyword(argument, keyword)) return path;
+  path.address = envelope_address(argument);
+  if (path.address.empty() && !allow_empty) return path;
+  if (path.address.size() > kMaxAddress) {
+    path.result = PathResult::too_long;
+  } else {
+    path.result = envelope_address_fits(path.address) ? PathResult::ok : PathResult::bad_chars;
+  }
+  return path;
+}
+
+bool envelope_address_fits(std::string_view address) {
+  return address.size() <= kMaxAddress && std::none_of(address.begin(), address.end(), [](char c) {
+           auto u = static_cast<unsigned char>(c);
+           return u <= ' ' || u == 0x7f || c == '<' || c == '>';
+         });
 }
 
 std::string_view address_domain(std::string_view address) {

@@ -16,6 +16,10 @@ namespace velmor {
 
 // Longest envelope address accepted (the SMTP path limit).
 inline constexpr std::size_t kMaxAddress = 256;
+// Longest SMTP command line, without its CR LF (512 octets with it).
+inline constexpr std::size_t kMaxCommandLine = 510;
+// Distinct recipients one message may have.
+inline constexpr std::size_t kMaxRecipients = 100;
 
 // The address of an envelope line ("MAIL FROM:<a@b>", "RCPT TO: <c>",
 // "POP3 MAIL FROM:<d>"): from the first ':' or '<', skipping ':', '<' and
@@ -26,6 +30,22 @@ std::string_view envelope_address(std::string_view line);
 // True for the argument of "MAIL FROM:..." / "RCPT TO:..." written the way
 // a client may: `keyword` (case-insensitive) then ':' after optional blanks.
 bool envelope_keyword(std::string_view argument, std::string_view keyword);
+
+// The address of a MAIL or RCPT argument, checked so that the queue file
+// line "RCPT TO:<address>" built from it reads back as the same address.
+enum class PathResult {
+  ok,
+  syntax,     // not "<keyword>:...", or (with `allow_empty` false) no address
+  too_long,   // longer than kMaxAddress
+  bad_chars,  // blanks, control characters, '<' or '>' inside the address
+};
+struct EnvelopePath {
+  PathResult result = PathResult::syntax;
+  std::string_view address;  // points into the argument
+};
+EnvelopePath parse_envelope_path(std::string_view argument, std::string_view keyword, bool allow_empty);
+// True when "RCPT TO:<address>" reads back as this same address.
+bool envelope_address_fits(std::string_view address);
 
 // The domain of an address (after its last '@'), or "" when it has none.
 std::string_view address_domain(std::string_view address);

@@ -34,6 +34,17 @@ TEST(EnvelopeAddress, KeywordAndDomain) {
   EXPECT_EQ(address_domain("local"), "");
 }
 
+TEST(EnvelopePath, OnlyAddressesThatReadBackTheSameAreTaken) {
+  EXPECT_EQ(parse_envelope_path("TO: <a@b.example>  ", "to", false).address, "a@b.example");
+  EXPECT_EQ(parse_envelope_path("FROM:<>", "from", true).result, PathResult::ok);
+  EXPECT_EQ(parse_envelope_path("TO:<>", "to", false).result, PathResult::syntax);
+  EXPECT_EQ(parse_envelope_path("FROM <a@b>", "from", true).result, PathResult::syntax);
+  EXPECT_EQ(parse_envelope_path("TO:a>b@c", "to", false).result, PathResult::bad_chars);
+  EXPECT_EQ(parse_envelope_path("TO:<a b@c>", "to", false).result, PathResult::bad_chars);
+  EXPECT_EQ(parse_envelope_path("TO:<a\x01@c>", "to", false).result, PathResult::bad_chars);
+  EXPECT_EQ(parse_envelope_path("TO:<" + std::string(257, 'a') + ">", "to", false).result, PathResult::too_long);
+}
+
 TEST(Relay, StrangersMayNotRelayWhileTheSiteNetworkMay) {
   AddressList none;
   EXPECT_TRUE(relay_permitted(ip("127.0.0.1"), none));

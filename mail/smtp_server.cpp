@@ -11,6 +11,7 @@
 #include <ctime>
 #include <memory>
 #include <unordered_map>
+#include <vector>
 
 #include "core/config.h"
 #include "core/globals.h"
@@ -54,7 +55,7 @@ struct SmtpSession final : SessionData {
   bool committed = false;
   int commit_error = 0;
   int denial = 0;        // 1 reject list, 2 not a local user, 3 may not send now
-  int recipients = 0;
+  std::vector<std::string> recipients;  // accepted, each once
   bool write_failed = false;
   bool skipping_line = false;  // the rest of an overlong line is discarded
   std::shared_ptr<const GroupOptions> group;
@@ -64,7 +65,7 @@ struct SmtpSession final : SessionData {
   ~SmtpSession() override { queue_file_discard(queue); }
   void discard() {
     queue_file_discard(queue);
-    recipients = 0;
+    recipients.clear();
     write_failed = false;
   }
 };
@@ -82,16 +83,17 @@ void reply(SocketRecord& r, std::string_view text) {
 
 std::string clip(std::string_view text, std::size_t max) { return std::string(text.substr(0, max)); }
 
+// The reply to a MAIL or RCPT argument that holds no usable address.
+bool refused_path(SocketRecord& r, const EnvelopePath& path, const char* syntax) {
+  if (path.result == PathResult::ok) return false;
+  reply(r, path.result == PathResult::too_long ? "501 Address too long\r\n" : syntax);
+  return true;
+}
+
 void cmd_mail(SocketRecord& r, SmtpSession& s, std::string_view arg) {
-  if (!envelope_keyword(arg, "from")) {
-    reply(r, "501 Syntax: MAIL FROM:<address>\r\n");
-    return;
-  }
-  std::string_view sender = envelope_address(arg);
-  if (sender.size() > kMaxAddress) {
-    reply(r, "501 Address too long\r\n");
-    return;
-  }
+  EnvelopePath path = parse_envelope_path(arg, "from", true);
+  if (refused_path(r, path, "501 Syntax: MAIL FROM:<address>\r\n")) return;
+  std::string_view sender = path.address;
   s.discard();
   s.denial = 0;
   s.group.reset();
@@ -119,8 +121,8 @@ void cmd_mail(SocketRecord& r, SmtpSession& s, std::string_view arg) {
     s.queue = std::move(p.file);
     s.queue_path = std::move(p.path);
     s.queue_hidden = std::move(p.hidden);
-    std::string line = "MAIL " + std::string(line_cut(arg)) + "\r\n";
-    if (filecache_write(s.queue, line) != 0) {
+    // The file holds the address as judged here, never the client's line.
+    if (filecache_write(s.queue, "MAIL FROM:<" + std::string(sender) + ">\r\n") != 0) {
       s.discard();
       reply(r, kLocalError);
       return;
@@ -142,13 +144,15 @@ void cmd_rcpt(SocketRecord& r, SmtpSession& s, std::string_view arg) {
     reply(r, "503 Need MAIL before RCPT\r\n");
     return;
   }
-  std::string_view address = envelope_keyword(arg, "to") ? envelope_address(arg) : std::string_view{};
-  if (address.empty()) {
-    reply(r, "501 Syntax: RCPT TO:<address>\r\n");
+  EnvelopePath path = parse_envelope_path(arg, "to", false);
+  if (refused_path(r, path, "501 Syntax: RCPT TO:<address>\r\n")) return;
+  std::string_view address = path.address;
+  if (std::find(s.recipients.begin(), s.recipients.end(), address) != s.recipients.end()) {
+    reply(r, "250 OK Recipient syntactically correct\r\n");  // once is enough
     return;
   }
-  if (address.size() > kMaxAddress) {
-    reply(r, "501 Address too long\r\n");
+  if (s.recipients.size() >= kMaxRecipients) {
+    reply(r, "452 Too many recipients\r\n");
     return;
   }
   if (s.group && !(s.group->mail_flags & gflag::mail_override)) {
@@ -164,12 +168,12 @@ void cmd_rcpt(SocketRecord& r, SmtpSession& s, std::string_view arg) {
     reply(r, "550 Posting to this address forbidden\r\n");
     return;
   }
-  if (filecache_write(s.queue, "RCPT " + std::string(line_cut(arg)) + "\r\n") != 0) {
+  if (filecache_write(s.queue, "RCPT TO:<" + std::string(address) + ">\r\n") != 0) {
     s.discard();
     reply(r, kLocalError);
     return;
   }
-  ++s.recipients;
+  s.recipients.emplace_back(address);
   reply(r, "250 OK Recipient syntactically correct\r\n");
 }
 
@@ -178,7 +182,7 @@ void cmd_data(SocketRecord& r, SmtpSession& s) {
     reply(r, "503 Need MAIL before DATA\r\n");
     return;
   }
-  if (s.recipients == 0) {
+  if (s.recipients.empty()) {
     reply(r, "503 Need RCPT before DATA\r\n");
     return;
   }
@@ -247,8 +251,8 @@ void commands(SocketRecord& r, SmtpSession& s) {
     std::string_view input = r.read_buf.view();
     std::size_t end = input.find_first_of("\r\n");
     if (end == std::string_view::npos) {
-      if (r.read_buf.room() > 0) return;  // the rest of the line is still coming
-      // A full buffer without a line end: refuse the line, keep the session.
+      if (input.size() <= kMaxCommandLine && r.read_buf.room() > 0) return;  // the rest is still coming
+      // Over the limit and no line end yet: refuse the line, keep the session.
       if (!s.skipping_line) reply(r, "500 Line too long\r\n");
       s.skipping_line = true;
       r.read_buf.clear();
@@ -260,6 +264,10 @@ void commands(SocketRecord& r, SmtpSession& s) {
     while (next < input.size() && (input[next] == '\r' || input[next] == '\n')) ++next;
     if (s.skipping_line) {
       s.skipping_line = false;
+    } else if (line.size() > kMaxCommandLine) {
+      // Never acted on in part: what is judged is what gets stored.
+      reply(r, "500 Line too long\r\n");
+      r.state = state::reply;
     } else {
       command(r, s, line);
     }
@@ -304,7 +312,7 @@ void commit_done(int owner, int error) {
 void commit_reply(SocketRecord& r, SmtpSession& s) {
   reply(r, s.commit_error == 0 ? "250 OK\r\n" : kLocalError);
   s.committed = false;
-  s.recipients = 0;
+  s.recipients.clear();
   r.want_write = false;
   r.state = state::reply;
 }

@@ -98,8 +98,11 @@ def set_keys(path, values):
 class Suite:
     """One private installation and its daemon."""
 
-    def __init__(self, config=None, init_args=()):
+    def __init__(self, config=None, init_args=(), bind='127.0.0.1'):
+        """`bind` is the one address the listeners use (a test's network
+        namespace may need another than loopback)."""
         self.root = tempfile.mkdtemp(prefix='velmor-e2e-')
+        self.bind = bind
         self.proc = None
         self._out = None
         self.init_output = self._run([VELMOR_BIN, '--root', self.root, '--init'] + list(init_args))
@@ -154,7 +157,7 @@ class Suite:
         """Starts the daemon without waiting for it."""
         self._close_out()
         self._out = open(self.path('daemon.out'), 'ab')
-        self.proc = subprocess.Popen([VELMOR_BIN, '--root', self.root, '--bind', '127.0.0.1'] + list(extra),
+        self.proc = subprocess.Popen([VELMOR_BIN, '--root', self.root, '--bind', self.bind] + list(extra),
                                      stdin=subprocess.DEVNULL, stdout=self._out, stderr=subprocess.STDOUT,
                                      cwd=self.root)
         return self.proc

@@ -142,8 +142,9 @@ class LocalDeliveryTest(QueueCase):
         self.send('ann@far.example', ['demo_work@site.example'], 'Subject: sub\r\n\r\nthree\r\n')
         self.debatch_all()
         inbox = read(self.suite.path('home/demo/mail/inbox'))
-        self.assertEqual(inbox.count(b'\r\nX-RCPT-TO: demo\r\n'), 3)
-        self.assertEqual(inbox.count(b'Subject: expanded\r\n'), 2)
+        # The alias and the list both name demo: one copy is enough.
+        self.assertEqual(inbox.count(b'\r\nX-RCPT-TO: demo\r\n'), 2)
+        self.assertEqual(inbox.count(b'Subject: expanded\r\n'), 1)
         self.assertIn(b'Subject: direct\r\n', inbox)
         self.assertIn(b'Subject: sub\r\n', read(self.suite.path('home/demo/mail/work')))
         [out] = self.outgoing()

@@ -12,6 +12,7 @@ import threading
 import time
 import unittest
 
+import netns
 from harness import Suite, SuiteTestCase
 
 NO_DEBATCH = {'mail.debatch.time': '0', 'mail.domains': 'localhost, site.example'}
@@ -192,6 +193,28 @@ class SmtpServerTest(SuiteTestCase):
             s.sendmail('a@far.example', ['postmaster@localhost'], 'Subject: after\r\n\r\nx\r\n')
         self.assertEqual(len(queue_files(self.suite)), 1)
 
+    def test_envelopes_are_stored_as_judged_each_recipient_once_and_at_most_a_hundred(self):
+        recipients = ['postmaster@localhost'] * 3 + ['u%d@localhost' % i for i in range(100)]
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
+            refused = c.sendmail('ann@far.example', recipients, 'Subject: many\r\n\r\nx\r\n')
+        self.assertEqual(refused, {'u99@localhost': (452, b'Too many recipients')})
+        envelope = read(queue_files(self.suite)[0]).split(b'\r\nDATA\r\n')[0].split(b'\r\n')
+        self.assertEqual(envelope[1:3], [b'RCPT TO:<postmaster@localhost>', b'RCPT TO:<u0@localhost>'])
+        self.assertEqual(len(envelope), 101)
+        # The file holds the addresses as parsed, never the client's lines;
+        # a line over the limit is refused whole, never acted on in part.
+        c = Conversation(self.suite.port('smtp'))
+        c.cmd('HELO me')
+        self.assertEqual(c.cmd('MAIL FROM: <ann@far.example>  '), '250 OK Sender accepted')
+        self.assertEqual(c.cmd('RCPT TO: <a b@localhost>'), '501 Syntax: RCPT TO:<address>')
+        self.assertEqual(c.cmd('RCPT TO:' + ' ' * 600 + '<postmaster@localhost>'), '500 Line too long')
+        self.assertEqual(c.cmd('rcpt to:   postmaster@localhost '), '250 OK Recipient syntactically correct')
+        self.assertTrue(c.cmd('DATA').startswith('354'))
+        self.assertEqual(c.cmd('Subject: s\r\n\r\nx\r\n.'), '250 OK')
+        c.close()
+        self.assertTrue(read(queue_files(self.suite)[1]).startswith(
+            b'MAIL FROM:<ann@far.example>\r\nRCPT TO:<postmaster@localhost>\r\nDATA\r\n'))
+
     @unittest.skipUnless(shutil.which('swaks'), 'swaks is not installed')
     def test_swaks(self):
         out = subprocess.run(['swaks', '--server', '127.0.0.1', '--port', str(self.suite.port('smtp')),
@@ -227,6 +250,34 @@ class RelayTest(SuiteTestCase):
         self.assertEqual(c.cmd('RCPT TO:<postmaster@site.example>'), '250 OK Recipient syntactically correct')
         self.assertEqual(c.cmd('TURN'), '502 TURN not available')
         c.close()
+
+
+class PublicPeerTest(unittest.TestCase):
+    """A stranger on a public address, seen by the relay check as it is."""
+
+    def test_a_padded_recipient_is_judged_as_it_would_be_delivered(self):
+        with netns.PublicPeer() as peer:
+            suite = Suite(config=dict(NO_DEBATCH, **{'mail.domains': 'localhost, *.example.com'}), bind=peer.host_ip)
+            try:
+                suite.start()
+                replies = peer.talk(suite.port('smtp'), [
+                    'HELO stranger', 'MAIL FROM:<someone@far.example>', 'RCPT TO:<victim@evil.org>',
+                    'RCPT TO:' + ' ' * 4072 + '<victim@evil.org.example.com>', 'RCPT TO:<demo@localhost>',
+                    'DATA', 'Subject: relay?\r\n\r\nbody\r\n.', 'QUIT'])
+                self.assertEqual(replies[3:6], ['550 Posting to this address forbidden', '500 Line too long',
+                                                '250 OK Recipient syntactically correct'])
+                self.assertEqual(replies[7], '250 OK')
+                [queued] = queue_files(suite)
+                self.assertTrue(read(queued).startswith(
+                    b'MAIL FROM:<someone@far.example>\r\nRCPT TO:<demo@localhost>\r\nDATA\r\n'))
+                deadline = time.monotonic() + 15
+                while queue_files(suite) and time.monotonic() < deadline:
+                    suite.ctl('maildebatch')
+                    time.sleep(0.1)
+                self.assertEqual(queue_files(suite), [])
+                self.assertFalse(any(b'evil.org' in read(p) for p in queue_files(suite, 'mail/out')))
+            finally:
+                suite.cleanup()
 
 
 class BlockTest(SuiteTestCase):
