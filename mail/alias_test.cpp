@@ -142,6 +142,9 @@ TEST(AliasResolve, TimedTargetsFollowTheClock) {
   Recorder evening;
   evening.hour = 19;
   EXPECT_FALSE(alias_resolve(table, "desk", evening));
+  // Each number counts modulo 256 however long it is: this window ends at
+  // 12:30 (a number past the range of int once read as 11:00 to midnight).
+  EXPECT_FALSE(alias_resolve(alias_parse("late [11:00-100000000000000000012:30]ann\n"), "late", night));
 }
 
 }  // namespace
