@@ -1,6 +1,7 @@
 #include "mail/alias.h"
 
 #include <cstdlib>
+#include <unordered_map>
 
 #include "core/config.h"
 #include "core/filecache.h"
@@ -43,6 +44,23 @@ struct Resolver {
   AliasSink& sink;
   int steps = 0;
   bool looped = false;
+  // The entry each recipient met so far resolves through: a fan-out meets
+  // the same names again and again, and every fresh lookup scans the table
+  // (thousands of steps through a long table stalled the suite for seconds).
+  std::unordered_map<std::string, const AliasEntry*> found;
+
+  const AliasEntry* lookup(std::string_view recipient) {
+    auto [it, fresh] = found.try_emplace(std::string(recipient), nullptr);
+    if (fresh) {
+      for (const AliasEntry& e : table) {
+        if (wildcard_match(recipient, e.name)) {
+          it->second = &e;
+          break;
+        }
+      }
+    }
+    return it->second;
+  }
 
   void report_loop() {
     if (!looped) sink.loop_report();
@@ -71,13 +89,7 @@ struct Resolver {
       report_loop();
       return false;
     }
-    const AliasEntry* entry = nullptr;
-    for (const AliasEntry& e : table) {
-      if (wildcard_match(recipient, e.name)) {
-        entry = &e;
-        break;
-      }
-    }
+    const AliasEntry* entry = lookup(recipient);
     if (!entry) return false;
     if (++depth > kMaxDepth) {
       report_loop();
@@ -209,7 +221,7 @@ std::vector<AliasEntry> alias_parse(std::string_view file_text) {
 std::vector<AliasEntry>& alias_table() { return g_table; }
 
 bool alias_resolve(const std::vector<AliasEntry>& table, std::string_view recipient, AliasSink& sink) {
-  Resolver r{table, sink};
+  Resolver r{table, sink, 0, false, {}};
   return r.resolve(recipient, 0);
 }
 
