@@ -1,5 +1,5 @@
 // Any text as a log routing file: log_parse never crashes or overflows a
-// setting, and channel 1's path is the one its last route names.
+// setting, and replaces what the text before it routed.
 #include <cstddef>
 #include <cstdint>
 #include <string_view>
