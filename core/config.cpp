@@ -13,6 +13,7 @@
 #include <climits>
 #include <cstdio>
 #include <fstream>
+#include <iterator>
 #include <unordered_map>
 
 #include "core/filecache.h"
@@ -137,6 +138,13 @@ std::string integer_text(const ConfigKeyInfo& k) {
   return strprintf("%d", *static_cast<std::int32_t*>(k.value) / k.multiplier);
 }
 
+// Takes the next line (up to LF) off the front of `text`.
+std::string_view next_line(std::string_view& text) {
+  std::string_view line = text.substr(0, text.find('\n'));
+  text.remove_prefix(std::min(line.size() + 1, text.size()));
+  return line;
+}
+
 // Applies one key of the master file; unknown keys are ignored.
 void apply_key(std::string_view key, std::string_view value) {
   if (!key.empty()) config_key(key, value);
@@ -255,13 +263,18 @@ int config_load_file(const std::string& path) {
     std::fflush(stdout);
     return 1;
   }
+  config_parse(std::string(std::istreambuf_iterator<char>(in), {}));
+  return 0;
+}
+
+void config_parse(std::string_view text) {
   std::string key;
   std::string value;
   bool in_key = false;
-  std::string line;
-  while (std::getline(in, line)) {
+  while (!text.empty()) {
+    std::string_view line = next_line(text);
     if (line.empty() || line[0] == '|' || line[0] == '\r') continue;
-    while (!line.empty() && (line.back() == '\r' || line.back() == '\n')) line.pop_back();
+    while (!line.empty() && line.back() == '\r') line.remove_suffix(1);
     std::string_view rest = line;
     if (rest[0] == '%') {
       if (in_key) apply_key(key, value);
@@ -277,7 +290,6 @@ int config_load_file(const std::string& path) {
     value += rest;
   }
   if (in_key) apply_key(key, value);
-  return 0;
 }
 
 int config_save() { return config_save_files(paths.master_template(), paths.master()); }
@@ -285,9 +297,15 @@ int config_save() { return config_save_files(paths.master_template(), paths.mast
 int config_save_files(const std::string& template_path, const std::string& master_path) {
   std::ifstream in(template_path, std::ios::binary);
   if (!in) return ENOENT;
+  std::string template_text(std::istreambuf_iterator<char>(in), {});
+  if (in.bad()) return EIO;
+  return file_write_atomic(master_path, config_text(template_text), /*backup=*/true, 0640);
+}
+
+std::string config_text(std::string_view template_text) {
   std::string out;
-  std::string line;
-  while (std::getline(in, line)) {
+  while (!template_text.empty()) {
+    std::string_view line = next_line(template_text);
     if (line.empty()) continue;
     if (line[0] == '|') {
       out += line;
@@ -323,8 +341,7 @@ int config_save_files(const std::string& template_path, const std::string& maste
     }
     out += '\n';
   }
-  if (in.bad()) return EIO;
-  return file_write_atomic(master_path, out, /*backup=*/true, 0640);
+  return out;
 }
 
 }  // namespace velmor

@@ -292,6 +292,8 @@ const std::vector<ConfigKeyInfo>& config_keys();
 // cannot be opened (after "Couldn't open config file:%s\n" on stdout).
 int config_load();
 int config_load_file(const std::string& path);
+// What config_load_file does with the file's text: applies every key in it.
+void config_parse(std::string_view text);
 
 // Sets a key from its text form. Unknown keys are ignored. Returns 0.
 int config_key(std::string_view key, std::string_view value);
@@ -304,6 +306,9 @@ std::optional<std::string> config_key(std::string_view key);
 // existing master file is then left as it was.
 int config_save();
 int config_save_files(const std::string& template_path, const std::string& master_path);
+// The master file config_save writes for the template text: comment lines
+// kept, each known key given its current value.
+std::string config_text(std::string_view template_text);
 
 // Resets every setting to its built-in default (used by tests and --init).
 void config_reset();

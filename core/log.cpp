@@ -149,7 +149,6 @@ void parse_route(std::string_view line) {
     f->max_size = number(4) * 1024;
     f->keep = static_cast<int>(std::clamp(number(5), 0LL, 1000LL));
     f->next_flush = server_now;
-    make_parent_dirs(path);
     file = f.get();
     files.push_back(std::move(f));
   }
@@ -167,11 +166,17 @@ int log_init() {
     std::fflush(stdout);
     return 1;
   }
-  for_each_line(*text, [](std::string_view line) {
+  log_parse(*text);
+  for (const auto& f : files) make_parent_dirs(f->path);
+  return 0;
+}
+
+void log_parse(std::string_view text) {
+  log_reset();
+  for_each_line(text, [](std::string_view line) {
     if (!line.empty() && line[0] >= '0' && line[0] <= '9') parse_route(line);
   });
   if (LogFile* f = route_for(logchan::errors)) error_path = f->path;
-  return 0;
 }
 
 void log_reset() {

@@ -53,6 +53,9 @@ inline constexpr int kLogNoNewline = 8;
 // Reads the log configuration file (config.file_log_master). 0; 1 when the file
 // cannot be opened (after "couldn't open log config file:'%s'\n" on stdout).
 int log_init();
+// What log_init does with the file's text: replaces every route and file
+// with those of the text (creating no folders).
+void log_parse(std::string_view text);
 
 // The log call: a stamped line "time prefix text value" on channel 2 when
 // `facility` is enabled in log_mask. The main log is flushed at once.

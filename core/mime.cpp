@@ -105,11 +105,16 @@ int mime_map_load() {
   mime_map_clear();  // a reload replaces the map
   std::optional<std::string> text = read_text_file(text_of(config.file_mimetypes));
   if (!text) return 1;
-  for_each_line(*text, [](std::string_view line) {
+  mime_map_parse(*text);
+  return 0;
+}
+
+void mime_map_parse(std::string_view text) {
+  mime_map_clear();
+  for_each_line(text, [](std::string_view line) {
     char c = line.empty() ? 0 : line[0];
     if ((c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z')) parse_line(line);
   });
-  return 0;
 }
 
 void mime_map_clear() { entries.clear(); }

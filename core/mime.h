@@ -12,6 +12,7 @@ inline constexpr int kFiletypeData = 0xFFD;  // 4093
 inline constexpr int kFiletypeTemp = 0xFFF;  // 4095
 
 int mime_map_load();  // 0 loaded, 1 the file cannot be opened
+void mime_map_parse(std::string_view text);  // replaces the map with the text's entries
 void mime_map_clear();
 std::string mime_type_for_extension(std::string_view text);
 std::string mime_type_for_filetype(int filetype);

@@ -105,25 +105,29 @@ int schedule_load() {
   if (path.empty()) return 0;
   std::optional<std::string> text = read_text_file(path);
   if (!text) return 0;  // no task file: nothing to run
-  std::string_view rest = *text;
-  while (!rest.empty()) {
-    std::size_t end = rest.find_first_of("\r\n");
-    std::string_view line = rest.substr(0, end);
-    rest = end == std::string_view::npos ? std::string_view() : rest.substr(end + 1);
-    if (line.empty() || line[0] == '|' || is_blank(line[0])) continue;
-    ScheduleTask task;
-    if (parse_task(line, task)) tasks.push_back(std::move(task));
-    else log_message("Scheduler - task line not understood, ignored: ", line.substr(0, 80));
-  }
+  tasks = schedule_parse(*text);
   return 0;
 }
 
-int schedule_save() {
-  std::string text;
-  for (const auto& t : schedule_tasks())
-    text += t.mins + " " + t.hours + " " + t.wdays + " " + t.mdays + " " + t.months + " " + t.command + "\n";
-  return file_write_atomic(text_of(config.file_schedule), text);
+std::vector<ScheduleTask> schedule_parse(std::string_view text) {
+  std::vector<ScheduleTask> tasks;
+  for_each_line(text, [&](std::string_view line) {
+    if (line.empty() || line[0] == '|' || is_blank(line[0])) return;
+    ScheduleTask task;
+    if (parse_task(line, task)) tasks.push_back(std::move(task));
+    else log_message("Scheduler - task line not understood, ignored: ", line.substr(0, 80));
+  });
+  return tasks;
 }
+
+std::string schedule_text(const std::vector<ScheduleTask>& tasks) {
+  std::string text;
+  for (const auto& t : tasks)
+    text += t.mins + " " + t.hours + " " + t.wdays + " " + t.mdays + " " + t.months + " " + t.command + "\n";
+  return text;
+}
+
+int schedule_save() { return file_write_atomic(text_of(config.file_schedule), schedule_text(schedule_tasks())); }
 
 void schedule_poll() {
   if (server_now % 60 > 29) return;

@@ -15,6 +15,9 @@ struct ScheduleTask {
 
 int schedule_load();   // reads config.file_schedule; a missing file is an empty list
 int schedule_save();   // writes the list back
+// The tasks of a task file's text, and the text schedule_save writes.
+std::vector<ScheduleTask> schedule_parse(std::string_view text);
+std::string schedule_text(const std::vector<ScheduleTask>& tasks);
 void schedule_poll();  // once per main-loop iteration
 bool field_match(std::string_view field, int value);
 std::vector<ScheduleTask>& schedule_tasks();

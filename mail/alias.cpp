@@ -1,7 +1,7 @@
 #include "mail/alias.h"
 
-#include <cstdio>
 #include <cstdlib>
+#include <unordered_map>
 
 #include "core/config.h"
 #include "core/filecache.h"
@@ -22,11 +22,45 @@ bool is_separator(char c) { return c == ' ' || c == '\t' || c == ','; }
 constexpr int kMaxDepth = 10;
 constexpr int kMaxSteps = 10000;
 
+// The window of a timed target, "[HH:MM-HH:MM]...", each end packed as
+// hour * 256 + minute. Every number counts modulo 256 however many digits
+// it has, so no text can overflow it.
+bool parse_window(std::string_view text, int& start, int& end) {
+  std::size_t i = 1;
+  int n[4] = {};
+  for (int k = 0; k < 4; ++k) {
+    if (k > 0 && (i >= text.size() || text[i++] != ":-:"[k - 1])) return false;
+    std::size_t first = i;
+    for (; i < text.size() && text[i] >= '0' && text[i] <= '9'; ++i) n[k] = (n[k] * 10 + (text[i] - '0')) % 256;
+    if (i == first) return false;
+  }
+  start = (n[0] << 8) | n[1];
+  end = (n[2] << 8) | n[3];
+  return true;
+}
+
 struct Resolver {
   const std::vector<AliasEntry>& table;
   AliasSink& sink;
   int steps = 0;
   bool looped = false;
+  // The entry each recipient met so far resolves through: a fan-out meets
+  // the same names again and again, and every fresh lookup scans the table
+  // (thousands of steps through a long table stalled the suite for seconds).
+  std::unordered_map<std::string, const AliasEntry*> found;
+
+  const AliasEntry* lookup(std::string_view recipient) {
+    auto [it, fresh] = found.try_emplace(std::string(recipient), nullptr);
+    if (fresh) {
+      for (const AliasEntry& e : table) {
+        if (wildcard_match(recipient, e.name)) {
+          it->second = &e;
+          break;
+        }
+      }
+    }
+    return it->second;
+  }
 
   void report_loop() {
     if (!looped) sink.loop_report();
@@ -55,13 +89,7 @@ struct Resolver {
       report_loop();
       return false;
     }
-    const AliasEntry* entry = nullptr;
-    for (const AliasEntry& e : table) {
-      if (wildcard_match(recipient, e.name)) {
-        entry = &e;
-        break;
-      }
-    }
+    const AliasEntry* entry = lookup(recipient);
     if (!entry) return false;
     if (++depth > kMaxDepth) {
       report_loop();
@@ -76,11 +104,9 @@ struct Resolver {
           break;
         case AliasKind::timed: {
           std::size_t close = t.text.find(']');
-          if (close == std::string::npos) break;
-          int h1 = 0, m1 = 0, h2 = 0, m2 = 0;
-          if (std::sscanf(t.text.c_str(), "[%d:%d-%d:%d]", &h1, &m1, &h2, &m2) != 4) break;
+          int start = 0, end = 0;
+          if (close == std::string::npos || !parse_window(t.text, start, end)) break;
           std::tm now = sink.local_time();
-          int start = ((h1 % 256) << 8) | (m1 % 256), end = ((h2 % 256) << 8) | (m2 % 256);
           if (!time_in_window(now, start, end)) break;
           handled = true;
           std::string_view rest = std::string_view(t.text).substr(close + 1);
@@ -195,7 +221,7 @@ std::vector<AliasEntry> alias_parse(std::string_view file_text) {
 std::vector<AliasEntry>& alias_table() { return g_table; }
 
 bool alias_resolve(const std::vector<AliasEntry>& table, std::string_view recipient, AliasSink& sink) {
-  Resolver r{table, sink};
+  Resolver r{table, sink, 0, false, {}};
   return r.resolve(recipient, 0);
 }
 

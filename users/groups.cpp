@@ -257,6 +257,18 @@ int groups_load(const std::string& path) {
   GroupList& g = groups();
   g.path = path;
   g.sets.clear();
+  try {
+    std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
+    if (!text) return 1;
+    return groups_parse(*text);
+  } catch (const std::bad_alloc&) {
+    return 2;
+  }
+}
+
+int groups_parse(std::string_view file_text) {
+  GroupList& g = groups();
+  g.sets.clear();
   std::vector<std::shared_ptr<GroupOptions>> sets;
   // A key's value is applied when the next key line, group line or the end of
   // the file is reached, so continuation lines can extend it first.
@@ -294,9 +306,7 @@ int groups_load(const std::string& path) {
     value += more;
   };
   try {
-    std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
-    if (!text) return 1;
-    for_each_line(*text, read_line);
+    for_each_line(file_text, read_line);
     apply();
   } catch (const std::bad_alloc&) {
     g.sets = std::move(sets);  // the sets read so far stay
@@ -306,11 +316,9 @@ int groups_load(const std::string& path) {
   return 0;
 }
 
-int groups_save() {
-  GroupList& g = groups();
-  if (g.path.empty()) return ENOENT;
+std::string groups_text() {
   std::string text;
-  for (const auto& set : g.sets) {
+  for (const auto& set : groups().sets) {
     strappendf(text, "#%d\n", set->number);
     for (std::size_t i = 0; i < kOptionCount; ++i) {
       // An unset text option is left out, so it reloads unset rather than
@@ -324,7 +332,13 @@ int groups_save() {
       text += '\n';
     }
   }
-  int err = file_write_atomic(g.path, text, true, 0600);
+  return text;
+}
+
+int groups_save() {
+  GroupList& g = groups();
+  if (g.path.empty()) return ENOENT;
+  int err = file_write_atomic(g.path, groups_text(), true, 0600);
   if (err != 0) log_message("Couldn't save user group file: ", g.path + ": " + std::strerror(err));
   return err;
 }

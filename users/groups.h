@@ -60,6 +60,11 @@ inline bool group_permits(const std::shared_ptr<const GroupOptions>& set, std::s
 // Replaces the list with the file's sets. A missing file leaves no sets at
 // all (no default group). 0; 1 cannot open; 2 no memory.
 int groups_load(const std::string& path);
+// What groups_load does with the file's text: replaces the list with its
+// sets (the file groups_save writes is unchanged). 0; 2 no memory.
+int groups_parse(std::string_view text);
+// The text groups_save writes for the list.
+std::string groups_text();
 // Writes the list to the file it was loaded from (temporary name, fsync,
 // rename; the old file kept as <file>~). 0, or an errno value when the file
 // could not be written, the old file then left as it was.

@@ -182,9 +182,11 @@ std::optional<UserRecord> parse_line(std::string_view line) {
   return user;
 }
 
+// Joined rather than printed with "%s", so a NUL byte read from the file is
+// written back instead of cutting its field short.
 std::string record_line(const UserRecord& u) {
-  return strprintf("%s,%s,%s,%s,%d\n", u.login.c_str(), u.password_hash.c_str(),
-                   u.full_name.c_str(), u.home.c_str(), u.group);
+  return u.login + ',' + u.password_hash + ',' + u.full_name + ',' + u.home + ',' +
+         std::to_string(u.group) + '\n';
 }
 
 // Saves the table; on failure runs `undo`, so the table matches the file.
@@ -222,7 +224,17 @@ int user_load(const std::string& path) {
   try {
     std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
     if (!text) return 1;
-    for_each_line(*text, [&](std::string_view line) {
+    return users_parse(*text);
+  } catch (const std::bad_alloc&) {
+    return 2;
+  }
+}
+
+int users_parse(std::string_view text) {
+  UserTable& t = table();
+  for (auto& bucket : t.buckets) bucket.clear();
+  try {
+    for_each_line(text, [&](std::string_view line) {
       if (auto user = parse_line(line)) {
         int b = bucket_of(user->login);
         t.buckets[b].push_back(std::make_unique<UserRecord>(std::move(*user)));
@@ -234,14 +246,18 @@ int user_load(const std::string& path) {
   return 0;
 }
 
+std::string users_text() {
+  std::string text;
+  for (const auto& bucket : table().buckets) {
+    for (const auto& user : bucket) text += record_line(*user);
+  }
+  return text;
+}
+
 int user_save() {
   UserTable& t = table();
   if (t.path.empty()) return ENOENT;
-  std::string text;
-  for (const auto& bucket : t.buckets) {
-    for (const auto& user : bucket) text += record_line(*user);
-  }
-  int err = file_write_atomic(t.path, text, true, 0600);
+  int err = file_write_atomic(t.path, users_text(), true, 0600);
   // The backup holds password hashes too, whatever mode the old file had.
   if (err == 0) ::chmod((t.path + "~").c_str(), 0600);
   if (err != 0) {

@@ -28,6 +28,11 @@ struct UserRecord {
 };
 
 int user_load(const std::string& path);  // 0; 1 cannot open (table empty); 2 no memory
+// What user_load does with the file's text: replaces the table with its
+// users (the file user_save writes is unchanged). 0; 2 no memory.
+int users_parse(std::string_view text);
+// The text user_save writes for the table.
+std::string users_text();
 // Writes the whole table to the file it was loaded from (temporary name,
 // fsync, rename; the old file kept as <file>~; mode 0600). 0; an errno value
 // when the file could not be written, the old file then left as it was.

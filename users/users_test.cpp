@@ -93,6 +93,14 @@ TEST_F(UsersTest, ReadsTheFileAsWrittenAndSavesItBackUnchanged) {
   EXPECT_EQ(user_find("alice")->password_hash, kSecretHash);
 }
 
+// A NUL byte that found its way into the file is written back, not taken as
+// the end of its field (which renamed the user "a\0b" to "a").
+TEST_F(UsersTest, ANulByteInTheFileIsSavedBackUnchanged) {
+  std::string text("a\0b,hash,Ann\0Lee,/home/a,1\n", 27);
+  ASSERT_EQ(users_parse(text), 0);
+  EXPECT_EQ(users_text(), text);
+}
+
 TEST_F(UsersTest, FindsByLoginDottedFullNameAndInitials) {
   load(std::string("eve,") + kSecretHash + ",Eve Ray Moss,/home/eve,0\n" +
        "Ann," + kSecretHash + ",Ann Lee,/home/ann,0\n" +
