@@ -694,11 +694,13 @@ int commit(const std::shared_ptr<CacheData>& dp) {
     ::unlink(d.disk_path.c_str());
     return err;
   }
-  sync_parent_dir(d.path);
+  // The new file is in place; a folder that cannot be synced may still lose
+  // the rename in a crash, so the caller is told, and keeps its own copy.
+  err = sync_parent_dir(d.path);
   d.disk_path = d.path;
   refresh_stamp(d);
   list_entry(dp);
-  return 0;
+  return err;
 }
 
 // Closes one handle. `purge` also drops the entry when nobody else has it.

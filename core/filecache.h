@@ -98,7 +98,8 @@ int filecache_copy(CacheFile& source, std::uint64_t offset, CacheFile& destinati
 // Closes the handle: a writing mode writes its window back (write mode syncs
 // and renames into place); the entry then stays cached for readers. Returns 0
 // or the errno value of the failed write, sync or rename; on failure the old
-// file is untouched.
+// file is untouched, except when only the folder sync after the rename
+// failed: the new file is then in place but may not survive a crash.
 int filecache_close(CacheFile& file);
 // Close and drop the entry from memory when nobody else has it open.
 int filecache_purge(CacheFile& file);

@@ -339,6 +339,11 @@ TEST_F(FileCacheTest, ARewriteSyncsBeforeItsRenameAndKeepsTheOldFileOnFailure) {
     EXPECT_EQ(slurp(at("cfg")), "old\n");
     EXPECT_FALSE(file_is_regular(at(".cfg.new")));
   }
+  // A folder sync that fails after the rename is reported too: the caller
+  // must not count on the new file surviving a crash.
+  sysio::reset();
+  sysio::fail_nth(sysio::Op::sync, 2);
+  EXPECT_EQ(file_write_atomic(at("cfg"), "newer\n"), EIO);
   sysio::reset();
   EXPECT_EQ(file_write_atomic(at("cfg"), "new\n"), 0);
   EXPECT_EQ(slurp(at("cfg")), "new\n");
