@@ -32,6 +32,10 @@ void start_transfer() {
   run(hooks.smtpkick);
 }
 
+// A suite without the mail clients has nothing to wait for: the link is
+// dropped at once rather than held for the grace.
+bool no_mail_clients() { return !hooks.popkick && !hooks.smtpkick; }
+
 }  // namespace
 
 int internal_command(std::string_view word) {
@@ -72,7 +76,7 @@ void mail_transfer_poll() {
       start_transfer();
       break;
     case 2:
-      if (count(hooks.pop_client_count) || count(hooks.smtp_client_count) ||
+      if (count(hooks.pop_client_count) || count(hooks.smtp_client_count) || no_mail_clients() ||
           server_now - transfer_started >= kStartGrace)
         mail_transfer_state = 3;
       break;

@@ -103,6 +103,14 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   mail_transfer_poll();
   EXPECT_EQ(mail_transfer_state, 0);
   EXPECT_EQ(calls.back(), "disconnect");
+
+  // Without the mail clients nothing can start: no grace.
+  hooks.popkick = hooks.smtpkick = nullptr;
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
 }
 
 }  // namespace
