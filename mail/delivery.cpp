@@ -646,7 +646,13 @@ struct LocalDelivery::State {
         limited.reset();
         written.reset();
         if (rec.total_length != at - slot.offset || next != kNoMessage) return failed(EIO);
-        mailbox_append_stage(*box, slot, std::move(rec), std::move(committed));
+        mailbox_append_stage(*box, slot, std::move(rec),
+                             [done = std::move(committed), login = r.user->login, where = path](int error) {
+                               if (error)
+                                 log_write("Mail delivery for `" + login + "' waits: " + where + ": " + error_text(error),
+                                           logchan::errors);
+                               if (done) done(error);
+                             });
         return LocalOutcome::staged;
       }
     }

@@ -361,6 +361,7 @@ int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live);
 
 constexpr std::uint64_t kCompactSlice = 256 * 1024;       // text written per piece
 constexpr std::uint64_t kStaleMinimum = 64 * 1024;        // dead text below this is left alone
+constexpr std::uint64_t kSmallOverview = 16 * 1024;       // rewritten whole rather than added to after a removal
 constexpr std::time_t kCompactRetrySeconds = 60;          // after a failed compaction
 
 struct Compaction {
@@ -1362,10 +1363,14 @@ int mailbox_expunge(Mailbox& box) {
   }
   append_pending_flags(text, box);
   append_trailer(text, box);
-  bool whole = box.overview_size == 0;
-  if (overview_append(box, text) == 0 && !whole) {
-    box.overview_live += added_live;
-    box.overview_live -= std::min(gone_live, box.overview_live);
+  box.overview_live += added_live;
+  box.overview_live -= std::min(gone_live, box.overview_live);
+  // A small overview is written afresh at once, which costs no more than
+  // the records would; a large one gets the records and is compacted later.
+  if (box.overview_live <= kSmallOverview) {
+    overview_write_whole(box);
+  } else {
+    overview_append(box, text);
   }
   return 0;
 }
