@@ -27,7 +27,8 @@ struct SuiteHooks {
 
   // Work a subsystem has in hand between ticks, run for a short slice after
   // each dispatcher pass; true while more remains, so the next pass does
-  // not wait for the tick.
+  // not wait for the tick. Called once more when quit_flag is set, to
+  // settle what it holds.
   std::function<bool()> background;
 
   // Control channel.

@@ -349,6 +349,8 @@ void poll() {
     busy = false;
     if (hooks.background && !quit_flag) guarded_poll("background", [&busy] { busy = hooks.background(); });
   }
+  // Told that the suite stops, background work settles what it holds.
+  if (hooks.background) guarded_poll("background", [] { hooks.background(); });
   progress_code = 0;
 }
 

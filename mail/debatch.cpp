@@ -50,7 +50,7 @@ constexpr int kMaxReceived = 30;
 // While files wait, slices follow each other with a dispatcher pass in
 // between, so a burst drains at full speed and a client waits for one slice
 // at most.
-constexpr auto kDebatchSlice = std::chrono::milliseconds(15);
+constexpr auto kDebatchSlice = std::chrono::milliseconds(10);
 // How long the overviews' upkeep may run in one go.
 constexpr auto kUpkeepSlice = std::chrono::milliseconds(4);
 
@@ -540,26 +540,36 @@ void debatch_settle() {
   for (auto& job : parked) debatch_finish(*job);
 }
 
+bool g_commit_due = false;  // a slice wrote local copies; its commit runs in the next pass
+
+DebatchStep step_in_slice(Clock::time_point deadline, bool settle);
+
 // Debatches until `deadline`; with `one_file`, stops at the end of a file.
-// What was written is committed before it returns.
-void debatch_for(Clock::time_point deadline, bool one_file) {
+// What was written is committed before it returns, or with `commit_later`
+// in the next call of mail_background(), so that a client waits for the
+// slice or for the syncs, never for both.
+void debatch_for(Clock::time_point deadline, bool one_file, bool commit_later = false) {
   for (;;) {
-    DebatchStep step = debatch_step(deadline);
+    DebatchStep step = step_in_slice(deadline, false);
     bool more = g_job || !queue_incoming().empty();
     if (step != DebatchStep::finished || one_file || !more || Clock::now() >= deadline) break;
   }
-  debatch_settle();
+  if (commit_later) {
+    g_commit_due = true;
+  } else {
+    debatch_settle();
+  }
   g_debatch_pending = g_job || !queue_incoming().empty();
 }
 
-}  // namespace
-
-DebatchStep debatch_step(Clock::time_point deadline) {
+// One step; with `settle`, a file ended when the deadline has passed (or
+// the last one) is committed and settled at once, else it waits in g_parked.
+DebatchStep step_in_slice(Clock::time_point deadline, bool settle) {
   if (!g_job) {
     std::size_t left = queue_incoming().size();
     std::optional<std::string> path = queue_pop_incoming();
     if (!path) {
-      debatch_settle();
+      if (settle) debatch_settle();
       log_message("Debatching mail - no articles in queue", {}, logfac::house);
       return DebatchStep::idle;
     }
@@ -579,9 +589,13 @@ DebatchStep debatch_step(Clock::time_point deadline) {
   // The file waits for the commit of its local copies; files that follow in
   // the same slice share it.
   g_parked.push_back(std::move(g_job));
-  if (Clock::now() >= deadline || queue_incoming().empty()) debatch_settle();
+  if (settle && (Clock::now() >= deadline || queue_incoming().empty())) debatch_settle();
   return DebatchStep::finished;
 }
+
+}  // namespace
+
+DebatchStep debatch_step(Clock::time_point deadline) { return step_in_slice(deadline, true); }
 
 void debatch_file(const std::string& path) {
   std::unique_ptr<Debatch> d = debatch_start(path);
@@ -643,8 +657,21 @@ void mail_poll() {
 }
 
 bool mail_background() {
+  if (quit_flag) {
+    // The suite stops: what was written is committed, and a message half
+    // written is taken back out of its mailbox (its file stays queued).
+    g_commit_due = false;
+    debatch_settle();
+    g_job.reset();
+    return false;
+  }
+  if (g_commit_due) {
+    g_commit_due = false;
+    debatch_settle();
+    return true;
+  }
   if (!g_debatch_pending && !mailbox_upkeep_running()) return false;
-  if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
+  if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false, true);
   bool more = mailbox_upkeep_running() && mailbox_upkeep(Clock::now() + kUpkeepSlice);
   return g_debatch_pending || more;
 }

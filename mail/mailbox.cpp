@@ -1277,6 +1277,9 @@ int mailbox_expunge(Mailbox& box) {
   bool any = std::any_of(box.messages.begin(), box.messages.end(),
                          [](const MessageRecord& m) { return m.flags & msgflag::deleted; });
   if (!any) return 0;
+  // Messages written but not yet committed are committed first, so that
+  // the new mailbox keeps them.
+  mailbox_commit_staged(box);
   // Everything happens inside the mailbox's folder, reached the safe way;
   // nothing is looked up by path again.
   SafeDir dir;
