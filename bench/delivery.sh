@@ -11,18 +11,8 @@ set -eu
 HERE=$(cd "$(dirname "$0")/.." && pwd)
 BUILD=${BUILD:-$HERE/build-bench}
 
-if [ ! -x /usr/lib/dovecot/dovecot-lda ]; then
-  # Installed without starting the system's own service.
-  made_policy=
-  if [ ! -e /usr/sbin/policy-rc.d ]; then
-    printf '#!/bin/sh\nexit 101\n' > /usr/sbin/policy-rc.d
-    chmod +x /usr/sbin/policy-rc.d
-    made_policy=1
-  fi
-  apt-get update -qq
-  DEBIAN_FRONTEND=noninteractive apt-get install -y -qq dovecot-core >/dev/null
-  [ -z "$made_policy" ] || rm -f /usr/sbin/policy-rc.d
-fi
+. "$HERE/bench/quiet_install.sh"
+[ -x /usr/lib/dovecot/dovecot-lda ] || quiet_install dovecot-core
 
 cmake -S "$HERE" -B "$BUILD" -G Ninja -DCMAKE_BUILD_TYPE=Release -DVELMOR_TESTS=OFF >/dev/null
 ninja -C "$BUILD" -j2 velmor velmorctl >/dev/null
