@@ -524,7 +524,7 @@ void cut_back(const Mailbox& box, const struct stat& seen, std::uint64_t length)
 void settle(Mailbox& box, FileSource& in, const struct stat& st) {
   // (a message being written lies behind `tail`)
   if (in.size() == box.tail || (box.appending && in.size() > box.tail)) return;
-  if (box.tail != box.bytes) appends_lost(box, EAGAIN);  // changed under our appends
+  if (box.tail != box.bytes || box.appending) appends_lost(box, EAGAIN);  // changed under our appends
   std::uint64_t known = box.bytes;
   if (in.size() == known) return;
   if (in.size() < known) {
