@@ -10,16 +10,8 @@ if [ -n "$1" ]; then
   export VELMOR_BIN="$1"
   export VELMORCTL_BIN="$(dirname "$1")/velmorctl"
 fi
+. bench/quiet_install.sh
 if ! command -v dovecot >/dev/null 2>&1 || [ ! -x /usr/lib/dovecot/pop3 ]; then
-  # Installed without starting the system's own service.
-  made_policy=
-  if [ ! -e /usr/sbin/policy-rc.d ]; then
-    printf '#!/bin/sh\nexit 101\n' > /usr/sbin/policy-rc.d
-    chmod +x /usr/sbin/policy-rc.d
-    made_policy=1
-  fi
-  apt-get update -qq
-  DEBIAN_FRONTEND=noninteractive apt-get install -y -qq dovecot-pop3d >/dev/null
-  [ -n "$made_policy" ] && rm -f /usr/sbin/policy-rc.d
+  quiet_install dovecot-pop3d
 fi
 exec python3 bench/pop3_bench.py

@@ -26,6 +26,7 @@
 #include "core/defaults.h"
 #include "core/filecache.h"
 #include "core/globals.h"
+#include "core/hooks.h"
 #include "core/log.h"
 #include "core/mime.h"
 #include "core/privileges.h"
@@ -329,11 +330,12 @@ void tick() {
 
 void poll() {
   std::int64_t next_tick = monotonic_ms() + kTickMs;
+  bool busy = false;  // background work waits: the dispatcher only looks for ready I/O
   while (!quit_flag) {
     progress_code = 1;
     server_now = std::time(nullptr);
     progress_code = 0;
-    wait_until(next_tick);
+    wait_until(busy ? monotonic_ms() : next_tick);
     progress_code = 1;
     server_now = std::time(nullptr);
     std::int64_t now = monotonic_ms();
@@ -344,7 +346,11 @@ void poll() {
       refresh_crash_stamp();
       tick();
     }
+    busy = false;
+    if (hooks.background && !quit_flag) guarded_poll("background", [&busy] { busy = hooks.background(); });
   }
+  // Told that the suite stops, background work settles what it holds.
+  if (hooks.background) guarded_poll("background", [] { hooks.background(); });
   progress_code = 0;
 }
 

@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <ctime>
+#include <deque>
 #include <memory>
 #include <set>
 
@@ -45,8 +46,13 @@ bool g_debatch_pending = false;
 
 // A message that has passed this many relays is looping.
 constexpr int kMaxReceived = 30;
-// How long one poll may debatch before the connections are served again.
-constexpr auto kDebatchSlice = std::chrono::milliseconds(100);
+// How long one slice may debatch before the connections are served again.
+// While files wait, slices follow each other with a dispatcher pass in
+// between, so a burst drains at full speed and a client waits for one slice
+// at most.
+constexpr auto kDebatchSlice = std::chrono::milliseconds(10);
+// How long the overviews' upkeep may run in one go.
+constexpr auto kUpkeepSlice = std::chrono::milliseconds(4);
 
 class Debatch final : public AliasSink {
  public:
@@ -102,28 +108,52 @@ class Debatch final : public AliasSink {
   }
   bool user_exists(std::string_view user) override { return velmor::user_exists(user); }
 
+  // A local copy is queued here and written by run_deliveries(), a piece
+  // at a time; it counts once its mailbox's commit has synced it.
   bool deliver_local(std::string_view user, std::string_view to_address) override {
     if (moved) return true;
     std::string recipient(to_address.empty() ? user : to_address);
     // One copy per mailbox, however many names lead there.
     std::string box = str_lower(user) + "/" + mailbox_box_for_address(recipient);
-    if (!mailboxes_.insert(box).second) return true;
-    int rc = mailbox_append(path_, recipient, env_.sender);
-    // Delivery may have moved the file aside (a mailbox it cannot open).
-    if (file_size(path_) < 0) moved = true;
-    if (rc == 1) {
-      ++copies;
-      return true;
-    }
-    if (rc == kAppendTemporaryFailure) {
-      fail(strprintf("Temporary failure delivering to `%.*s'", static_cast<int>(user.size()), user.data()),
-           true);
-      retry.push_back(std::move(recipient));
-      return true;
-    }
-    mailboxes_.erase(box);
-    return false;
+    if (mailboxes_.count(box)) return true;
+    if (!mailbox_recipient_known(recipient)) return false;
+    mailboxes_.insert(box);
+    // The queue file is read once for all its local recipients.
+    if (!message_) message_ = std::make_shared<QueuedMessage>(path_);
+    std::string who(user);
+    deliveries_.push_back({LocalDelivery(message_, recipient, env_.sender,
+                                         [this, recipient, who](int error) { committed(recipient, who, error); }),
+                           recipient, who});
+    return true;
   }
+
+  // Works on the queued local copies until `deadline`, one piece at least.
+  // True when none is left unfinished.
+  bool run_deliveries(Clock::time_point deadline) {
+    while (!deliveries_.empty()) {
+      if (moved) {
+        deliveries_.clear();
+        return true;
+      }
+      Pending& p = deliveries_.front();
+      LocalOutcome o = p.delivery.step(deadline);
+      if (o == LocalOutcome::working) return false;
+      // Delivery may have moved the file aside (a mailbox it cannot open).
+      if (file_size(path_) < 0) moved = true;
+      if (o == LocalOutcome::handled) {
+        ++copies;
+      } else if (o == LocalOutcome::temporary) {
+        temporary(p.recipient, p.user);
+      } else {
+        ++awaiting;
+      }
+      deliveries_.pop_front();
+      if (Clock::now() >= deadline && !deliveries_.empty()) return false;
+    }
+    return true;
+  }
+
+  int awaiting = 0;  // local copies written, waiting for their commit
 
   void deliver_remote(std::string_view address) override {
     if (moved || !remote_.emplace(address).second) return;
@@ -195,6 +225,20 @@ class Debatch final : public AliasSink {
     return tm;
   }
 
+  void temporary(const std::string& recipient, std::string_view user) {
+    fail(strprintf("Temporary failure delivering to `%.*s'", static_cast<int>(user.size()), user.data()), true);
+    retry.push_back(recipient);
+  }
+
+  void committed(const std::string& recipient, const std::string& user, int error) {
+    --awaiting;
+    if (error == 0) {
+      ++copies;
+    } else {
+      temporary(recipient, user);
+    }
+  }
+
   // ---- the outgoing file ----
   // Writes the message (from the DATA line) behind the envelope, syncs it and
   // puts it in the outgoing list. When it cannot be written, its recipients
@@ -252,6 +296,12 @@ class Debatch final : public AliasSink {
     return true;
   }
 
+  struct Pending {
+    LocalDelivery delivery;
+    std::string recipient, user;
+  };
+  std::shared_ptr<QueuedMessage> message_;
+  std::deque<Pending> deliveries_;
   CacheFile outgoing_;
   std::vector<std::string> outgoing_rcpts_;
   bool write_failed_ = false;
@@ -445,6 +495,7 @@ bool debatch_recipient(Debatch& d) {
 // for a later try after a temporary failure (cut down to the recipients
 // still to do), otherwise moved to oddments.
 void debatch_finish(Debatch& d) {
+  if (d.awaiting) mailbox_commit_staged();  // nothing is settled before its copies are
   d.finish_outgoing();
   log_write(d.trace, logchan::mail_trace, kLogNoStamp);
   const std::string& path = d.path_;
@@ -477,24 +528,48 @@ void debatch_finish(Debatch& d) {
   }
 }
 
-std::unique_ptr<Debatch> g_job;  // the file in hand
+std::unique_ptr<Debatch> g_job;                // the file in hand
+std::vector<std::unique_ptr<Debatch>> g_parked;  // files done, their local copies waiting for the commit
 
-// Debatches until `deadline`; with `one_file`, stops at the end of a file.
-void debatch_for(Clock::time_point deadline, bool one_file) {
-  for (;;) {
-    DebatchStep step = debatch_step(deadline);
-    g_debatch_pending = g_job || !queue_incoming().empty();
-    if (step != DebatchStep::finished || one_file || !g_debatch_pending || Clock::now() >= deadline) return;
-  }
+// Commits every local copy written so far (one sync of each mailbox and one
+// of its overview), then settles the files that waited for it.
+void debatch_settle() {
+  mailbox_commit_staged();
+  std::vector<std::unique_ptr<Debatch>> parked;
+  parked.swap(g_parked);
+  for (auto& job : parked) debatch_finish(*job);
 }
 
-}  // namespace
+bool g_commit_due = false;  // a slice wrote local copies; its commit runs in the next pass
 
-DebatchStep debatch_step(Clock::time_point deadline) {
+DebatchStep step_in_slice(Clock::time_point deadline, bool settle);
+
+// Debatches until `deadline`; with `one_file`, stops at the end of a file.
+// What was written is committed before it returns, or with `commit_later`
+// in the next call of mail_background(), so that a client waits for the
+// slice or for the syncs, never for both.
+void debatch_for(Clock::time_point deadline, bool one_file, bool commit_later = false) {
+  for (;;) {
+    DebatchStep step = step_in_slice(deadline, false);
+    bool more = g_job || !queue_incoming().empty();
+    if (step != DebatchStep::finished || one_file || !more || Clock::now() >= deadline) break;
+  }
+  if (commit_later) {
+    g_commit_due = true;
+  } else {
+    debatch_settle();
+  }
+  g_debatch_pending = g_job || !queue_incoming().empty();
+}
+
+// One step; with `settle`, a file ended when the deadline has passed (or
+// the last one) is committed and settled at once, else it waits in g_parked.
+DebatchStep step_in_slice(Clock::time_point deadline, bool settle) {
   if (!g_job) {
     std::size_t left = queue_incoming().size();
     std::optional<std::string> path = queue_pop_incoming();
     if (!path) {
+      if (settle) debatch_settle();
       log_message("Debatching mail - no articles in queue", {}, logfac::house);
       return DebatchStep::idle;
     }
@@ -503,18 +578,32 @@ DebatchStep debatch_step(Clock::time_point deadline) {
     if (!g_job) return DebatchStep::finished;
   }
   // One recipient at least, then the connections get their turn.
-  while (debatch_recipient(*g_job))
-    if (g_job->more() && Clock::now() >= deadline) return DebatchStep::working;
-  debatch_finish(*g_job);
-  g_job.reset();
+  bool stepped = false;
+  for (;;) {
+    if (!g_job->run_deliveries(deadline)) return DebatchStep::working;
+    if (!g_job->more()) break;
+    if (stepped && Clock::now() >= deadline) return DebatchStep::working;
+    debatch_recipient(*g_job);
+    stepped = true;
+  }
+  // The file waits for the commit of its local copies; files that follow in
+  // the same slice share it.
+  g_parked.push_back(std::move(g_job));
+  if (settle && (Clock::now() >= deadline || queue_incoming().empty())) debatch_settle();
   return DebatchStep::finished;
 }
+
+}  // namespace
+
+DebatchStep debatch_step(Clock::time_point deadline) { return step_in_slice(deadline, true); }
 
 void debatch_file(const std::string& path) {
   std::unique_ptr<Debatch> d = debatch_start(path);
   if (!d) return;
   while (debatch_recipient(*d)) {
   }
+  d->run_deliveries(Clock::time_point::max());
+  mailbox_commit_staged();
   debatch_finish(*d);
 }
 
@@ -543,6 +632,7 @@ int mail_init() {
     queue_scan_incoming();
   };
   hooks.maildebatch = [] { mail_debatch_one(); };
+  hooks.background = mail_background;
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
   smtp_server_register();
@@ -560,9 +650,30 @@ void mail_poll() {
   if (!queue_incoming().empty() && config.mail_debatch_time > 0 &&
       server_now - g_last_traffic > config.mail_debatch_time)
     g_debatch_pending = true;
-  // A batch per poll, bounded in time: a busy queue neither waits one
-  // message per tick nor holds up the connections.
+  // A slice per poll, bounded in time; while files wait, mail_background()
+  // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
+  mailbox_upkeep(Clock::now() + kUpkeepSlice);
+}
+
+bool mail_background() {
+  if (quit_flag) {
+    // The suite stops: what was written is committed, and a message half
+    // written is taken back out of its mailbox (its file stays queued).
+    g_commit_due = false;
+    debatch_settle();
+    g_job.reset();
+    return false;
+  }
+  if (g_commit_due) {
+    g_commit_due = false;
+    debatch_settle();
+    return true;
+  }
+  if (!g_debatch_pending && !mailbox_upkeep_running()) return false;
+  if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false, true);
+  bool more = mailbox_upkeep_running() && mailbox_upkeep(Clock::now() + kUpkeepSlice);
+  return g_debatch_pending || more;
 }
 
 }  // namespace velmor

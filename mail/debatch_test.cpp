@@ -1,8 +1,10 @@
 #include <sys/resource.h>
 
+#include <chrono>
 #include <csignal>
 
 #include "mail/alias.h"
+#include "mail/mailbox.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
 #include "users/users.h"
@@ -181,6 +183,75 @@ TEST_F(DebatchTest, DebatchStartsAfterTheQuietTimeAndRetriesAMinuteAfterAFailure
   mail_poll();
   EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("X-RCPT-TO: ann"), std::string::npos);
   EXPECT_EQ(file_size(in("1")), -1);
+}
+
+
+TEST_F(DebatchTest, ABurstToOneMailboxSharesOneSyncOfTheMailboxAndOneOfItsOverview) {
+  // The mailbox and its overview exist already.
+  write_file(in("1"), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage);
+  debatch_file(in("1"));
+  for (int i = 2; i <= 11; ++i) {
+    write_file(in(std::to_string(i)), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n") + kMessage);
+    queue_add_incoming(in(std::to_string(i)));
+  }
+  // The overview's sync fails: no file is settled, the mailbox is as it was.
+  std::string before = read_file(root + "/home/ann/mail/inbox");
+  sysio::reset();
+  sysio::fail_nth(sysio::Op::sync, 2);
+  auto far = std::chrono::steady_clock::now() + std::chrono::hours(1);
+  while (debatch_step(far) != DebatchStep::idle) {
+  }
+  EXPECT_EQ(read_file(root + "/home/ann/mail/inbox"), before);
+  EXPECT_EQ(folder_names(root + "/in", true).size(), 10u);
+  // Tried again: ten messages, one sync of the mailbox and one of its overview.
+  sysio::reset();
+  queue_scan_incoming();
+  while (debatch_step(far) != DebatchStep::idle) {
+  }
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 2u);
+  EXPECT_TRUE(folder_names(root + "/in", true).empty());
+  mailbox_cache_clear();
+  EXPECT_EQ(mailbox_lookup(root + "/home/ann/mail/inbox")->count, 11);
+}
+
+TEST_F(DebatchTest, ALargeMessageGoesInPiecesAndStartsAgainWhenTheMailboxIsReplaced) {
+  for (const char* n : {"1", "2"}) {
+    write_file(in(n), std::string("MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\nDATA\r\nSubject: small ") +
+                          n + "\r\n\r\nbody\r\n.\r\n");
+    debatch_file(in(n));
+  }
+  std::string inbox = root + "/home/ann/mail/inbox";
+  std::string body;
+  for (int i = 0; i < 60000; ++i) body += "line " + std::to_string(i) + " of a long message\r\n";
+  write_file(in("3"), "MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\nDATA\r\nSubject: large\r\n\r\n" + body +
+                          ".\r\n");
+  queue_add_incoming(in("3"));
+  int pieces = 0;
+  bool expunged = false;
+  DebatchStep step;
+  while ((step = debatch_step({})) == DebatchStep::working) {
+    ++pieces;
+    // A reader meanwhile sees the two messages, and what is being written stays.
+    Mailbox* box = mailbox_lookup(inbox);
+    ASSERT_EQ(box->count, expunged ? 1 : 2);
+    if (pieces == 2) {
+      box->messages.front().flags |= msgflag::deleted;
+      ASSERT_EQ(mailbox_expunge(*box), 0);
+      expunged = true;
+    }
+  }
+  EXPECT_EQ(step, DebatchStep::finished);
+  EXPECT_GE(pieces, 4);
+  EXPECT_EQ(file_size(in("3")), -1);
+  mailbox_cache_clear();
+  Mailbox* box = mailbox_lookup(inbox);
+  ASSERT_EQ(box->count, 2);
+  EXPECT_EQ(box->messages.front().subject, "small 2");
+  EXPECT_EQ(box->messages.back().subject, "large");
+  std::string text = read_file(inbox);
+  EXPECT_EQ(text.find("Subject: large"), text.rfind("Subject: large"));
+  EXPECT_NE(text.find(body + ".\r\n"), std::string::npos);
+  EXPECT_EQ(mailbox_size(*box), text.size());
 }
 
 }  // namespace

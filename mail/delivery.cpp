@@ -217,10 +217,11 @@ struct Recipient {
 
 // The receive checks of the recipient's group; true when the message was
 // refused (and the refusal mailed).
-bool refused(const Recipient& r, const std::string& queue_file, std::string_view sender) {
+bool refused(const Recipient& r, QueuedMessage& msg, std::string_view sender) {
   const GroupOptions& g = *r.group;
   const std::string& user = r.user->login;
-  std::int64_t size = file_size(queue_file);
+  const std::string& queue_file = msg.path;
+  std::int64_t size = msg.size;
   std::uint32_t limit = g.size("mail.msg.size");
   if (limit && size > static_cast<std::int64_t>(limit)) {
     std::string shown(trim_blanks(size_text(static_cast<std::uint64_t>(size))));
@@ -242,7 +243,7 @@ bool refused(const Recipient& r, const std::string& queue_file, std::string_view
     return true;
   }
   const std::string& filter = g.text("mail.filter");
-  if (!filter.empty() && mail_filter_match(filter, queue_file)) {
+  if (!filter.empty() && msg.filter_hit(filter)) {
     log_write(strprintf("[Mail] Banned word/phrase found: %s", user.c_str()), logchan::filter);
     mail_send_refusal("The following email contained a forbidden phrase\n", redirect_address(g, "mail.filter.redirect"),
                     queue_file);
@@ -321,90 +322,26 @@ void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std
   if (rc) debug("Vacation reply could not be queued:", error_text(rc));
 }
 
-// Cuts the mailbox back to what it held before a failed append.
-void take_back(int fd, std::uint64_t old_size) {
-  if (sysio::ftruncate(fd, static_cast<off_t>(old_size)) == 0) sysio::fsync(fd);
-}
+// How much of a message one piece writes or parses.
+constexpr std::uint64_t kPieceBytes = 1024 * 1024;
 
-// Appends the message to the mailbox file at `old_size` and syncs it. 0 or
-// an errno value; on failure the file is cut back to `old_size`.
-int append_message(int box, std::uint64_t old_size, ByteSource& in, const QueueLayout& q, std::string_view user,
-                   std::uint32_t uid) {
-  std::string out = mailbox_separator(q.envelope, now());
-  std::uint64_t at = old_size;
-  int rc = 0;
-  std::string tail;  // the last bytes written, to see whether the terminator came
-  auto flush = [&] {
-    if (!rc) rc = pwrite_all(box, out, at);
-    at += out.size();
-    out.clear();
-  };
-  auto put = [&](std::string_view data) {
-    if (rc) return;
-    out.append(data);
-    tail.append(data.substr(data.size() > 5 ? data.size() - 5 : 0));
-    if (tail.size() > 5) tail.erase(0, tail.size() - 5);
-    if (out.size() >= 64 * 1024) flush();
-  };
-  // The header, without the lines that carry mailbox state.
-  std::uint64_t pos = q.message;
-  bool dropping = false;
-  while (pos < q.header_end && !rc) {
-    Line line = read_line(in, pos, kHeaderLineKeep);
-    if (line.length == 0) break;
-    pos += line.length;
-    bool folded = line.text.front() == ' ' || line.text.front() == '\t';
-    if (!folded) dropping = mailbox_header_dropped(line.text);
-    if (dropping) continue;
-    if (line.length == line.text.size()) {
-      put(line_body(line.text));
-      put("\r\n");
-    } else {  // a header line longer than we keep in memory: copied as it is
-      for (std::uint64_t o = line.offset, left = line.length; left > 0 && !rc;) {
-        std::string_view v = in.view(o, 64 * 1024);
-        if (v.empty()) {
-          rc = EIO;
-          break;
-        }
-        v = v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), left)));
-        put(v);
-        o += v.size();
-        left -= v.size();
-      }
-    }
+// A source seen only up to `limit` (the message just written, not what
+// may follow it).
+class LimitedSource final : public ByteSource {
+ public:
+  LimitedSource(ByteSource& in, std::uint64_t limit) : in_(in), limit_(limit) {}
+  std::uint64_t size() const override { return std::min(in_.size(), limit_); }
+  std::string_view view(std::uint64_t offset, std::size_t want) override {
+    if (offset >= size()) return {};
+    std::string_view v = in_.view(offset, want);
+    return v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), size() - offset)));
   }
-  // Empty lines at the start of the body are dropped with the header's end.
-  while (pos < in.size()) {
-    Line line = read_line(in, pos, 4);
-    if (line.length == 0 || line_body(line.text).size() != 0 || line.length > 2) break;
-    pos += line.length;
-  }
-  put("X-RCPT-TO: ");
-  put(user);
-  put("\r\nX-Processed-By: Velmor Mail Suite (");
-  put(kVersion);
-  put(")\r\n");
-  put(strprintf("X-UID: %u\r\n\r\n", uid));
-  while (pos < in.size() && !rc) {
-    std::string_view v = in.view(pos, 64 * 1024);
-    if (v.empty()) {
-      rc = EIO;
-      break;
-    }
-    put(v);
-    pos += v.size();
-  }
-  if (!rc && tail != "\r\n.\r\n" && tail.substr(2) != "\n.\n") {
-    // A queue file without its terminator: the message is closed here, so
-    // the next one in the mailbox still starts at a separator.
-    if (!tail.empty() && tail.back() != '\n') put("\r\n");
-    put(".\r\n");
-  }
-  flush();
-  if (!rc && sysio::fsync(box) != 0) rc = errno;
-  if (rc) take_back(box, old_size);
-  return rc;
-}
+  bool failed() const override { return in_.failed(); }
+
+ private:
+  ByteSource& in_;
+  std::uint64_t limit_;
+};
 
 std::unordered_map<std::string, std::pair<std::time_t, int>> g_new_boxes;  // login -> day, boxes made
 
@@ -420,108 +357,364 @@ bool new_box_allowed(const std::string& login) {
 // What becomes of a message whose mailbox cannot be opened: while the
 // suite may not write in the home it waits, as it does for a full disk;
 // anything else goes to oddments.
-int open_failed(const Recipient& r, const std::string& queue_file, const SafeResult& why) {
+LocalOutcome open_failed(const Recipient& r, const std::string& queue_file, const SafeResult& why) {
   debug("Mailbox open failed");
   std::string what = safe_describe(r.user->home, why);
   if (why.refused()) {
     log_write("Mail delivery refused: " + what, logchan::errors);
   } else if (why.error == EACCES || why.error == EPERM || is_temporary(why.error)) {
     log_write("Mail delivery for `" + r.user->login + "' waits: " + what, logchan::errors);
-    return kAppendTemporaryFailure;
+    return LocalOutcome::temporary;
   }
   mail_move_to_oddments(queue_file, strprintf("Couldn't open mailbox for user `%s'", r.user->login.c_str()));
-  return 1;
+  return LocalOutcome::handled;
 }
 
 }  // namespace
 
-int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender) {
-  debug("Mailbox append for:", recipient);
-  debug("Mailbox append from:", sender);
-  std::shared_ptr<const GroupOptions> sender_group;
-  if (auto s = mail_local_user(sender); s && user_find(*s)) {
-    sender_group = user_group(user_find(*s)->login);
-  } else {
-    sender_group = group_default();
+QueuedMessage::QueuedMessage(std::string p) : path(std::move(p)), in(path) {
+  if (in.is_open()) {
+    layout = queue_layout(in);
+    size = static_cast<std::int64_t>(in.size());
   }
-  bool exempt = sender_group && (sender_group->mail_flags & gflag::mail_override);
+}
 
+bool QueuedMessage::filter_hit(const std::string& filter) {
+  auto found = filter_hits.find(filter);
+  if (found != filter_hits.end()) return found->second;
+  bool hit = mail_filter_match(filter, path);
+  filter_hits.emplace(filter, hit);
+  return hit;
+}
+
+bool mailbox_recipient_known(std::string_view recipient) {
   auto local = mail_local_user(recipient);
-  if (!local) return 0;
+  if (!local) return false;
   if (local->size() > 63) local->resize(63);
-  debug("Mailbox local user is:", *local);
+  const UserRecord* u = user_find(*local);
+  return u && !u->home.empty();
+}
+
+struct LocalDelivery::State {
+  std::shared_ptr<QueuedMessage> msg;
+  std::string recipient, sender;
+  std::function<void(int)> committed;
+  enum class Phase { checks, open, write, parse } phase = Phase::checks;
   Recipient r;
-  r.user = user_find(*local);
-  if (!r.user || r.user->home.empty()) return 0;
-  r.group = user_group(r.user->login);
+  std::string box_name, path;
+  Mailbox* box = nullptr;
+  AppendSlot slot;
 
-  if (!exempt && r.group && refused(r, queue_file, sender)) return 1;
+  // The message as it is written: the header without the lines that carry
+  // mailbox state, our own lines, the body, and a closing "." line should
+  // the queue file lack one.
+  enum class Part { header, raw, blank, ours, body, close, done } part = Part::header;
+  std::uint64_t pos = 0;        // in the queue file
+  std::uint64_t raw_left = 0;   // of a header line too long to hold, still to copy
+  std::uint64_t at = 0;         // in the mailbox
+  bool dropping = false;
+  std::string tail;             // the last bytes written, to see whether the terminator came
+  std::string out;
 
-  FileSource in(queue_file);
-  if (!in.is_open()) return kAppendTemporaryFailure;
-  QueueLayout q = queue_layout(in);
-  if (in.failed()) return kAppendTemporaryFailure;
+  std::unique_ptr<FileSource> written;
+  std::unique_ptr<LimitedSource> limited;
+  std::unique_ptr<MessageParser> parser;
 
-  // The home is trusted; everything below it is the user's, and is reached
-  // without following links (core/safedir.h).
-  const std::string& home_path = r.user->home;
-  SafeDir home;
-  SafeResult opened = SafeDir::open_root(home_path, home);
-  if (opened.status == SafeStatus::missing) {
-    make_path(home_path);
-    opened = SafeDir::open_root(home_path, home);
-  }
-  bool home_ok = opened.ok();
-  if (home_ok && r.group && (r.group->mail_flags & gflag::mail_forward) && forwarded(r, home, in, q)) return 1;
-  if (home_ok && r.group && (r.group->mail_flags & gflag::mail_vacation)) vacation(r, home, q, sender);
+  ByteSource& in() { return msg->in; }
 
-  std::string box_name = mailbox_box_for_address(recipient);
-  if (box_name != "inbox") {
-    debug("Appending mailbox in email address:", box_name);
-  } else {
-    debug("Using inbox");
+  LocalOutcome waits(const std::string& why) {
+    log_write("Mail delivery for `" + r.user->login + "' waits: " + why, logchan::errors);
+    return LocalOutcome::temporary;
   }
-  SafeDir folder;
-  if (opened.ok()) opened = home.open_dir("mail", true, folder);
-  bool made = opened.ok() && box_name != "inbox" && !folder.has(box_name);
-  if (made && !new_box_allowed(r.user->login)) {
-    debug("Too many new mailboxes today, using inbox for:", box_name);
-    box_name = "inbox";
-    made = false;
-  }
-  debug(strprintf("using box `%s'", box_name.c_str()));
-  std::string path = path_join(path_join(home_path, "mail"), box_name);
-  debug("Trying to open mailbox");
-  UniqueFd fd;
-  if (opened.ok()) opened = home.open_file("mail/" + box_name, O_RDWR | O_CREAT, fd, 0600);
-  if (opened.ok() && made) ++g_new_boxes[r.user->login].second;
-  Mailbox* box = opened.ok() ? mailbox_lookup(path, home_path) : nullptr;
-  if (opened.ok() && !box) opened = SafeResult{SafeStatus::failed, EIO, "mail/" + box_name};
-  if (!opened.ok()) return open_failed(r, queue_file, opened);
 
-  // The message goes behind the last committed one. A file that does not
-  // match its records (it could not be cut back, or changed while a session
-  // holds it) waits, rather than glue the message to something unknown.
-  struct stat st {};
-  std::uint64_t old_size = mailbox_size(*box);
-  if (::fstat(fd.get(), &st) != 0 || static_cast<std::uint64_t>(st.st_size) != old_size) {
-    log_write("Mail delivery for `" + r.user->login + "' waits: " + path + " does not match its records",
-              logchan::errors);
-    return kAppendTemporaryFailure;
+  // The receive checks, forward and vacation: done once.
+  std::optional<LocalOutcome> checks() {
+    debug("Mailbox append for:", recipient);
+    debug("Mailbox append from:", sender);
+    std::shared_ptr<const GroupOptions> sender_group;
+    if (auto s = mail_local_user(sender); s && user_find(*s)) {
+      sender_group = user_group(user_find(*s)->login);
+    } else {
+      sender_group = group_default();
+    }
+    bool exempt = sender_group && (sender_group->mail_flags & gflag::mail_override);
+    auto local = mail_local_user(recipient);
+    if (!local) return LocalOutcome::handled;  // not ours (the caller asked mailbox_recipient_known)
+    if (local->size() > 63) local->resize(63);
+    debug("Mailbox local user is:", *local);
+    r.user = user_find(*local);
+    if (!r.user || r.user->home.empty()) return LocalOutcome::handled;
+    r.group = user_group(r.user->login);
+    if (!exempt && r.group && refused(r, *msg, sender)) return LocalOutcome::handled;
+    if (!msg->readable()) return LocalOutcome::temporary;
+
+    // The home is trusted; everything below it is the user's, and is reached
+    // without following links (core/safedir.h).
+    SafeDir home;
+    SafeResult opened = SafeDir::open_root(r.user->home, home);
+    if (opened.status == SafeStatus::missing) {
+      make_path(r.user->home);
+      opened = SafeDir::open_root(r.user->home, home);
+    }
+    if (opened.ok() && r.group && (r.group->mail_flags & gflag::mail_forward) &&
+        forwarded(r, home, in(), msg->layout))
+      return LocalOutcome::handled;
+    if (opened.ok() && r.group && (r.group->mail_flags & gflag::mail_vacation)) vacation(r, home, msg->layout, sender);
+    box_name = mailbox_box_for_address(recipient);
+    if (box_name != "inbox") {
+      debug("Appending mailbox in email address:", box_name);
+    } else {
+      debug("Using inbox");
+    }
+    return std::nullopt;
   }
-  std::uint32_t uid = box->next_uid ? box->next_uid : 1;
-  int rc = append_message(fd.get(), old_size, in, q, r.user->login, uid);
-  if (!rc) {
-    FileSource written(fd.get());
-    rc = mailbox_commit(*box, written, old_size);
-    if (rc) take_back(fd.get(), old_size);
+
+  // Opens the mailbox and reserves the place behind its last message.
+  std::optional<LocalOutcome> open() {
+    const std::string& home_path = r.user->home;
+    SafeDir home, folder;
+    SafeResult opened = SafeDir::open_root(home_path, home);
+    if (opened.ok()) opened = home.open_dir("mail", true, folder);
+    bool made = opened.ok() && box_name != "inbox" && !folder.has(box_name);
+    if (made && !new_box_allowed(r.user->login)) {
+      debug("Too many new mailboxes today, using inbox for:", box_name);
+      box_name = "inbox";
+      made = false;
+    }
+    debug(strprintf("using box `%s'", box_name.c_str()));
+    path = path_join(path_join(home_path, "mail"), box_name);
+    debug("Trying to open mailbox");
+    UniqueFd fd;
+    if (opened.ok()) opened = home.open_file("mail/" + box_name, O_RDWR | O_CREAT, fd, 0600);
+    if (opened.ok() && made) ++g_new_boxes[r.user->login].second;
+    box = opened.ok() ? mailbox_lookup(path, home_path) : nullptr;
+    if (opened.ok() && !box) opened = SafeResult{SafeStatus::failed, EIO, "mail/" + box_name};
+    if (!opened.ok()) return open_failed(r, msg->path, opened);
+    int rc = mailbox_append_begin(*box, std::move(fd), slot);
+    if (rc == ESTALE) return waits(path + " does not match its records");
+    if (rc) return waits(path + ": " + error_text(rc));
+    out = mailbox_separator(msg->layout.envelope, now());
+    part = Part::header;
+    pos = msg->layout.message;
+    at = slot.offset;
+    dropping = false;
+    tail.clear();
+    return std::nullopt;
   }
-  if (rc) {
-    log_write("Mail delivery for `" + r.user->login + "' waits: " + path + ": " + error_text(rc), logchan::errors);
-    return kAppendTemporaryFailure;
+
+  void put(std::string_view data) {
+    out.append(data);
+    tail.append(data.substr(data.size() > 5 ? data.size() - 5 : 0));
+    if (tail.size() > 5) tail.erase(0, tail.size() - 5);
   }
-  box->flags |= boxflag::new_mail | boxflag::delivered;
-  return 1;
+
+  // Copies up to `left` bytes from the queue file; EIO when it ends first.
+  int copy(std::uint64_t& left, std::uint64_t budget) {
+    while (left > 0 && out.size() < budget) {
+      std::string_view v = in().view(pos, 64 * 1024);
+      if (v.empty()) return EIO;
+      v = v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), left)));
+      put(v);
+      pos += v.size();
+      left -= v.size();
+    }
+    return 0;
+  }
+
+  // Fills `out` with about `budget` bytes of the message; 0 or an errno value.
+  int fill(std::uint64_t budget) {
+    const QueueLayout& q = msg->layout;
+    while (out.size() < budget && part != Part::done) {
+      switch (part) {
+        case Part::header: {
+          if (pos >= q.header_end) {
+            part = Part::blank;
+            break;
+          }
+          Line line = read_line(in(), pos, kHeaderLineKeep);
+          if (line.length == 0) {
+            part = Part::blank;
+            break;
+          }
+          bool folded = line.text.front() == ' ' || line.text.front() == '\t';
+          if (!folded) dropping = mailbox_header_dropped(line.text);
+          if (dropping) {
+            pos += line.length;
+          } else if (line.length == line.text.size()) {
+            pos += line.length;
+            put(line_body(line.text));
+            put("\r\n");
+          } else {  // a header line longer than we keep in memory: copied as it is
+            raw_left = line.length;
+            part = Part::raw;
+          }
+          break;
+        }
+        case Part::raw:
+          if (int rc = copy(raw_left, budget)) return rc;
+          if (raw_left == 0) part = Part::header;
+          break;
+        case Part::blank: {
+          // Empty lines at the start of the body are dropped with the header's end.
+          std::string_view v = in().view(pos, 2);
+          if (v.substr(0, 2) == "\r\n") {
+            pos += 2;
+          } else if (!v.empty() && v.front() == '\n') {
+            pos += 1;
+          } else {
+            part = Part::ours;
+          }
+          break;
+        }
+        case Part::ours:
+          put("X-RCPT-TO: ");
+          put(r.user->login);
+          put("\r\nX-Processed-By: Velmor Mail Suite (");
+          put(kVersion);
+          put(")\r\n");
+          put(strprintf("X-UID: %u\r\n\r\n", slot.uid));
+          part = Part::body;
+          break;
+        case Part::body: {
+          std::uint64_t left = in().size() - pos;
+          if (int rc = copy(left, budget)) return rc;
+          if (pos >= in().size()) part = Part::close;
+          break;
+        }
+        case Part::close:
+          if (tail != "\r\n.\r\n" && tail.substr(std::min<std::size_t>(2, tail.size())) != "\n.\n") {
+            // A queue file without its terminator: the message is closed here,
+            // so the next one in the mailbox still starts at a separator.
+            if (!tail.empty() && tail.back() != '\n') put("\r\n");
+            put(".\r\n");
+          }
+          part = Part::done;
+          break;
+        case Part::done:
+          break;
+      }
+    }
+    return in().failed() ? EIO : 0;
+  }
+
+  // One piece of the message written; true when all of it is.
+  int write_piece(bool& finished) {
+    int rc = fill(kPieceBytes);
+    if (!rc) rc = pwrite_all(mailbox_append_fd(*box), out, at);
+    at += out.size();
+    out.clear();
+    finished = part == Part::done;
+    return rc;
+  }
+
+  std::optional<LocalOutcome> failed(int rc) {
+    mailbox_append_abandon(*box, slot);
+    return waits(path + ": " + error_text(rc));
+  }
+
+  std::optional<LocalOutcome> piece(std::uint64_t& work) {
+    switch (phase) {
+      case Phase::checks:
+        if (auto done = checks()) return done;
+        phase = Phase::open;
+        [[fallthrough]];
+      case Phase::open:
+        if (auto done = open()) return done;
+        phase = Phase::write;
+        return std::nullopt;
+      case Phase::write: {
+        if (mailbox_append_stale(*box, slot)) return restart();
+        bool finished = false;
+        std::uint64_t before = at;
+        if (int rc = write_piece(finished)) return failed(rc);
+        work += at - before;
+        if (finished) {
+          written = std::make_unique<FileSource>(mailbox_append_fd(*box));
+          limited = std::make_unique<LimitedSource>(*written, at);
+          parser = std::make_unique<MessageParser>(slot.offset);
+          phase = Phase::parse;
+        }
+        return std::nullopt;
+      }
+      case Phase::parse: {
+        if (mailbox_append_stale(*box, slot)) return restart();
+        work += kPieceBytes;
+        if (!parser->step(*limited, kPieceBytes)) return std::nullopt;
+        std::uint64_t next = 0;
+        MessageRecord rec = parser->take(next);
+        parser.reset();
+        limited.reset();
+        written.reset();
+        if (rec.total_length != at - slot.offset || next != kNoMessage) return failed(EIO);
+        mailbox_append_stage(*box, slot, std::move(rec),
+                             [done = std::move(committed), login = r.user->login, where = path](int error) {
+                               if (error)
+                                 log_write("Mail delivery for `" + login + "' waits: " + where + ": " + error_text(error),
+                                           logchan::errors);
+                               if (done) done(error);
+                             });
+        return LocalOutcome::staged;
+      }
+    }
+    return LocalOutcome::temporary;
+  }
+
+  // The mailbox was replaced or cut back under the message: written again
+  // behind its new end.
+  std::optional<LocalOutcome> restart() {
+    parser.reset();
+    limited.reset();
+    written.reset();
+    out.clear();
+    phase = Phase::open;
+    return std::nullopt;
+  }
+};
+
+LocalDelivery::LocalDelivery(std::shared_ptr<QueuedMessage> message, std::string recipient, std::string sender,
+                             std::function<void(int)> committed)
+    : s_(std::make_unique<State>()) {
+  s_->msg = std::move(message);
+  s_->recipient = std::move(recipient);
+  s_->sender = std::move(sender);
+  s_->committed = std::move(committed);
+}
+LocalDelivery::LocalDelivery(LocalDelivery&&) noexcept = default;
+LocalDelivery& LocalDelivery::operator=(LocalDelivery&&) noexcept = default;
+LocalDelivery::~LocalDelivery() {
+  // Given up half way (the suite stops): the mailbox is cut back.
+  if (s_ && s_->box && (s_->phase == State::Phase::write || s_->phase == State::Phase::parse))
+    mailbox_append_abandon(*s_->box, s_->slot);
+}
+
+LocalOutcome LocalDelivery::step(std::chrono::steady_clock::time_point deadline) {
+  // A piece is a megabyte of writing or parsing: a small message goes in
+  // whole, a large one a piece at a time until the deadline.
+  std::uint64_t work = 0;
+  for (;;) {
+    std::optional<LocalOutcome> done = s_->piece(work);
+    if (done && *done != LocalOutcome::working) {
+      s_->phase = State::Phase::checks;
+      s_->box = nullptr;
+      return *done;
+    }
+    if (work >= kPieceBytes && std::chrono::steady_clock::now() >= deadline) return LocalOutcome::working;
+  }
+}
+
+int mailbox_append(const std::string& queue_file, std::string_view recipient, std::string_view sender) {
+  if (!mailbox_recipient_known(recipient)) return 0;
+  int committed = EIO;
+  LocalDelivery d(std::make_shared<QueuedMessage>(queue_file), std::string(recipient), std::string(sender),
+                  [&committed](int error) { committed = error; });
+  LocalOutcome o;
+  while ((o = d.step(std::chrono::steady_clock::time_point::max())) == LocalOutcome::working) {
+  }
+  if (o == LocalOutcome::staged) {
+    mailbox_commit_staged();
+    return committed == 0 ? 1 : kAppendTemporaryFailure;
+  }
+  return o == LocalOutcome::handled ? 1 : kAppendTemporaryFailure;
 }
 
 // ---- read receipts --------------------------------------------------------------
@@ -580,7 +773,7 @@ int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset
   if (message.flags & msgflag::seen) return 0;
   message.flags |= msgflag::seen;
   if (box.unseen > 0) --box.unseen;
-  box.changed = true;
+  mailbox_flags_changed(box, message);
   if (!(message.flags & msgflag::receipt_wanted)) return 0;
 
   // The header of the message as stored.

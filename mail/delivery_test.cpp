@@ -149,7 +149,7 @@ TEST_F(Delivery, StateHeadersAreReplacedAndIdentifiersRise) {
   EXPECT_EQ(m->messages.front().flags & msgflag::deleted, 0u);
   EXPECT_TRUE(m->flags & boxflag::new_mail);
   // The cache and a fresh read of the files agree.
-  std::string overview = read_file(home_ / "mail" / "overview" / "inbox");
+  std::string overview = mailbox_overview_text(*m);
   mailbox_cache_clear();
   Mailbox* again = mailbox_lookup(inbox());
   EXPECT_EQ(mailbox_overview_text(*again), overview);
@@ -205,7 +205,7 @@ TEST_F(Delivery, AnAppendCountsOnlyOnceItAndItsLengthAreSynced) {
   }
   sysio::reset();
   ASSERT_EQ(mailbox_append(big, "ann", "bob@x"), 1);
-  EXPECT_EQ(sysio::count(sysio::Op::sync), 3u);  // the mailbox, then the overview and its folder
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 2u);  // the mailbox, then the overview it is appended to
   EXPECT_EQ(mailbox_lookup(inbox())->messages.back().uid, 2u);
 }
 
@@ -327,6 +327,201 @@ TEST_F(Delivery, ReadReceiptGoesOnceToTheSender) {
   EXPECT_NE(r.find("Subject: Read Receipt (Original:please confirm)\r\n"), std::string::npos);
   EXPECT_NE(r.find("     please confirm  (Tue, 14 Nov 2023 22:13:20 +0000)\r\n"), std::string::npos);
   EXPECT_EQ(r.substr(r.size() - 5), "\r\n.\r\n");
+}
+
+
+// ---- big mailboxes: the overview grows by appending -------------------------
+
+// The records a fresh reader builds from the mailbox file alone.
+std::string overview_parsed_from(const std::string& mailbox_text) {
+  Mailbox box;
+  TextSource in(mailbox_text);
+  for (std::uint64_t off = 0; off != kNoMessage;) off = mailbox_parse_message(in, off, box);
+  return mailbox_overview_text(box);
+}
+
+class BigBox : public Delivery {
+ protected:
+  std::string overview_file() const { return (home_ / "mail" / "overview" / "inbox").string(); }
+  // A varied message: status headers to drop, MIME parts, a read-receipt request.
+  std::string varied(int i) {
+    std::string header = "From: Bob <bob@elsewhere.test>\r\nSubject: number " + std::to_string(i) + "\r\n";
+    if (i % 3 == 0) header += "Status: RO\r\nX-UID: 9999\r\n";
+    if (i % 4 == 0) header += "X-Read-Receipt: yes\r\n";
+    if (i % 5 == 0)
+      return queue(header + "Content-Type: multipart/mixed; boundary=\"b\"\r\n",
+                   "--b\r\nContent-Type: text/plain\r\n\r\none\r\n--b\r\n\r\ntwo\r\n--b--\r\n");
+    return queue(header, std::string(static_cast<std::size_t>(50 + i % 7 * 40), 'x') + "\r\n");
+  }
+  // A fresh read of the files (as after a restart) agrees with the mailbox itself.
+  void expect_consistent(int count) {
+    std::string text = read_file(inbox());
+    mailbox_cache_clear();
+    Mailbox* box = mailbox_lookup(inbox());
+    ASSERT_NE(box, nullptr);
+    EXPECT_EQ(box->count, count);
+    EXPECT_EQ(mailbox_size(*box), read_file(inbox()).size());
+    EXPECT_EQ(read_file(inbox()), text.substr(0, mailbox_size(*box)));
+    EXPECT_EQ(mailbox_overview_text(*box), overview_parsed_from(read_file(inbox())));
+  }
+};
+
+TEST_F(BigBox, AfterManyAppendsTheOverviewEqualsOneRebuiltFromTheMailboxAndOnlyGrew) {
+  std::vector<std::uint64_t> growth;
+  std::string before;
+  for (int i = 0; i < 60; ++i) {
+    ASSERT_EQ(mailbox_append(i % 5 ? queue("Subject: same\r\n") : varied(i), "ann", "bob@x"), 1);
+    std::string now_text = read_file(overview_file());
+    ASSERT_EQ(now_text.substr(0, before.size()), before) << "rewritten at " << i;  // appended to, never rewritten
+    if (i % 5) growth.push_back(now_text.size() - before.size());
+    before = now_text;
+  }
+  // What an append adds does not depend on what the mailbox holds (the
+  // numbers of its last lines grow by a digit or two).
+  EXPECT_LE(growth.back(), growth.front() + 4);
+  expect_consistent(60);
+  Mailbox* box = mailbox_lookup(inbox());
+  EXPECT_EQ(box->messages.back().uid, 60u);
+  EXPECT_EQ(box->unseen, 60);  // Status headers of arriving mail count for nothing
+}
+
+TEST_F(BigBox, CompactionKeepsFlagsAndIdentifiersAndCarriesOverWhatHappensMeanwhile) {
+  for (int i = 0; i < 300; ++i) ASSERT_EQ(mailbox_append(varied(i), "ann", "bob@x"), 1);
+  Mailbox* box = mailbox_lookup(inbox());
+  int n = 0;
+  for (auto& m : box->messages) {
+    if (n % 3 == 0) m.flags |= msgflag::deleted;
+    if (n % 7 == 0) {
+      m.flags |= msgflag::answered;
+      mailbox_flags_changed(*box, m);
+    }
+    ++n;
+  }
+  ASSERT_EQ(mailbox_overview_flush(*box), 0);
+  ASSERT_EQ(mailbox_expunge(*box), 0);
+  EXPECT_NE(read_file(overview_file()).find("#expunge "), std::string::npos);
+  std::string expected = mailbox_overview_text(*box);
+  // A fresh reader of the records as appended sees the same.
+  mailbox_cache_clear();
+  box = mailbox_lookup(inbox());
+  ASSERT_EQ(box->count, 200);
+  ASSERT_EQ(mailbox_overview_text(*box), expected);
+
+  // Compacted in slices (the deadline has passed: one slice per step), with
+  // a delivery and a flag change between the slices.
+  int steps = 0;
+  CompactStep step;
+  while ((step = mailbox_compact_step(*box, {})) == CompactStep::working) {
+    if (++steps == 1) {
+      ASSERT_EQ(mailbox_append(queue("Subject: meanwhile\r\n"), "ann", "bob@x"), 1);
+      box->messages.front().flags |= msgflag::flagged;
+      mailbox_flags_changed(*box, box->messages.front());
+    }
+  }
+  ASSERT_EQ(step, CompactStep::done);
+  EXPECT_GT(steps, 1);
+  std::string compacted = read_file(overview_file());
+  EXPECT_EQ(compacted.find("#expunge"), std::string::npos);
+  EXPECT_FALSE(mailbox_overview_stale(*box));
+  expected = mailbox_overview_text(*box);
+  mailbox_cache_clear();
+  box = mailbox_lookup(inbox());
+  EXPECT_EQ(mailbox_overview_text(*box), expected);
+  EXPECT_EQ(box->count, 201);
+  EXPECT_TRUE(box->messages.front().flags & msgflag::flagged);
+  EXPECT_EQ(box->messages.front().uid, 2u);
+  EXPECT_EQ(box->messages.back().uid, 301u);
+  EXPECT_FALSE(fs::exists(home_ / "mail" / "overview" / "inbox~"));
+}
+
+TEST_F(BigBox, AFailureAnywhereInAnAppendOrACompactionLeavesFilesThatReopenConsistently) {
+  for (int i = 0; i < 40; ++i) ASSERT_EQ(mailbox_append(varied(i), "ann", "bob@x"), 1);
+  std::string big = queue("Subject: big\r\n", std::string(300000, 'z') + "\r\n");
+  int count = 40;
+  for (sysio::Op op : {sysio::Op::write, sysio::Op::sync, sysio::Op::rename, sysio::Op::truncate}) {
+    for (std::uint64_t n = 1;; ++n) {
+      sysio::reset();
+      sysio::fail_nth(op, n);
+      int rc = mailbox_append(big, "ann", "bob@x");
+      bool reached = sysio::count(op) >= n;
+      sysio::reset();
+      if (rc == 1) ++count;
+      SCOPED_TRACE(testing::Message() << "op " << static_cast<int>(op) << " n " << n);
+      expect_consistent(count);
+      if (!reached) break;
+    }
+  }
+  // A compaction failing at each write, sync and rename leaves the live
+  // overview as it was.
+  Mailbox* box = mailbox_lookup(inbox());
+  for (auto& m : box->messages) m.flags |= (m.uid % 2) ? msgflag::deleted : 0;
+  ASSERT_EQ(mailbox_expunge(*box), 0);
+  count = box->count;
+  for (sysio::Op op : {sysio::Op::write, sysio::Op::sync, sysio::Op::rename}) {
+    std::string live = read_file(overview_file());
+    sysio::reset();
+    sysio::fail_nth(op, 1);
+    CompactStep step;
+    while ((step = mailbox_compact_step(*box, {})) == CompactStep::working) {
+    }
+    sysio::reset();
+    EXPECT_EQ(step, CompactStep::failed);
+    EXPECT_EQ(read_file(overview_file()), live);
+    expect_consistent(count);
+    box = mailbox_lookup(inbox());
+  }
+}
+
+TEST_F(BigBox, AKillAnywhereInAnAppendLeavesNoMessageLostOrGlued) {
+  for (int i = 0; i < 5; ++i) ASSERT_EQ(mailbox_append(varied(i), "ann", "bob@x"), 1);
+  std::string m0 = read_file(inbox()), o0 = read_file(overview_file());
+  ASSERT_EQ(mailbox_append(varied(5), "ann", "bob@x"), 1);
+  std::string m1 = read_file(inbox()), o1 = read_file(overview_file());
+  ASSERT_EQ(o1.substr(0, o0.size()), o0);
+  // The mailbox is synced before the overview is appended to: a kill leaves
+  // part of the message and the old overview, or the whole message and part
+  // of the overview's new records.
+  for (std::size_t cut = 1; cut < m1.size() - m0.size(); cut += 13) {
+    write_file(inbox(), m1.substr(0, m0.size() + cut));
+    write_file(overview_file(), o0);
+    SCOPED_TRACE(cut);
+    expect_consistent(5);
+    EXPECT_EQ(read_file(inbox()), m0);
+  }
+  for (std::size_t cut = 0; cut <= o1.size() - o0.size(); cut += 7) {
+    write_file(inbox(), m1);
+    write_file(overview_file(), o1.substr(0, o0.size() + cut));
+    SCOPED_TRACE(cut);
+    expect_consistent(6);
+    EXPECT_EQ(read_file(inbox()), m1);
+  }
+  // Whatever was cut off, the next message is whole and separate.
+  ASSERT_EQ(mailbox_append(varied(6), "ann", "bob@x"), 1);
+  expect_consistent(7);
+  EXPECT_EQ(mailbox_lookup(inbox())->messages.back().subject, "number 6");
+}
+
+TEST_F(BigBox, AKillInACompactionLeavesTheLiveOverview) {
+  for (int i = 0; i < 30; ++i) ASSERT_EQ(mailbox_append(varied(i), "ann", "bob@x"), 1);
+  Mailbox* box = mailbox_lookup(inbox());
+  box->messages.front().flags |= msgflag::deleted;
+  ASSERT_EQ(mailbox_expunge(*box), 0);
+  std::string live = read_file(overview_file());
+  std::string compacted = mailbox_overview_text(*box);
+  // Killed before the rename: the temporary file holds any part of the new text.
+  for (std::size_t cut : {std::size_t{0}, compacted.size() / 3, compacted.size() - 1, compacted.size()}) {
+    write_file(home_ / "mail" / "overview" / "inbox~", compacted.substr(0, cut));
+    expect_consistent(29);
+    EXPECT_EQ(read_file(overview_file()), live);
+  }
+  // The next compaction takes the leftover's place.
+  box = mailbox_lookup(inbox());
+  CompactStep step;
+  while ((step = mailbox_compact_step(*box, {})) == CompactStep::working) {
+  }
+  ASSERT_EQ(step, CompactStep::done);
+  EXPECT_EQ(read_file(overview_file()), compacted);
+  EXPECT_FALSE(fs::exists(home_ / "mail" / "overview" / "inbox~"));
 }
 
 }  // namespace

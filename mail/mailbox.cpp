@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <charconv>
 #include <cstring>
+#include <unordered_map>
 #include <vector>
 
 #include "core/filecache.h"
@@ -248,13 +249,40 @@ class MimeScanner {
   std::string pending_boundary_;
 };
 
+
+// ---- the record's counts ------------------------------------------------------
+
+void count_in(Mailbox& box, const MessageRecord& m) {
+  ++box.count;
+  if (!(m.flags & msgflag::seen)) ++box.unseen;
+  box.bytes += m.total_length;
+}
+
+void count_out(Mailbox& box, const MessageRecord& m) {
+  --box.count;
+  if (!(m.flags & msgflag::seen)) --box.unseen;
+  box.bytes -= m.total_length;
+}
+
 void recount(Mailbox& box) {
-  box.count = 0;
-  box.unseen = 0;
-  for (const auto& m : box.messages) {
-    ++box.count;
-    if (!(m.flags & msgflag::seen)) ++box.unseen;
-  }
+  box.count = box.unseen = 0;
+  box.bytes = 0;
+  for (const auto& m : box.messages) count_in(box, m);
+}
+
+// Identifiers rise through the mailbox: a message's own X-UID counts only
+// when it is above the one before (and leaves room above it); any other
+// gets the next identifier.
+void add_parsed(Mailbox& box, MessageRecord rec) {
+  constexpr std::uint32_t kHighestOwn = 0x7fffffff;
+  std::uint32_t last = box.messages.empty() ? 0 : box.messages.back().uid;
+  if (box.next_uid <= last) box.next_uid = last + 1;
+  if (box.next_uid == 0) box.next_uid = 1;
+  if (rec.uid <= last || rec.uid > kHighestOwn) rec.uid = box.next_uid;
+  box.next_uid = std::max(box.next_uid, rec.uid + 1);
+  count_in(box, rec);
+  box.messages.push_back(std::move(rec));
+  box.changed = true;
 }
 
 std::uint64_t parse_all(Mailbox& box, ByteSource& in, std::uint64_t from) {
@@ -265,8 +293,186 @@ std::uint64_t parse_all(Mailbox& box, ByteSource& in, std::uint64_t from) {
 
 void reset(Mailbox& box) {
   box.messages.clear();
-  box.count = box.unseen = 0;
+  box.flags_pending.clear();
+  recount(box);
   box.loaded = now();
+}
+
+// ---- overview text --------------------------------------------------------------
+
+std::string clean(std::string_view v) {
+  std::string s;
+  s.reserve(v.size());
+  for (char c : v) {
+    if (c != '\r' && c != '\n') s += c;
+  }
+  return s;
+}
+
+void append_entry(std::string& out, const MessageRecord& m) {
+  auto date = [](std::time_t t) -> unsigned long long {
+    return t == kBadDate ? static_cast<unsigned long long>(now()) : static_cast<unsigned long long>(t);
+  };
+  strappendf(out, "#msg\n%llu,%llu,%llu,%llu,%u,%u,%llu\n", date(m.internal_date),
+             static_cast<unsigned long long>(m.sent_date), static_cast<unsigned long long>(m.total_length),
+             static_cast<unsigned long long>(m.length), m.flags, m.uid,
+             static_cast<unsigned long long>(m.header_length));
+  for (const std::string* v : {&m.from, &m.to, &m.subject, &m.reply_to}) {
+    out += clean(*v);
+    out += '\n';
+  }
+  for (const auto& p : m.parts) {
+    strappendf(out, "#mime\n%u,%u,%u,%d,%d,%d\n", p.length, p.lines, p.body_offset, p.encoding, p.level, p.number);
+    for (const std::string* v : {&p.content_type, &p.description, &p.content_id}) {
+      out += clean(*v);
+      out += '\n';
+    }
+  }
+  out += "#end\n";
+}
+
+std::uint64_t entry_size(const MessageRecord& m) {
+  std::string text;
+  append_entry(text, m);
+  return text.size();
+}
+
+// Ends every write to the overview: the next identifier and the committed
+// length. A reader takes the last such line, so the file is whole exactly
+// where one of them ends.
+void append_trailer(std::string& out, const Mailbox& box) {
+  strappendf(out, "#uidnext %u\n#length %llu\n", box.next_uid, static_cast<unsigned long long>(box.bytes));
+}
+
+void append_pending_flags(std::string& out, const Mailbox& box) {
+  for (const MessageRecord* m : box.flags_pending) strappendf(out, "#flags %u %u\n", m->uid, m->flags);
+}
+
+void clear_pending_flags(Mailbox& box) {
+  for (MessageRecord* m : box.flags_pending) m->flags_pending = false;
+  box.flags_pending.clear();
+}
+
+// The overview's parse, also telling how long the text of the live message
+// blocks is (for the compaction's reckoning).
+int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live);
+
+// ---- compaction -------------------------------------------------------------------
+
+constexpr std::uint64_t kCompactSlice = 256 * 1024;       // text written per piece
+constexpr std::uint64_t kStaleMinimum = 64 * 1024;        // dead text below this is left alone
+constexpr std::uint64_t kSmallOverview = 16 * 1024;       // rewritten whole rather than added to after a removal
+constexpr std::time_t kCompactRetrySeconds = 60;          // after a failed compaction
+
+struct Compaction {
+  SafeDir dir;
+  std::string leaf, tmp;
+  UniqueFd out;
+  std::list<MessageRecord>::iterator last;  // the last record written
+  bool any = false;                          // whether `last` is set
+  std::uint64_t written = 0, live = 0;
+  std::vector<MessageRecord*> changed;       // flags changed since the compaction began
+};
+std::unordered_map<const Mailbox*, Compaction> g_compactions;
+std::unordered_map<const Mailbox*, std::time_t> g_compact_failed;  // when a compaction last failed
+
+void compaction_abort(const Mailbox& box) {
+  auto it = g_compactions.find(&box);
+  if (it == g_compactions.end()) return;
+  it->second.out.close();
+  it->second.dir.remove(it->second.tmp);
+  g_compactions.erase(it);
+}
+
+// ---- files below the home, continued ---------------------------------------
+
+// Writes the whole overview afresh (temporary file, sync, rename, folder
+// sync). 0 or an errno value.
+int overview_write_whole(Mailbox& box) {
+  compaction_abort(box);
+  std::string path = mailbox_overview_path(box.path);
+  SafeDir dir;
+  SafeResult where = open_folder_of(box.home, path, true, dir);
+  std::string text;
+  std::uint64_t live = 0;
+  for (const auto& m : box.messages) {
+    std::size_t before = text.size();
+    append_entry(text, m);
+    live += text.size() - before;
+  }
+  append_trailer(text, box);
+  int rc = where.ok() ? dir.replace_file(path_leaf(path), text, 0600) : where.error;
+  if (rc == 0) {
+    box.overview_written = now();
+    box.overview_size = text.size();
+    box.overview_live = live;
+    box.changed = false;
+    clear_pending_flags(box);
+  } else {
+    box.overview_size = 0;  // unknown: written whole next time
+    log_message("Mailbox overview write failed:", path + " " + error_text(rc), logfac::maildebatch);
+  }
+  return rc;
+}
+
+// Appends records to the overview (they end with the trailer) and syncs
+// it. When the file is not as the record last left it, it is written whole
+// instead. On failure the file is cut back to where it was. 0 or an errno value.
+int overview_append(Mailbox& box, std::string_view records) {
+  if (box.overview_size == 0) return overview_write_whole(box);
+  std::string path = mailbox_overview_path(box.path);
+  UniqueFd fd;
+  SafeResult r = open_below(box.home, path, O_WRONLY, fd);
+  struct stat st {};
+  if (!r.ok() || ::fstat(fd.get(), &st) != 0 || static_cast<std::uint64_t>(st.st_size) != box.overview_size) {
+    if (r.refused()) return r.error;
+    return overview_write_whole(box);
+  }
+  int rc = pwrite_all(fd.get(), records, box.overview_size);
+  if (!rc && sysio::fsync(fd.get()) != 0) rc = errno;
+  if (rc) {
+    if (sysio::ftruncate(fd.get(), static_cast<off_t>(box.overview_size)) != 0 || sysio::fsync(fd.get()) != 0)
+      box.overview_size = 0;  // what is there now is unknown: written whole next time
+    log_message("Mailbox overview append failed:", path + " " + error_text(rc), logfac::maildebatch);
+    return rc;
+  }
+  box.overview_size += records.size();
+  box.overview_written = now();
+  box.changed = false;
+  clear_pending_flags(box);
+  return 0;
+}
+
+// Records the messages from `first` to the end of the list, which were just
+// taken in, in the overview.
+int overview_add(Mailbox& box, std::list<MessageRecord>::iterator first) {
+  std::string text;
+  std::uint64_t live = 0;
+  for (auto it = first; it != box.messages.end(); ++it) {
+    std::size_t before = text.size();
+    append_entry(text, *it);
+    live += text.size() - before;
+  }
+  append_pending_flags(text, box);
+  append_trailer(text, box);
+  bool whole = box.overview_size == 0;
+  int rc = overview_append(box, text);
+  if (rc == 0 && !whole) box.overview_live += live;
+  return rc;
+}
+
+// Every append in flight is given up: the file was replaced or cut back
+// under it. Staged messages are told, and the writer starts again.
+void appends_lost(Mailbox& box, int error) {
+  ++box.epoch;
+  box.appending = false;
+  box.append_fd.close();
+  std::list<StagedMessage> staged;
+  staged.swap(box.staged);
+  box.tail = box.bytes;
+  for (auto& s : staged) {
+    if (s.done) s.done(error);
+  }
 }
 
 // Parses the whole mailbox file again and writes a fresh overview. The next
@@ -274,12 +480,13 @@ void reset(Mailbox& box) {
 // sees one reused.
 void rebuild(Mailbox& box, ByteSource& in) {
   std::uint32_t next = std::max<std::uint32_t>(box.next_uid, 1);
+  appends_lost(box, EAGAIN);
   reset(box);
   box.next_uid = 1;
   parse_all(box, in, 0);
   box.next_uid = std::max(box.next_uid, next);
-  recount(box);
-  mailbox_overview_write(box);
+  box.tail = box.bytes;
+  overview_write_whole(box);
 }
 
 bool newer(const struct timespec& a, const struct timespec& b) {
@@ -308,36 +515,77 @@ void cut_back(const Mailbox& box, const struct stat& seen, std::uint64_t length)
             logchan::errors);
 }
 
-// Brings a record in line with its file. A file longer than the records
-// holds either whole messages added behind our back, which are parsed, or
-// what an interrupted append left, which is cut off so that no later
-// message is glued to it. A file that shrank is read again unless a
-// session is using it (its message numbers must not move under it).
+// Brings a record in line with its file. The file is expected to end where
+// our own appends end. A file longer than the records holds either whole
+// messages added behind our back, which are parsed, or what an interrupted
+// append left, which is cut off so that no later message is glued to it. A
+// file that shrank is read again unless a session is using it (its message
+// numbers must not move under it).
 void settle(Mailbox& box, FileSource& in, const struct stat& st) {
-  std::uint64_t known = mailbox_size(box);
+  // (a message being written lies behind `tail`)
+  if (in.size() == box.tail || (box.appending && in.size() > box.tail)) return;
+  if (box.tail != box.bytes || box.appending) appends_lost(box, EAGAIN);  // changed under our appends
+  std::uint64_t known = box.bytes;
   if (in.size() == known) return;
   if (in.size() < known) {
     if (!(box.flags & boxflag::in_use)) rebuild(box, in);
   } else if (whole_messages(in, known)) {
+    auto last = box.messages.empty() ? box.messages.end() : std::prev(box.messages.end());
     parse_all(box, in, known);
-    recount(box);
-    mailbox_overview_write(box);
+    box.tail = box.bytes;
+    overview_add(box, last == box.messages.end() ? box.messages.begin() : std::next(last));
   } else {
     cut_back(box, st, known);
+    ++box.epoch;
   }
 }
 
-// Reads the overview file; 0 and its time of writing, or non-zero.
+// Reads the overview file; 0 and its time of writing, or non-zero. Records
+// after the last whole "#length" line (an append cut off by a crash) are
+// dropped, from the file too.
 int read_overview(Mailbox& box, struct timespec& written) {
+  std::string path = mailbox_overview_path(box.path);
   UniqueFd fd;
-  if (!open_below(box.home, mailbox_overview_path(box.path), O_RDONLY, fd).ok()) return 1;
+  if (!open_below(box.home, path, O_RDONLY, fd).ok()) return 1;
   struct stat st {};
   if (::fstat(fd.get(), &st) != 0) return 1;
   written = st.st_mtim;
   FileSource in(std::move(fd));
   std::string_view text = in.view(0, static_cast<std::size_t>(in.size()));
   if (text.size() != in.size()) return 1;
-  return mailbox_overview_parse(box, text);
+  std::uint64_t live = 0;
+  std::size_t valid = text.size();
+  int rc = parse_overview(box, text, &live);
+  for (int tries = 0; rc != 0 && tries < 3; ++tries) {
+    // The end of the last whole "#length" line before `valid`.
+    std::size_t end = std::string_view::npos;
+    for (std::size_t from = valid; from > 0;) {
+      std::size_t at = text.rfind("#length ", from - 1);
+      if (at == std::string_view::npos) break;
+      std::size_t lf = text.find('\n', at);
+      if ((at == 0 || text[at - 1] == '\n') && lf != std::string_view::npos && lf + 1 < valid) {
+        end = lf + 1;
+        break;
+      }
+      from = at;
+    }
+    if (end == std::string_view::npos) break;
+    valid = end;
+    rc = parse_overview(box, text.substr(0, valid), &live);
+  }
+  if (rc != 0) return rc;
+  box.overview_size = valid;
+  box.overview_live = live;
+  if (valid < text.size()) {
+    UniqueFd w;
+    if (!open_below(box.home, path, O_WRONLY, w).ok() || sysio::ftruncate(w.get(), static_cast<off_t>(valid)) != 0 ||
+        sysio::fsync(w.get()) != 0)
+      box.overview_size = 0;
+    log_write(strprintf("Mailbox overview %s: an unfinished append of %zu bytes dropped", path.c_str(),
+                        text.size() - valid),
+              logchan::errors);
+  }
+  return 0;
 }
 
 }  // namespace
@@ -419,37 +667,22 @@ std::string mailbox_overview_path(std::string_view mailbox_path) {
   return std::string(mailbox_path.substr(0, slash)) + "/overview" + std::string(mailbox_path.substr(slash));
 }
 
-std::uint64_t mailbox_size(const Mailbox& box) {
-  std::uint64_t sum = 0;
-  for (const auto& m : box.messages) sum += m.total_length;
-  return sum;
-}
+std::uint64_t mailbox_size(const Mailbox& box) { return box.bytes; }
 
 // ---- parsing ----------------------------------------------------------------
 
-std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbox& box) {
-  if (offset >= in.size()) return kNoMessage;
+struct MessageParser::State {
+  std::uint64_t offset = 0, pos = 0, end = 0, size = 0;
+  bool started = false, done = false, empty = false, failed = false;
   MessageRecord rec;
-  std::uint64_t pos = offset;
-  Line first = read_line(in, pos);
-  if (first.length == 0) return kNoMessage;
   std::uint64_t separator_length = 0;
-  rec.internal_date = now();
-  if (str_istarts_with(first.text, "From ")) {
-    std::time_t t = mailbox_separator_date(first.text);
-    if (t != kBadDate) rec.internal_date = t;
-    separator_length = first.length;
-    pos += first.length;
-  }
-
   // The header: logical lines (continuations joined), examined by name.
-  std::string boundary;
-  std::string header;
-  bool in_header = true;
-  bool after_terminator = false;
+  std::string boundary, header;
+  bool in_header = true, after_terminator = false;
   std::uint64_t header_end = 0;
-  std::uint32_t uid = 0;
-  auto examine = [&](std::string_view h) {
+  std::unique_ptr<MimeScanner> mime;
+
+  void examine(std::string_view h) {
     if (h.empty()) return;
     switch (h.front() | 0x20) {
       case 'c':
@@ -482,7 +715,7 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
           if (v.find('D') != std::string_view::npos) rec.flags |= msgflag::deleted;
           if (v.find('A') != std::string_view::npos) rec.flags |= msgflag::answered;
         } else if (str_istarts_with(h, "X-UID:")) {
-          uid = parse_u32(value_after_colon(h));
+          rec.uid = parse_u32(value_after_colon(h));
         } else if (h.size() > 2 && (str_istarts_with(h.substr(2), "read-receipt: yes") ||
                                     str_istarts_with(h.substr(2), "return-receipt-to:"))) {
           rec.flags |= msgflag::receipt_wanted;
@@ -491,125 +724,156 @@ std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbo
       default:
         break;
     }
-  };
+  }
 
-  std::unique_ptr<MimeScanner> mime;
-  std::uint64_t end = in.size();
-  while (pos < in.size()) {
-    Line line = read_line(in, pos);
-    if (line.length == 0) break;
-    if (after_terminator && str_istarts_with(line.text, "From ")) {
-      end = pos;
-      break;
+  void start(ByteSource& in) {
+    started = true;
+    pos = offset;
+    if (offset >= in.size()) {
+      done = empty = true;
+      return;
     }
-    after_terminator = is_terminator_line(line.text);
-    if (in_header) {
-      if (is_empty_line(line.text) || after_terminator) {
-        examine(header);
-        header.clear();
-        in_header = false;
-        header_end = after_terminator ? pos : pos + line.length;
-        if (!boundary.empty()) mime = std::make_unique<MimeScanner>(rec.parts, boundary);
-      } else if (is_blank(line.text.front()) && !header.empty()) {
-        append_bounded(header, line.text);
-      } else {
-        examine(header);
-        header.clear();
-        append_bounded(header, line.text);
+    Line first = read_line(in, pos);
+    if (first.length == 0) {
+      done = empty = true;
+      return;
+    }
+    rec.internal_date = now();
+    if (str_istarts_with(first.text, "From ")) {
+      std::time_t t = mailbox_separator_date(first.text);
+      if (t != kBadDate) rec.internal_date = t;
+      separator_length = first.length;
+      pos += first.length;
+    }
+  }
+
+  // Lines until `stop`; true when the message has ended.
+  bool lines(ByteSource& in, std::uint64_t stop) {
+    while (pos < in.size()) {
+      if (pos >= stop) return false;
+      Line line = read_line(in, pos);
+      if (line.length == 0) break;
+      if (after_terminator && str_istarts_with(line.text, "From ")) {
+        end = pos;
+        return true;
       }
-    } else if (mime && !after_terminator) {
-      mime->line(line.text, pos - offset, line.length);
+      after_terminator = is_terminator_line(line.text);
+      if (in_header) {
+        if (is_empty_line(line.text) || after_terminator) {
+          examine(header);
+          header.clear();
+          in_header = false;
+          header_end = after_terminator ? pos : pos + line.length;
+          if (!boundary.empty()) mime = std::make_unique<MimeScanner>(rec.parts, boundary);
+        } else if (is_blank(line.text.front()) && !header.empty()) {
+          append_bounded(header, line.text);
+        } else {
+          examine(header);
+          header.clear();
+          append_bounded(header, line.text);
+        }
+      } else if (mime && !after_terminator) {
+        mime->line(line.text, pos - offset, line.length);
+      }
+      pos += line.length;
     }
-    pos += line.length;
-  }
-  if (in.failed()) return kNoMessage;
-  if (in_header) {
-    examine(header);
-    header_end = end;
-  }
-  if (mime) {
-    mime->finish(end - offset);
-    if (!rec.parts.empty()) rec.flags |= msgflag::mime;
+    end = in.size();
+    return true;
   }
 
-  rec.total_length = end - offset;
-  rec.length = rec.total_length - separator_length;
-  rec.header_length = header_end - offset;
-  if (box.next_uid == 0) box.next_uid = 1;
-  rec.uid = uid ? uid : box.next_uid;
-  box.next_uid = std::max(box.next_uid, rec.uid + 1);
-  ++box.count;
-  if (!(rec.flags & msgflag::seen)) ++box.unseen;
-  box.messages.push_back(std::move(rec));
-  box.changed = true;
-  return end < in.size() ? end : kNoMessage;
+  void finish(ByteSource& in) {
+    done = true;
+    size = in.size();
+    if (in.failed()) {
+      failed = true;
+      return;
+    }
+    if (in_header) {
+      examine(header);
+      header_end = end;
+    }
+    if (mime) {
+      mime->finish(end - offset);
+      mime.reset();
+      if (!rec.parts.empty()) rec.flags |= msgflag::mime;
+    }
+    rec.total_length = end - offset;
+    rec.length = rec.total_length - separator_length;
+    rec.header_length = header_end - offset;
+  }
+};
+
+MessageParser::MessageParser(std::uint64_t offset) : s_(std::make_unique<State>()) { s_->offset = offset; }
+MessageParser::MessageParser(MessageParser&&) noexcept = default;
+MessageParser& MessageParser::operator=(MessageParser&&) noexcept = default;
+MessageParser::~MessageParser() = default;
+
+bool MessageParser::step(ByteSource& in, std::uint64_t budget) {
+  State& s = *s_;
+  if (s.done) return true;
+  if (!s.started) {
+    s.start(in);
+    if (s.done) return true;
+  }
+  std::uint64_t stop = budget > kNoMessage - s.pos ? kNoMessage : s.pos + budget;
+  if (!s.lines(in, stop)) return false;
+  s.finish(in);
+  return true;
 }
 
-int mailbox_commit(Mailbox& box, ByteSource& in, std::uint64_t from) {
-  std::size_t before = box.messages.size();
-  std::uint32_t next = box.next_uid;
-  parse_all(box, in, from);
-  recount(box);
-  int rc = in.failed() ? EIO : mailbox_overview_write(box);
-  if (rc) {
-    box.messages.resize(before);
-    box.next_uid = next;
-    recount(box);
+MessageRecord MessageParser::take(std::uint64_t& next) {
+  State& s = *s_;
+  if (!s.done || s.empty || s.failed) {
+    next = kNoMessage;
+    return {};
   }
-  return rc;
+  next = s.end < s.size ? s.end : kNoMessage;
+  return std::move(s.rec);
+}
+
+std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbox& box) {
+  MessageParser parser(offset);
+  parser.step(in, kNoMessage);
+  std::uint64_t next = kNoMessage;
+  MessageRecord rec = parser.take(next);
+  if (rec.total_length == 0) return kNoMessage;  // nothing there, or the file could not be read
+  add_parsed(box, std::move(rec));
+  return next;
 }
 
 // ---- overview -----------------------------------------------------------------
 
 std::string mailbox_overview_text(const Mailbox& box) {
-  auto clean = [](std::string_view v) {
-    std::string s;
-    s.reserve(v.size());
-    for (char c : v) {
-      if (c != '\r' && c != '\n') s += c;
-    }
-    return s;
-  };
-  auto date = [](std::time_t t) -> unsigned long long {
-    return t == kBadDate ? static_cast<unsigned long long>(now()) : static_cast<unsigned long long>(t);
-  };
   std::string out;
-  // The next identifier is kept too, so identifiers are never reused after
-  // the newest messages were removed.
-  strappendf(out, "#uidnext %u\n#length %llu\n", box.next_uid,
-             static_cast<unsigned long long>(mailbox_size(box)));
-  for (const auto& m : box.messages) {
-    strappendf(out, "#msg\n%llu,%llu,%llu,%llu,%u,%u,%llu\n", date(m.internal_date),
-               static_cast<unsigned long long>(m.sent_date), static_cast<unsigned long long>(m.total_length),
-               static_cast<unsigned long long>(m.length), m.flags, m.uid,
-               static_cast<unsigned long long>(m.header_length));
-    for (const std::string* v : {&m.from, &m.to, &m.subject, &m.reply_to}) {
-      out += clean(*v);
-      out += '\n';
-    }
-    for (const auto& p : m.parts) {
-      strappendf(out, "#mime\n%u,%u,%u,%d,%d,%d\n", p.length, p.lines, p.body_offset, p.encoding, p.level,
-                 p.number);
-      for (const std::string* v : {&p.content_type, &p.description, &p.content_id}) {
-        out += clean(*v);
-        out += '\n';
-      }
-    }
-    out += "#end\n";
-  }
+  for (const auto& m : box.messages) append_entry(out, m);
+  append_trailer(out, box);
   return out;
 }
 
-int mailbox_overview_parse(Mailbox& box, std::string_view text) {
+namespace {
+
+int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live_out) {
   std::list<MessageRecord> messages;
+  // The message blocks by identifier (they rise), with the length of their
+  // text, so that later records can name them.
+  struct Block {
+    std::uint32_t uid;
+    std::list<MessageRecord>::iterator at;
+    std::uint64_t size;
+    bool gone;
+  };
+  std::vector<Block> blocks;
   std::uint32_t next = 1;
   std::optional<std::uint64_t> committed;
+  std::uint64_t sum = 0;
   // Numbers must fit their fields, or what is written back would differ.
   constexpr unsigned long long kU32 = 0xffffffffULL, kInt = 0x7fffffffULL;
+  // A text that does not end with a whole line was cut off.
+  if (!text.empty() && text.back() != '\n') return 1;
   auto next_line = [&](std::string_view& line) {
     if (text.empty()) return false;
     std::size_t lf = text.find('\n');
-    if (lf == std::string_view::npos) return false;  // a cut-off last line
+    if (lf == std::string_view::npos) return false;
     line = text.substr(0, lf);
     text.remove_prefix(lf + 1);
     return true;
@@ -628,8 +892,19 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
     }
     return p == e;
   };
+  // The live block of a message named by a later record.
+  auto block_of = [&](std::string_view number) -> Block* {
+    unsigned long long uid = 0;
+    auto r = std::from_chars(number.data(), number.data() + number.size(), uid);
+    if (r.ec != std::errc() || uid > kU32) return nullptr;
+    auto it = std::lower_bound(blocks.begin(), blocks.end(), static_cast<std::uint32_t>(uid),
+                               [](const Block& b, std::uint32_t u) { return b.uid < u; });
+    if (it == blocks.end() || it->uid != uid || it->gone) return nullptr;
+    return &*it;
+  };
   std::string_view line;
   MessageRecord* current = nullptr;
+  const char* block_start = nullptr;
   while (next_line(line)) {
     if (line.substr(0, 9) == "#uidnext ") {
       next = std::max(next, parse_u32(line.substr(9)));
@@ -638,12 +913,16 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
       if (std::from_chars(line.data() + 8, line.data() + line.size(), v).ec != std::errc()) return 1;
       committed = v;
     } else if (line == "#msg") {
+      if (current) return 1;
+      block_start = line.data();
       std::string_view nums, from, to, subject, reply_to;
       unsigned long long v[7];
       if (!next_line(nums) || !numbers(nums, v, 7) || v[4] > kU32 || v[5] > kU32 || !next_line(from) || !next_line(to) ||
           !next_line(subject) || !next_line(reply_to)) {
         return 1;
       }
+      if (!blocks.empty() && v[5] <= blocks.back().uid) return 1;  // identifiers rise
+      if (v[5] == 0) return 1;
       MessageRecord& m = messages.emplace_back();
       m.internal_date = static_cast<std::time_t>(v[0]);
       m.sent_date = static_cast<std::time_t>(v[1]);
@@ -658,6 +937,8 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
       m.subject = subject;
       m.reply_to = reply_to;
       next = std::max(next, m.uid + 1);
+      sum += m.total_length;
+      blocks.push_back({m.uid, std::prev(messages.end()), 0, false});
       current = &m;
     } else if (line == "#mime") {
       std::string_view nums, type, desc, id;
@@ -680,36 +961,251 @@ int mailbox_overview_parse(Mailbox& box, std::string_view text) {
     } else if (line == "#end") {
       if (!current) return 1;
       current = nullptr;
+      blocks.back().size = static_cast<std::uint64_t>(text.data() - block_start);
+    } else if (line.substr(0, 7) == "#flags ") {
+      std::string_view rest = line.substr(7);
+      std::size_t blank = rest.find(' ');
+      Block* b = current || blank == std::string_view::npos ? nullptr : block_of(rest.substr(0, blank));
+      unsigned long long flags = 0;
+      std::string_view f = rest.substr(blank == std::string_view::npos ? rest.size() : blank + 1);
+      auto r = std::from_chars(f.data(), f.data() + f.size(), flags);
+      if (!b || r.ec != std::errc() || r.ptr != f.data() + f.size() || flags > kU32) return 1;
+      b->at->flags = static_cast<std::uint32_t>(flags);
+    } else if (line.substr(0, 9) == "#expunge ") {
+      Block* b = current ? nullptr : block_of(line.substr(9));
+      if (!b) return 1;
+      sum -= b->at->total_length;
+      messages.erase(b->at);
+      b->gone = true;
     }
   }
   if (current) return 1;  // the last message's block was cut off
-  std::uint64_t sum = 0;
-  for (const auto& m : messages) sum += m.total_length;
-  if (committed && *committed != sum) return 1;  // whole message blocks are missing
+  if (!committed || *committed != sum) return 1;  // cut off, or whole message blocks are missing
+  std::uint64_t live = 0;
+  for (const Block& b : blocks) {
+    if (!b.gone) live += b.size;
+  }
+  if (live_out) *live_out = live;
   box.messages = std::move(messages);
+  box.flags_pending.clear();
   box.next_uid = next;
   box.loaded = now();
   recount(box);
+  box.tail = box.bytes;
   return 0;
 }
 
-int mailbox_overview_write(Mailbox& box) {
-  std::string path = mailbox_overview_path(box.path);
-  SafeDir dir;
-  SafeResult where = open_folder_of(box.home, path, true, dir);
-  int rc = where.ok() ? dir.replace_file(path_leaf(path), mailbox_overview_text(box), 0600) : where.error;
-  if (rc == 0) {
-    box.overview_written = now();
-    box.changed = false;
-  } else {
-    log_message("Mailbox overview write failed:", path + " " + error_text(rc), logfac::maildebatch);
-  }
-  return rc;
-}
+}  // namespace
+
+int mailbox_overview_parse(Mailbox& box, std::string_view text) { return parse_overview(box, text, nullptr); }
+
+int mailbox_overview_write(Mailbox& box) { return overview_write_whole(box); }
 
 int mailbox_overview_read(Mailbox& box) {
   struct timespec written {};
   return read_overview(box, written);
+}
+
+// ---- appends --------------------------------------------------------------------
+
+int mailbox_append_begin(Mailbox& box, UniqueFd fd, AppendSlot& slot) {
+  if (box.appending) return EAGAIN;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0) return errno;
+  if (box.append_fd) {
+    struct stat held {};
+    if (::fstat(box.append_fd.get(), &held) != 0 || held.st_ino != st.st_ino || held.st_dev != st.st_dev)
+      appends_lost(box, EAGAIN);  // the file was replaced under the staged messages
+  }
+  // The message goes behind the last one written. A file that does not
+  // match (it could not be cut back, or changed while a session holds it)
+  // waits, rather than glue the message to something unknown.
+  if (static_cast<std::uint64_t>(st.st_size) != box.tail) return ESTALE;
+  if (!box.append_fd) box.append_fd = std::move(fd);
+  if (box.next_uid == 0) box.next_uid = 1;
+  slot.offset = box.tail;
+  slot.uid = box.next_uid++;
+  slot.epoch = box.epoch;
+  box.appending = true;
+  return 0;
+}
+
+int mailbox_append_fd(const Mailbox& box) { return box.append_fd.get(); }
+
+bool mailbox_append_stale(const Mailbox& box, const AppendSlot& slot) { return box.epoch != slot.epoch; }
+
+void mailbox_append_stage(Mailbox& box, const AppendSlot& slot, MessageRecord record, std::function<void(int)> done) {
+  record.uid = slot.uid;
+  box.tail = slot.offset + record.total_length;
+  box.appending = false;
+  box.staged.push_back({std::move(record), std::move(done)});
+}
+
+void mailbox_append_abandon(Mailbox& box, const AppendSlot& slot) {
+  if (mailbox_append_stale(box, slot)) return;  // the file was settled without it
+  box.appending = false;
+  if (box.append_fd) {
+    int fd = box.append_fd.get();
+    if (sysio::ftruncate(fd, static_cast<off_t>(slot.offset)) == 0) sysio::fsync(fd);
+  }
+  box.tail = slot.offset;
+  if (box.next_uid == slot.uid + 1) box.next_uid = slot.uid;
+  if (box.staged.empty()) box.append_fd.close();
+}
+
+int mailbox_commit_staged(Mailbox& box) {
+  if (box.staged.empty()) return 0;
+  std::list<StagedMessage> staged;
+  staged.swap(box.staged);
+  std::uint32_t first_uid = staged.front().record.uid;
+  std::uint64_t before = box.bytes;
+  int rc = sysio::fsync(box.append_fd.get()) == 0 ? 0 : errno;
+  auto last = box.messages.empty() ? box.messages.end() : std::prev(box.messages.end());
+  if (!rc) {
+    for (auto& s : staged) {
+      count_in(box, s.record);
+      box.messages.push_back(std::move(s.record));
+    }
+    rc = overview_add(box, last == box.messages.end() ? box.messages.begin() : std::next(last));
+    if (rc) {
+      auto first = last == box.messages.end() ? box.messages.begin() : std::next(last);
+      for (auto it = first; it != box.messages.end(); ++it) count_out(box, *it);
+      box.messages.erase(first, box.messages.end());
+    }
+  }
+  if (rc) {
+    // Nothing of the group counts: the mailbox is cut back to what was
+    // committed, and the identifiers are handed out again.
+    int fd = box.append_fd.get();
+    if (sysio::ftruncate(fd, static_cast<off_t>(before)) == 0) sysio::fsync(fd);
+    bool in_flight = box.appending;
+    box.tail = before;
+    if (in_flight) {
+      ++box.epoch;  // the message being written was cut off too: it starts again
+      box.appending = false;
+    }
+    box.next_uid = first_uid;
+    box.append_fd.close();
+    log_write("Mailbox " + box.path + ": " + std::to_string(staged.size()) + " messages not delivered: " +
+                  error_text(rc),
+              logchan::errors);
+  } else {
+    box.flags |= boxflag::new_mail | boxflag::delivered;
+    if (!box.appending) box.append_fd.close();
+  }
+  for (auto& s : staged) {
+    if (s.done) s.done(rc);
+  }
+  return rc;
+}
+
+void mailbox_commit_staged() {
+  for (auto& box : g_boxes) {
+    if (!box.staged.empty()) mailbox_commit_staged(box);
+  }
+}
+
+// ---- flags and compaction -------------------------------------------------------
+
+void mailbox_flags_changed(Mailbox& box, MessageRecord& message) {
+  box.changed = true;
+  if (!message.flags_pending) {
+    message.flags_pending = true;
+    box.flags_pending.push_back(&message);
+  }
+  auto it = g_compactions.find(&box);
+  if (it != g_compactions.end()) it->second.changed.push_back(&message);
+}
+
+int mailbox_overview_flush(Mailbox& box) {
+  if (box.flags_pending.empty()) return 0;
+  std::string text;
+  append_pending_flags(text, box);
+  append_trailer(text, box);
+  return overview_append(box, text);
+}
+
+bool mailbox_overview_stale(const Mailbox& box) {
+  if (box.overview_size <= box.overview_live) return false;
+  std::uint64_t dead = box.overview_size - box.overview_live;
+  return dead > kStaleMinimum && dead > box.overview_live / 2;
+}
+
+CompactStep mailbox_compact_step(Mailbox& box, std::chrono::steady_clock::time_point deadline) {
+  auto found = g_compactions.find(&box);
+  if (found == g_compactions.end()) {
+    Compaction c;
+    std::string path = mailbox_overview_path(box.path);
+    c.leaf = std::string(path_leaf(path));
+    c.tmp = c.leaf + "~";
+    SafeResult r = open_folder_of(box.home, path, true, c.dir);
+    if (r.ok()) r = c.dir.create_new(c.tmp, 0600, c.out);
+    if (!r.ok()) {
+      g_compact_failed[&box] = now();
+      return CompactStep::failed;
+    }
+    found = g_compactions.emplace(&box, std::move(c)).first;
+  }
+  Compaction& c = found->second;
+  auto fail = [&](int rc) {
+    log_message("Mailbox overview compaction failed:", box.path + " " + error_text(rc), logfac::maildebatch);
+    compaction_abort(box);
+    g_compact_failed[&box] = now();
+    return CompactStep::failed;
+  };
+  std::string text;
+  for (;;) {
+    auto it = c.any ? std::next(c.last) : box.messages.begin();
+    for (int n = 0; it != box.messages.end() && text.size() < kCompactSlice; ++it, ++n) {
+      std::size_t before = text.size();
+      append_entry(text, *it);
+      c.live += text.size() - before;
+      c.last = it;
+      c.any = true;
+      if (n % 64 == 63 && std::chrono::steady_clock::now() >= deadline) break;
+    }
+    if (int rc = write_all(c.out.get(), text)) return fail(rc);
+    c.written += text.size();
+    text.clear();
+    if (c.any ? std::next(c.last) == box.messages.end() : box.messages.empty()) break;
+    if (std::chrono::steady_clock::now() >= deadline) return CompactStep::working;
+  }
+  // Every record is written: flags changed meanwhile, the trailer, and the
+  // file is synced and takes the overview's name.
+  for (const MessageRecord* m : c.changed) strappendf(text, "#flags %u %u\n", m->uid, m->flags);
+  append_trailer(text, box);
+  if (int rc = write_all(c.out.get(), text)) return fail(rc);
+  c.written += text.size();
+  if (sysio::fsync(c.out.get()) != 0) return fail(errno);
+  if (int rc = c.out.close()) return fail(rc);
+  if (int rc = c.dir.rename(c.tmp, c.leaf)) return fail(rc);
+  c.dir.sync();
+  box.overview_size = c.written;
+  box.overview_live = c.live;
+  box.overview_written = now();
+  box.changed = false;
+  clear_pending_flags(box);
+  g_compactions.erase(found);
+  g_compact_failed.erase(&box);
+  return CompactStep::done;
+}
+
+bool mailbox_upkeep_running() { return !g_compactions.empty(); }
+
+bool mailbox_upkeep(std::chrono::steady_clock::time_point deadline) {
+  bool more = false;
+  for (auto& box : g_boxes) {
+    if (std::chrono::steady_clock::now() >= deadline) return true;
+    bool running = g_compactions.count(&box) > 0;
+    if (!running && !box.flags_pending.empty()) mailbox_overview_flush(box);
+    if (!running) {
+      auto failed = g_compact_failed.find(&box);
+      bool waiting = failed != g_compact_failed.end() && now() < failed->second + kCompactRetrySeconds;
+      if (waiting || !mailbox_overview_stale(box)) continue;
+    }
+    if (mailbox_compact_step(box, deadline) == CompactStep::working) more = true;
+  }
+  return more;
 }
 
 // ---- the cache ----------------------------------------------------------------
@@ -723,7 +1219,6 @@ Mailbox* mailbox_lookup(const std::string& path, const std::string& home) {
   for (auto& box : g_boxes) {
     if (box.path != path) continue;  // paths are case-sensitive here
     settle(box, in, st);
-    recount(box);
     box.looked_up = now();
     return &box;
   }
@@ -734,7 +1229,8 @@ Mailbox* mailbox_lookup(const std::string& path, const std::string& home) {
   // The overview is trusted when it describes this very file: the same
   // length, written after the mailbox last changed; or a shorter length,
   // which the file is then settled to. Anything else (a hand edit, a crash
-  // inside an expunge) is parsed again.
+  // inside an expunge) is parsed again. Reading it is the one cost of
+  // opening a mailbox; the file itself is not read.
   struct timespec written {};
   if (read_overview(box, written) == 0) {
     std::uint64_t known = mailbox_size(box);
@@ -755,7 +1251,11 @@ UniqueFd mailbox_open(const Mailbox& box) {
   return fd;
 }
 
-void mailbox_cache_clear() { g_boxes.clear(); }
+void mailbox_cache_clear() {
+  for (auto& box : g_boxes) compaction_abort(box);
+  g_compact_failed.clear();
+  g_boxes.clear();
+}
 
 bool mailbox_take(Mailbox& box, std::uint64_t owner) {
   if (box.flags & boxflag::in_use) return box.in_use_by == owner;
@@ -777,6 +1277,9 @@ int mailbox_expunge(Mailbox& box) {
   bool any = std::any_of(box.messages.begin(), box.messages.end(),
                          [](const MessageRecord& m) { return m.flags & msgflag::deleted; });
   if (!any) return 0;
+  // Messages written but not yet committed are committed first, so that
+  // the new mailbox keeps them.
+  mailbox_commit_staged(box);
   // Everything happens inside the mailbox's folder, reached the safe way;
   // nothing is looked up by path again.
   SafeDir dir;
@@ -812,11 +1315,12 @@ int mailbox_expunge(Mailbox& box) {
     offset += m.total_length;
   }
   if (run_length && !rc) rc = copy_range(old.get(), run_start, run_length, out.get());
-  // Whole messages appended behind the records (none while the mark is
-  // held) stay; the rest of an interrupted append does not.
+  // Whole messages appended behind the records by someone else (none while
+  // the mark is held) stay; the rest of an interrupted append does not, and
+  // nor do our own appends not yet committed, which start again.
   std::uint64_t tail = static_cast<std::uint64_t>(st.st_size) - offset;
   FileSource old_text(old.get());
-  if (tail && !whole_messages(old_text, offset)) tail = 0;
+  if (tail && (box.tail != box.bytes || box.appending || !whole_messages(old_text, offset))) tail = 0;
   if (tail && !rc) rc = copy_range(old.get(), offset, tail, out.get());
   if (!rc && sysio::fsync(out.get()) != 0) rc = errno;
   if (int c = out.close(); !rc) rc = c;
@@ -827,18 +1331,50 @@ int mailbox_expunge(Mailbox& box) {
     return rc;
   }
   dir.sync();
-  box.messages.remove_if([](const MessageRecord& m) { return m.flags & msgflag::deleted; });
-  recount(box);
+  appends_lost(box, EAGAIN);
+  compaction_abort(box);
+
+  // The overview learns which messages went (and takes in a tail of whole
+  // messages); it is compacted later, in the background.
+  std::string text;
+  std::uint64_t gone_live = 0;
+  std::erase_if(box.flags_pending, [](const MessageRecord* m) { return (m->flags & msgflag::deleted) != 0; });
+  for (auto it = box.messages.begin(); it != box.messages.end();) {
+    if (!(it->flags & msgflag::deleted)) {
+      ++it;
+      continue;
+    }
+    strappendf(text, "#expunge %u\n", it->uid);
+    gone_live += entry_size(*it);
+    count_out(box, *it);
+    it = box.messages.erase(it);
+  }
+  auto last = box.messages.empty() ? box.messages.end() : std::prev(box.messages.end());
   if (tail) {
     UniqueFd now_fd;
     if (dir.open_file(leaf, O_RDONLY, now_fd).ok()) {
       FileSource in(std::move(now_fd));
       parse_all(box, in, mailbox_size(box));
-      recount(box);
     }
   }
+  box.tail = box.bytes;
   box.changed = true;
-  mailbox_overview_write(box);
+  std::uint64_t added_live = 0;
+  for (auto it = last == box.messages.end() ? box.messages.begin() : std::next(last); it != box.messages.end(); ++it) {
+    append_entry(text, *it);
+    added_live += entry_size(*it);
+  }
+  append_pending_flags(text, box);
+  append_trailer(text, box);
+  box.overview_live += added_live;
+  box.overview_live -= std::min(gone_live, box.overview_live);
+  // A small overview is written afresh at once, which costs no more than
+  // the records would; a large one gets the records and is compacted later.
+  if (box.overview_live <= kSmallOverview) {
+    overview_write_whole(box);
+  } else {
+    overview_append(box, text);
+  }
   return 0;
 }
 

@@ -6,13 +6,16 @@
 // mailbox without reading it.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <ctime>
+#include <functional>
 #include <list>
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core/fileio.h"
 
@@ -48,6 +51,7 @@ struct MessageRecord {
   std::uint32_t uid = 0;
   std::uint64_t header_length = 0;  // offset of the body from the message start
   std::list<MimePart> parts;
+  bool flags_pending = false;       // changed since the overview last recorded its flags
 };
 // "Message start" is the start of its separator line throughout: a message
 // without one (a damaged file's first message) has total_length == length.
@@ -58,6 +62,15 @@ inline constexpr std::uint32_t in_use = 0x01;  // a POP3/IMAP/web-mail session h
 inline constexpr std::uint32_t new_mail = 0x1000;
 inline constexpr std::uint32_t delivered = 0x10000;
 }  // namespace boxflag
+
+// A message written behind the committed end of a mailbox and parsed, whose
+// delivery counts once the mailbox and its overview are synced
+// (mailbox_commit_staged). `done` learns how that went: 0, or an errno
+// value when the message was taken back out.
+struct StagedMessage {
+  MessageRecord record;
+  std::function<void(int error)> done;
+};
 
 struct Mailbox {
   std::string path;
@@ -72,6 +85,24 @@ struct Mailbox {
   bool changed = false;
   std::time_t looked_up = 0, overview_written = 0, loaded = 0;
   std::list<MessageRecord> messages;
+  std::uint64_t bytes = 0;  // the committed length: the sum of the messages' lengths
+
+  // The overview file as it is on disk: its length (0 = unknown, written
+  // whole next time), and the length it would have written afresh. Appends
+  // and removals only add records to it; it is compacted once the dead
+  // records outweigh the live ones.
+  std::uint64_t overview_size = 0, overview_live = 0;
+  std::vector<MessageRecord*> flags_pending;  // flag changes not yet in the overview
+
+  // Appends not yet committed. `tail` is the end of everything written to
+  // the file (the committed length when nothing is), `appending` tells that
+  // a message is being written there now, and `epoch` changes whenever the
+  // file is replaced or cut back, so an append in flight starts again.
+  std::list<StagedMessage> staged;
+  std::uint64_t tail = 0;
+  bool appending = false;
+  std::uint64_t epoch = 0;
+  UniqueFd append_fd;  // the file the staged messages were written to
 };
 
 // Delivers one queued message to a local recipient.
@@ -122,11 +153,76 @@ inline constexpr std::uint64_t kNoMessage = ~std::uint64_t{0};
 // kNoMessage at the end. A "From " line starts a message only at the start
 // of the file or right after the "." line that ends the previous message.
 std::uint64_t mailbox_parse_message(ByteSource& in, std::uint64_t offset, Mailbox& box);
-// Takes the messages written to the mailbox from `from` on into its record
-// and records the new committed length in the overview (synced). 0, or an
-// errno value: the record is then as before and the caller cuts the file
-// back to `from`.
-int mailbox_commit(Mailbox& box, ByteSource& in, std::uint64_t from);
+// Parses one message in pieces, so that a large one never holds the thread
+// for long: each step() reads about `budget` bytes of lines.
+class MessageParser {
+ public:
+  explicit MessageParser(std::uint64_t offset);
+  MessageParser(MessageParser&&) noexcept;
+  MessageParser& operator=(MessageParser&&) noexcept;
+  ~MessageParser();
+  // True once the message has ended (or the source failed: in.failed()).
+  bool step(ByteSource& in, std::uint64_t budget);
+  // The finished record (its `uid` is the X-UID header's value, 0 when
+  // none) and where the next message starts (kNoMessage at the end).
+  MessageRecord take(std::uint64_t& next);
+
+ private:
+  struct State;
+  std::unique_ptr<State> s_;
+};
+
+// ---- appends, in pieces, committed in groups --------------------------------
+// Delivery writes each message behind `tail` (mailbox_append_begin reserves
+// the place and an identifier), parses it, and stages it; one commit then
+// syncs the mailbox once, appends the staged messages' records to the
+// overview and syncs that once, and only then are they delivered.
+
+struct AppendSlot {
+  std::uint64_t offset = 0;  // where the message goes
+  std::uint32_t uid = 0;     // the identifier it carries
+  std::uint64_t epoch = 0;   // the file generation it was reserved in
+};
+// Reserves the place behind everything written so far; `fd` is the mailbox
+// opened for writing, kept by the box until the commit. Fails (EAGAIN) while
+// another message is being written into the box.
+int mailbox_append_begin(Mailbox& box, UniqueFd fd, AppendSlot& slot);
+// The descriptor an append writes through (valid while the slot's epoch holds).
+int mailbox_append_fd(const Mailbox& box);
+// The message of `slot` is written up to `end`; parsed, it waits for the
+// commit with `done`.
+void mailbox_append_stage(Mailbox& box, const AppendSlot& slot, MessageRecord record, std::function<void(int)> done);
+// The append of `slot` failed: the file is cut back to where it began and
+// its identifier is given back when no later one was handed out.
+void mailbox_append_abandon(Mailbox& box, const AppendSlot& slot);
+// Whether the file was replaced or cut back since the slot was reserved.
+bool mailbox_append_stale(const Mailbox& box, const AppendSlot& slot);
+// Commits the staged messages of one box, or of every box. 0 or the errno
+// value of the failure (each staged message's `done` is told either way).
+int mailbox_commit_staged(Mailbox& box);
+void mailbox_commit_staged();
+
+// ---- the overview's upkeep ----------------------------------------------------
+
+// A message's flags changed in memory: the change is appended to the
+// overview with the next records written (or by mailbox_upkeep).
+void mailbox_flags_changed(Mailbox& box, MessageRecord& message);
+// Appends the pending flag changes now. 0 or an errno value.
+int mailbox_overview_flush(Mailbox& box);
+// Whether removals and flag changes have made the overview worth compacting.
+bool mailbox_overview_stale(const Mailbox& box);
+// One step of compacting the overview: the live records are written to a
+// temporary file beside it (O_EXCL), a slice at a time until `deadline`,
+// then synced and renamed over it. Appends, flag changes and removals made
+// meanwhile are carried over (a removal starts the compaction again).
+enum class CompactStep { idle, working, done, failed };
+CompactStep mailbox_compact_step(Mailbox& box, std::chrono::steady_clock::time_point deadline);
+// Background upkeep of every cached mailbox until `deadline`: pending flag
+// changes written, stale overviews compacted. True while work remains.
+bool mailbox_upkeep(std::chrono::steady_clock::time_point deadline);
+// Whether a compaction is under way.
+bool mailbox_upkeep_running();
+
 // The separator line for a queue file's first line ("From sender date").
 std::string mailbox_separator(std::string_view envelope_line, std::time_t when);
 // The date of a separator line; kBadDate when the line is none.
@@ -136,14 +232,21 @@ bool mailbox_header_dropped(std::string_view line);
 // The box a recipient address names by its sub-address ("ann_work@site" ->
 // "work"); "inbox" for anything that is not a plain name.
 std::string mailbox_box_for_address(std::string_view address);
-// The overview text. Beside the messages it records the next identifier
-// ("#uidnext") and the mailbox's committed length ("#length", the sum of
-// the messages' lengths; the last such line counts), so that what an
+// The overview text, as compacted. Beside the messages it records the next
+// identifier ("#uidnext") and the mailbox's committed length ("#length", the
+// sum of the messages' lengths; the last such line counts), so that what an
 // interrupted append left behind the committed length is recognised.
+// Later changes are appended as records: further "#msg" blocks, then
+// "#uidnext" and "#length" again; "#flags <uid> <flags>" for a message's
+// new flags, "#expunge <uid>" for a removed message. A reader that knows
+// only the message blocks skips those lines (and, after a removal, finds
+// the lengths do not add up and parses the mailbox instead).
 std::string mailbox_overview_text(const Mailbox& box);
-// 0, or 1 for a text that is cut off or does not add up.
+// 0, or 1 for a text that is cut off or does not add up. Identifiers must
+// rise from one message block to the next.
 int mailbox_overview_parse(Mailbox& box, std::string_view text);
-// Offset of a message in the mailbox file (the sum of the lengths before it).
+// The committed length of the mailbox: the sum of its messages' lengths
+// (kept as messages come and go, not counted).
 std::uint64_t mailbox_size(const Mailbox& box);
 // Forgets every cached mailbox (tests).
 void mailbox_cache_clear();

@@ -123,6 +123,24 @@ TEST(MailboxParse, MessagesSplitOnlyAfterATerminator) {
   EXPECT_EQ(box.next_uid, 8u);
 }
 
+TEST(MailboxParse, IdentifiersOnlyRise) {
+  // An X-UID at or below the one before (a hand-joined mailbox) or one that
+  // leaves no room above it gets the next identifier: identifiers stay
+  // unique and rising, so records appended later can name a message by it.
+  Mailbox box = parse(message("a@x", "X-UID: 5\r\n", "1\r\n") + message("b@x", "X-UID: 3\r\n", "2\r\n") +
+                      message("c@x", "X-UID: 6\r\n", "3\r\n") + message("d@x", "X-UID: 4294967295\r\n", "4\r\n"));
+  std::vector<std::uint32_t> uids;
+  for (const auto& m : box.messages) uids.push_back(m.uid);
+  EXPECT_EQ(uids, (std::vector<std::uint32_t>{5, 6, 7, 8}));
+  // An overview whose identifiers do not rise is not trusted.
+  std::string text = mailbox_overview_text(box);
+  std::size_t at = text.find(",6,");
+  ASSERT_NE(at, std::string::npos);
+  text.replace(at, 3, ",5,");
+  Mailbox back;
+  EXPECT_NE(mailbox_overview_parse(back, text), 0);
+}
+
 TEST(MailboxParse, FoldedHeadersKeepTheirFirstLineAndDatesParse) {
   std::string m = message("a@x",
                           "Subject: first part\r\n  second part\r\nDate: Tue, 14 Nov 2023 22:13:20 +0000\r\n"

@@ -34,6 +34,10 @@ struct OutgoingEntry {
 
 int mail_init();   // start-up: counters, alias and reject tables, queue scans
 void mail_poll();  // once per main-loop iteration
+// Work in hand between the main loop's ticks (a burst being debatched, an
+// overview being compacted), one short slice per call; true while more
+// remains, so the loop comes back without waiting for the next tick.
+bool mail_background();
 
 // A new queue file path: the name is created exclusively, so a name that
 // still holds mail is never reused.
