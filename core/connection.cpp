@@ -495,7 +495,13 @@ void ConnectionCore::serve(Connection& c, bool readable) {
   c.flush();
   c.settle();
   --c.in_callback_;
-  if (c.close_pending_ && !c.in_callback_) c.finish(c.close_reason_);
+  if (c.close_pending_ && !c.in_callback_) {
+    c.finish(c.close_reason_);
+    return;
+  }
+  // Input still waiting after this turn's rounds: another turn soon (the
+  // buffer may be full, so no readiness would bring one).
+  if (c.dirty_ && c.gate_open()) c.host_.touch(c);
 }
 
 void ConnectionCore::fire_timer(Connection& c) {

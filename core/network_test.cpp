@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "core/control.h"
+#include "core/telnet.h"
 #include "core/test_files.h"
 #include "core/test_fixture.h"
 
@@ -521,6 +522,19 @@ TEST_F(NetworkTest, TheAcceptRuleIsOneTestForEveryService) {
   EXPECT_EQ(service_admit(d, htonl(0xc0a80001)), Admission::identify);
   EXPECT_EQ(service_admit(d, htonl(0x01020304)), Admission::accepted);
   EXPECT_EQ(dotted(htonl(0xc0a80a05)), "192.168.10.5");
+}
+
+TEST(Telnet, NegotiationIsAnsweredAndStripped) {
+  std::string answers;
+  const char in[] = "\xff\xfd\x01\xff\xfb\x03\x02host.example\r\n";
+  std::string_view input(in, sizeof in - 1);
+  EXPECT_EQ(input.substr(telnet_strip(input, answers)), "host.example\r\n");
+  EXPECT_EQ(answers, std::string_view("\xff\xfc\x01\xff\xfe\x03", 6));
+  // An unfinished sequence waits for the rest.
+  answers.clear();
+  EXPECT_EQ(telnet_strip("\xff\xfd", answers), 0u);
+  EXPECT_EQ(telnet_strip("\xff\xfd\x18x", answers), 3u);
+  EXPECT_EQ(answers, "\xff\xfc\x18");
 }
 
 }  // namespace
