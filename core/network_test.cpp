@@ -322,40 +322,26 @@ TEST_F(NetworkTest, OutwardConnectionsLookUpConnectAndFail) {
   EXPECT_EQ(connection_count(svc::smtp_client), 0);
 
   // A port nobody listens on.
-  int probe = ::socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in a{};
-  a.sin_family = AF_INET;
-  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  ASSERT_EQ(::bind(probe, reinterpret_cast<sockaddr*>(&a), sizeof a), 0);
-  socklen_t len = sizeof a;
-  getsockname(probe, reinterpret_cast<sockaddr*>(&a), &len);
-  ::close(probe);
-  connect_to(svc::smtp_client, "127.0.0.1", ntohs(a.sin_port), std::make_unique<Dialer>(seen));
+  connect_to(svc::smtp_client, "127.0.0.1", LoopbackPeer(false).port, std::make_unique<Dialer>(seen));
   ASSERT_TRUE(pump([&] { return seen.closes.size() == 3; }));
   EXPECT_EQ(seen.closes.back(), CloseReason::connect_failed);
 
   // A name that resolves, to a server that answers.
-  int server = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  a.sin_port = 0;
-  ASSERT_EQ(::bind(server, reinterpret_cast<sockaddr*>(&a), sizeof a), 0);
-  ASSERT_EQ(::listen(server, 4), 0);
-  getsockname(server, reinterpret_cast<sockaddr*>(&a), &len);
-  c = connect_to(svc::smtp_client, "near.example", ntohs(a.sin_port), std::make_unique<Dialer>(seen));
+  LoopbackPeer server;
+  c = connect_to(svc::smtp_client, "near.example", server.port, std::make_unique<Dialer>(seen));
   answer(htonl(INADDR_LOOPBACK));
   ASSERT_TRUE(pump([&] { return seen.last == c && c->phase() == Phase::open; }));
   EXPECT_EQ(connection_count(svc::smtp_client), 1);
   EXPECT_EQ(c->peer().text, "127.0.0.1");
-  int peer = ::accept(server, nullptr, nullptr);
+  UniqueFd peer(::accept(server.fd.get(), nullptr, nullptr));
   char buf[16] = {};
   timeval tv{3, 0};
-  setsockopt(peer, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-  EXPECT_EQ(::recv(peer, buf, sizeof buf, 0), 6);
+  setsockopt(peer.get(), SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+  EXPECT_EQ(::recv(peer.get(), buf, sizeof buf, 0), 6);
   EXPECT_STREQ(buf, "HELO\r\n");
   net_close_all();
   EXPECT_EQ(seen.closes.back(), CloseReason::shutdown);
   EXPECT_EQ(connection_count(svc::smtp_client), 0);
-  ::close(peer);
-  ::close(server);
 }
 
 // A relay: what one peer sends goes to the other. Its reader is slow, so
@@ -374,22 +360,14 @@ TEST_F(NetworkTest, ARelayPausesItsSenderWhileThePartnerIsBacklogged) {
       if (Connection* to = c.partner()) to->close_after_send();
     }
   };
-  int far = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a{};
-  a.sin_family = AF_INET;
-  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  ASSERT_EQ(::bind(far, reinterpret_cast<sockaddr*>(&a), sizeof a), 0);
-  ASSERT_EQ(::listen(far, 4), 0);
-  socklen_t len = sizeof a;
-  getsockname(far, reinterpret_cast<sockaddr*>(&a), &len);
-  const std::uint16_t far_port = ntohs(a.sin_port);
+  LoopbackPeer far;
   Connection* inner = nullptr;
   Connection* outer = nullptr;
   service_register({.number = svc::smtp, .port = &port_key, .paced_by_lines = false});
   ServiceDescriptor d = *service_find(svc::smtp);
   d.make_session = [&](Connection& c, Admission) {
     inner = &c;
-    outer = connect_to(svc::telnet_server, "127.0.0.1", far_port, std::make_unique<Relay>());
+    outer = connect_to(svc::telnet_server, "127.0.0.1", far.port, std::make_unique<Relay>());
     c.link(*outer);
     return std::make_unique<Relay>();
   };
@@ -399,7 +377,7 @@ TEST_F(NetworkTest, ARelayPausesItsSenderWhileThePartnerIsBacklogged) {
   int small = 8192;
   setsockopt(sender.fd, SOL_SOCKET, SO_SNDBUF, &small, sizeof small);
   ASSERT_TRUE(pump([&] { return outer && outer->phase() == Phase::open; }));
-  int reader = ::accept(far, nullptr, nullptr);
+  int reader = ::accept(far.fd.get(), nullptr, nullptr);
   std::string sent;
   for (std::size_t i = 0; sent.size() < 12 * 1024 * 1024; ++i) sent += std::to_string(i) + ",";
   ASSERT_EQ(fcntl(sender.fd, F_SETFL, O_NONBLOCK), 0);
@@ -430,7 +408,6 @@ TEST_F(NetworkTest, ARelayPausesItsSenderWhileThePartnerIsBacklogged) {
   }, 60000, 0));
   EXPECT_TRUE(got == sent) << got.size() << " of " << sent.size();
   ::close(reader);
-  ::close(far);
 }
 
 // Thousands of idle connections, most on descriptors above 1024, and the

@@ -235,21 +235,13 @@ TEST_F(DnsService, ClosingAConnectionCancelsItsLookupAtOnce) {
 }
 
 TEST_F(DnsService, AnAnswerFromTheCacheReachesTheConnection) {
-  int server = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a{};
-  a.sin_family = AF_INET;
-  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  ASSERT_EQ(::bind(server, reinterpret_cast<sockaddr*>(&a), sizeof a), 0);
-  ASSERT_EQ(::listen(server, 1), 0);
-  socklen_t len = sizeof a;
-  getsockname(server, reinterpret_cast<sockaddr*>(&a), &len);
+  LoopbackPeer server;
   dns_resolver().cache().store({Record{Section::answer, "cached.example", 1, 1, 60, 0, std::string("\x7f\0\0\x01", 4)}},
                                server_now);
-  Connection* c = connect_to(svc::smtp_client, "cached.example", ntohs(a.sin_port), std::make_unique<Idle>());
+  Connection* c = connect_to(svc::smtp_client, "cached.example", server.port, std::make_unique<Idle>());
   for (int i = 0; i < 100 && c->phase() != Phase::open; ++i) net_pass(10);
   EXPECT_EQ(c->phase(), Phase::open);
   EXPECT_EQ(c->peer().text, "127.0.0.1");
-  ::close(server);
 }
 
 }  // namespace

@@ -18,6 +18,7 @@
 #include "core/test_link.h"
 #include "mail/mailbox.h"
 #include "mail/pop_server.h"
+#include "mail/session_fuzz.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -25,39 +26,17 @@ using namespace velmor;
 
 namespace {
 
-void check(bool ok) {
-  if (!ok) std::abort();
-}
-
-void check_lines(const std::string& out) {
-  check(out.empty() || out.ends_with("\r\n"));
-  for (std::size_t i = 0; i < out.size(); ++i) {
-    if (out[i] == '\n') check(i > 0 && out[i - 1] == '\r');
-    if (out[i] == '\r') check(i + 1 < out.size() && out[i + 1] == '\n');
-  }
-}
+using namespace velmor::fuzzing;
 
 std::string message(int n, std::string_view body) {
   return mailbox_separator("MAIL FROM:<bob@far.example>", 1700000000) + "From: bob@far.example\r\nSubject: m" +
          std::to_string(n) + "\r\nStatus: RO\r\nX-Status:   \r\n\r\n" + std::string(body) + ".\r\n";
 }
 
-std::string read_all(const std::string& path) {
-  std::string text;
-  if (FILE* f = fopen(path.c_str(), "rb")) {
-    char buf[65536];
-    std::size_t n;
-    while ((n = fread(buf, 1, sizeof buf, f)) > 0) text.append(buf, n);
-    fclose(f);
-  }
-  return text;
-}
-
 struct Scratch {
-  std::string root, inbox, original;
+  ScratchFolder folder;
+  std::string root = folder.path(), inbox, original;
   Scratch() {
-    std::string pattern = (access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp") + std::string("/velmor-fuzz-XXXXXX");
-    root = mkdtemp(pattern.data()) ? pattern : "/tmp";
     paths.tmp_dir = root + "/tmp";
     config.server_name = "fuzz.example";
     config.admin_email = "postmaster@site.example";
@@ -65,27 +44,19 @@ struct Scratch {
     mkdir((root + "/tmp").c_str(), 0700);
     std::filesystem::create_directories(root + "/alice/mail");
     filecache_init();
-    FILE* f = fopen((root + "/users").c_str(), "w");
     // alice's password is "secret"
-    fprintf(f, "alice,$1$7d1ZKX5F$d2aGUoNjVu30rj26rho90/,Alice Liddell,%s/alice,0\n", root.c_str());
-    fclose(f);
+    write_all(root + "/users", "alice,$1$7d1ZKX5F$d2aGUoNjVu30rj26rho90/,Alice Liddell," + root + "/alice,0\n");
     user_load(root + "/users");
     groups_parse("#0\n%mail.pop.fetch: yes\n");
     inbox = root + "/alice/mail/inbox";
     original = message(1, "Hello.\r\n..dot\r\n") + message(2, "x\r\n\r\nlast\r\n") + message(3, "");
     pop_register();
   }
-  ~Scratch() {
-    std::error_code ignored;
-    std::filesystem::remove_all(root, ignored);
-  }
   void restore() {
     mailbox_cache_clear();
     std::filesystem::remove_all(root + "/alice/mail");
     std::filesystem::create_directories(root + "/alice/mail");
-    FILE* f = fopen(inbox.c_str(), "wb");
-    fwrite(original.data(), 1, original.size(), f);
-    fclose(f);
+    write_all(inbox, original);
   }
 };
 

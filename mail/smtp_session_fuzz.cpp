@@ -18,6 +18,7 @@
 #include "core/test_link.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
+#include "mail/session_fuzz.h"
 #include "mail/smtp_server.h"
 #include "users/groups.h"
 #include "users/users.h"
@@ -26,24 +27,12 @@ using namespace velmor;
 
 namespace {
 
-void check(bool ok) {
-  if (!ok) std::abort();
-}
-
-// Every byte of the output belongs to a line that ends CR LF.
-void check_lines(const std::string& out) {
-  check(out.empty() || out.ends_with("\r\n"));
-  for (std::size_t i = 0; i < out.size(); ++i) {
-    if (out[i] == '\n') check(i > 0 && out[i - 1] == '\r');
-    if (out[i] == '\r') check(i + 1 < out.size() && out[i + 1] == '\n');
-  }
-}
+using namespace velmor::fuzzing;
 
 struct Scratch {
-  std::string root;
+  ScratchFolder folder;
+  std::string root = folder.path();
   Scratch() {
-    std::string pattern = (access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp") + std::string("/velmor-fuzz-XXXXXX");
-    root = mkdtemp(pattern.data()) ? pattern : "/tmp";
     paths.tmp_dir = root + "/tmp";
     config.mail_dir_incoming = root + "/in";
     config.mail_dir_outgoing = root + "/out";
@@ -55,29 +44,16 @@ struct Scratch {
     for (const char* d : {"/in", "/out", "/odd", "/tmp"}) mkdir((root + d).c_str(), 0700);
     filecache_init();
     queue_init(1000);
-    FILE* f = fopen((root + "/users").c_str(), "w");
-    fprintf(f, "ann,x,Ann,%s/ann,0\n", root.c_str());
-    fclose(f);
+    write_all(root + "/users", "ann,x,Ann," + root + "/ann,0\n");
     user_load(root + "/users");
     groups_parse("#0\n%mail.smtp.send: yes\n");
     smtp_register();
-  }
-  ~Scratch() {
-    std::error_code ignored;
-    std::filesystem::remove_all(root, ignored);
   }
   // Every queue file the input made (name and content), removed.
   std::vector<std::pair<std::string, std::string>> take_files() {
     std::vector<std::pair<std::string, std::string>> files;
     for (const auto& e : std::filesystem::directory_iterator(root + "/in")) {
-      std::string text;
-      if (FILE* f = fopen(e.path().c_str(), "rb")) {
-        char buf[65536];
-        std::size_t n;
-        while ((n = fread(buf, 1, sizeof buf, f)) > 0) text.append(buf, n);
-        fclose(f);
-      }
-      files.emplace_back(e.path().filename().string(), std::move(text));
+      files.emplace_back(e.path().filename().string(), read_all(e.path().string()));
       std::filesystem::remove(e.path());
     }
     queue_scan_incoming();
