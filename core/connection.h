@@ -79,7 +79,7 @@ enum class LineEnds { lf, cr_too };
 struct Peer {
   std::uint32_t ip = 0;  // network byte order; 0 for a peer with no IPv4 address
   std::uint16_t port = 0;
-  std::string text;      // dotted form, for logs and replies
+  std::string text{};    // dotted form, for logs and replies
   bool loopback() const;
 };
 // Dotted text of a network-order address.
@@ -124,13 +124,13 @@ struct FileRange {
     dot_stuff,    // a line that starts with "." gets another one in front
     dot_unstuff,  // a line that starts with "." loses it (transmission form to plain)
   };
-  std::shared_ptr<const UniqueFd> file;
+  std::shared_ptr<const UniqueFd> file{};
   std::uint64_t offset = 0;
   std::uint64_t length = 0;
   Transform transform = Transform::none;  // the range starts at a line start
   // Sent in place of the rest when the file cannot be read; the connection
   // then closes, since the peer could not tell a cut copy from a whole one.
-  std::string failure_text;
+  std::string failure_text{};
 };
 
 class Session {

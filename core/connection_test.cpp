@@ -114,9 +114,9 @@ TEST_F(LineReader, ExactByteCountsBesideLines) {
   };
   auto s = std::make_unique<Literal>();
   Literal* l = s.get();
-  TestLink link(std::move(s), 32);
+  TestLink literal(std::move(s), 32);
   const char in[] = "A {5}\r\n{12}\r\nab\r\nc\n\0def\r\nB\r\n";
-  link.feed(std::string_view(in, sizeof in - 1), 1);
+  literal.feed(std::string_view(in, sizeof in - 1), 1);
   EXPECT_EQ(l->parts, (std::vector<std::string>{"A {5}", "{12}", std::string("ab\r\nc\n\0def\r\n", 12), "B"}));
 }
 

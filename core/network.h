@@ -68,7 +68,7 @@ enum class Admission { accepted, identify, refused };
 
 struct ServiceDescriptor {
   int number = 0;
-  std::string name;  // "smtp", for logs
+  std::string name{};  // "smtp", for logs
   // The service's own keys (pointers into `config`); null = none. A service
   // without a port key has no listener (outward connections only).
   const bool* enabled = nullptr;
@@ -80,9 +80,9 @@ struct ServiceDescriptor {
   const AddressList* block = nullptr;
   const AddressList* auth = nullptr;
   // What a refused peer is told before its connection closes ("" = nothing).
-  std::function<std::string()> refusal;
+  std::function<std::string()> refusal{};
   // The session of a new connection (accepted, or made by connect_to).
-  std::function<std::unique_ptr<Session>(Connection&, Admission)> make_session;
+  std::function<std::unique_ptr<Session>(Connection&, Admission)> make_session{};
   // Input rules.
   std::size_t line_limit = 0;  // 0 = the input buffer's size
   LineEnds line_ends = LineEnds::lf;
@@ -152,8 +152,8 @@ Connection* connect_to(int service, std::string_view host, std::uint16_t port, s
 // possibly before it returns, and gives a handle (0 when it ended at once);
 // `cancel` drops a lookup still running.
 struct NameResolver {
-  std::function<std::uint64_t(std::string_view name, std::function<void(std::uint32_t)> done)> start;
-  std::function<void(std::uint64_t handle)> cancel;
+  std::function<std::uint64_t(std::string_view name, std::function<void(std::uint32_t)> done)> start{};
+  std::function<void(std::uint64_t handle)> cancel{};
 };
 void net_set_resolver(NameResolver resolver);
 
