@@ -6,14 +6,18 @@
 #
 #   bench/fuzz.sh [SECONDS]     SECONDS per target, 600 by default
 #   TARGETS="line_reader smtp_session" bench/fuzz.sh 3600   only these
+#   BUILD=build bench/fuzz.sh 60      the fuzz targets of an existing build
 set -eu
 SECONDS_EACH=${1:-600}
 HERE=$(cd "$(dirname "$0")/.." && pwd)
 BUILD=${BUILD:-$HERE/build-fuzz}
 WORK=${WORK:-$BUILD/fuzz-runs}
 
-CXX=${CXX:-clang++} cmake -S "$HERE" -B "$BUILD" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DVELMOR_SANITIZE=ON -DVELMOR_FUZZ=ON -DVELMOR_TESTS=OFF >/dev/null
+# A build folder of its own unless BUILD names one made with -DVELMOR_FUZZ=ON.
+if [ ! -f "$BUILD/CMakeCache.txt" ]; then
+  CXX=${CXX:-clang++} cmake -S "$HERE" -B "$BUILD" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+    -DVELMOR_SANITIZE=ON -DVELMOR_FUZZ=ON -DVELMOR_TESTS=OFF >/dev/null
+fi
 ninja -C "$BUILD" -j2 $(cd "$BUILD" && ninja -t targets all | sed -n 's/^\(fuzz_[a-z0-9_]*\): .*/\1/p' | sort -u) >/dev/null
 
 total_findings=0
