@@ -199,6 +199,8 @@ class Connection {
   void send_file(FileRange range);
   // Bytes queued and not yet sent (file ranges by their remaining length).
   std::size_t pending() const { return pending_; }
+  // At or over the high-water mark: a session producing a long answer stops
+  // here and goes on in on_drained, which comes below the low-water mark.
   bool output_full() const { return pending_ >= kHighWater; }
   // Phase closing: input stops, the queue is sent, then the connection closes.
   void close_after_send();

@@ -2,12 +2,8 @@
 // its accept rule, how to make a session) and the loop does the rest:
 // listeners, accepting, reading, writing, time-outs, outward connections
 // and their host lookups. The loop knows no protocol; what a connection
-// means lives in the service's Session (core/connection.h).
-//
-//   void echo_register() {
-//     service_register({.number = svc::echo, .name = "echo", .port = &config.echo_port,
-//                       .make_session = [](Connection&, Admission) { return std::make_unique<Echo>(); }});
-//   }
+// means lives in the service's Session (core/connection.h). A whole
+// service in thirty lines: "Writing a protocol" in docs/ARCHITECTURE.md.
 //
 // The loop also serves raw descriptors (datagram sockets: the control
 // channel, the resolver) with "call this when readable", and runs the
