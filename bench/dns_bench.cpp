@@ -1,5 +1,5 @@
 // The suite's resolver under load: the dns/ engine and its binding to the
-// dispatcher, as the daemon runs them, resolving every name of a file with
+// event loop, as the daemon runs them, resolving every name of a file with
 // OUTSTANDING lookups in flight, starting with an empty cache; then the
 // names the cache keeps (the last 10,000) again from the cache.
 //
@@ -17,7 +17,7 @@
 
 #include "core/config.h"
 #include "core/globals.h"
-#include "core/sockets.h"
+#include "core/network.h"
 #include "dns/service.h"
 
 using namespace velmor;
@@ -28,10 +28,10 @@ double seconds_since(std::chrono::steady_clock::time_point start) {
   return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
 }
 
-// One dispatcher pass, and the resolver's tick every half second.
+// One pass of the loop, and the resolver's tick every half second.
 void turn(std::chrono::steady_clock::time_point& next_tick) {
   server_now = std::time(nullptr);
-  dispatcher(5);
+  net_pass(5);
   if (std::chrono::steady_clock::now() >= next_tick) {
     server_now = std::time(nullptr);
     dns_poll();
@@ -56,8 +56,8 @@ int main(int argc, char** argv) {
   config.dns_timeout = 5;
   config.dns_retries = 2;
   server_now = std::time(nullptr);
-  dns_init();
-  if (service_handlers(svc::dns | kDatagram)->open_sockets() != 0) return 1;
+  dns_register();
+  dns_start();
   auto next_tick = std::chrono::steady_clock::now();
   const auto wait_start = std::chrono::steady_clock::now();
   while (!link_up) {

@@ -8,7 +8,7 @@
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
-#include "core/sockets.h"
+#include "core/network.h"
 #include "core/util.h"
 
 namespace velmor {

@@ -18,7 +18,7 @@
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
-#include "core/sockets.h"
+#include "core/network.h"
 #include "core/strfmt.h"
 #include "core/util.h"
 
@@ -138,15 +138,16 @@ std::string status_text() {
 }
 
 // Receives and answers the waiting requests; level-triggered readiness
-// brings the dispatcher back for the rest after a bounded batch.
-int control_read(SocketRecord& record, long) {
-  for (int batch = 0; batch < 256; ++batch) {
+// brings the loop back for the rest after a bounded batch.
+void control_read() {
+  const int fd = control().fd;
+  for (int batch = 0; batch < 256 && fd >= 0 && control().fd == fd; ++batch) {
     char buf[kMaxRequest + 2];
     sockaddr_un from{};
     socklen_t from_len = sizeof from;
-    ssize_t n = ::recvfrom(record.fd, buf, sizeof buf, MSG_DONTWAIT | MSG_TRUNC,
+    ssize_t n = ::recvfrom(fd, buf, sizeof buf, MSG_DONTWAIT | MSG_TRUNC,
                            reinterpret_cast<sockaddr*>(&from), &from_len);
-    if (n < 0) return 0;
+    if (n < 0) return;
     if (static_cast<std::size_t>(n) > kMaxRequest) {
       // Acting on part of a command (a cut password, say) would be worse
       // than ignoring it.
@@ -163,7 +164,6 @@ int control_read(SocketRecord& record, long) {
       send_reply(control().fd, from, from_len, reply, failure);
     });
   }
-  return 0;
 }
 
 // The subsystem sends its whole listing; without one the queue is empty,
@@ -232,7 +232,7 @@ void control_command(std::string_view text, const std::function<void(std::string
 
 int control_open() {
   auto& c = control();
-  c.fd = -1;  // listeners_open has closed the old one
+  control_remove();  // a second open replaces the first
   const std::string& path = paths.control;
   sockaddr_un a;
   socklen_t len;
@@ -275,19 +275,21 @@ int control_open() {
     c.ino = st.st_ino;
     c.made = true;
   }
-  if (!service_handlers(svc::control | kDatagram))
-    register_service(svc::control | kDatagram, ServiceHandlers{.read = control_read});
-  if (!record_create(fd, svc::control | kDatagram, sockstate::initial)) {
-    ::close(fd);
+  c.fd = fd;
+  if (!watch_readable(fd, control_read)) {
     control_remove();
     return 1;
   }
-  c.fd = fd;
   return 0;
 }
 
 void control_remove() {
   auto& c = control();
+  if (c.fd >= 0) {
+    unwatch(c.fd);
+    ::close(c.fd);
+    c.fd = -1;
+  }
   if (!c.made) return;
   struct stat st{};
   if (stat(paths.control.c_str(), &st) == 0 && st.st_dev == c.dev && st.st_ino == c.ino)

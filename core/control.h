@@ -9,11 +9,12 @@
 
 namespace velmor {
 
-// Creates and binds the socket at paths.control and makes its record.
-// 0 = done; 1 = it failed (logged), and the suite must not start: a path
-// someone else holds would otherwise receive what local tools send.
+// Creates and binds the socket at paths.control and has the loop call it
+// when a request is waiting. 0 = done; 1 = it failed (logged), and the suite
+// must not start: a path someone else holds would otherwise receive what
+// local tools send.
 int control_open();
-// Removes the socket path, only when this process made it.
+// Closes the socket and removes its path (only when this process made it).
 void control_remove();
 // Handles one command text; every reply datagram goes to `reply`.
 void control_command(std::string_view text, const std::function<void(std::string_view)>& reply);

@@ -857,16 +857,16 @@ int filecache_truncate(CacheFile& file, std::uint64_t length) {
 
 int filecache_copy(CacheFile& source, std::uint64_t offset, CacheFile& destination, std::uint64_t count) {
   CacheData* s = data_of(source, "Invalid struct key (copy in)");
-  if (!s) return 1;
+  if (!s) return EBADF;
   CacheData* d = data_of(destination, "Invalid struct key (copy out)");
-  if (!d) return 1;
-  if (!is_writer(destination)) return 1;
+  if (!d) return EBADF;
+  if (!is_writer(destination)) return EBADF;
   std::string chunk;  // the same entry on both sides: the window moves under us
   while (count > 0 && offset < s->length) {
     std::uint64_t n = load(*s, offset);
     if (n == 0) {
       debug("no space");
-      return 1;
+      return EIO;
     }
     n = std::min(n, count);
     std::string_view piece(s->at(offset), n);

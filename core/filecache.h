@@ -92,7 +92,7 @@ int filecache_sync(CacheFile& file);
 int filecache_seek(CacheFile& file, std::uint64_t offset);
 int filecache_truncate(CacheFile& file, std::uint64_t length);
 // Copies `count` bytes (or up to the end) of `source` from `offset` to the end
-// of `destination`. 0 = done, non-zero = failed.
+// of `destination`. 0 or an errno value, as every writing call here.
 int filecache_copy(CacheFile& source, std::uint64_t offset, CacheFile& destination, std::uint64_t count);
 
 // Closes the handle: a writing mode writes its window back (write mode syncs
@@ -126,14 +126,8 @@ std::string filecache_temp_name();
 
 // ---- File helpers that keep the cache true (the plain ones are in fileio.h) --
 
-int file_create(const std::string& path);                 // create or truncate, mode 0660
-int file_rename(const std::string& from, const std::string& to);
-std::string_view path_extension(std::string_view path);  // after the last "." of the leaf
-std::string_view path_leaf(std::string_view path);       // after the last "/"
-std::string_view path_dir(std::string_view path);        // before the last "/" ("" when none)
-std::string path_join(std::string_view dir, std::string_view name);  // exactly one "/"
-void make_parent_dirs(const std::string& file_path);     // every parent, mode 0744
-void make_path(const std::string& dir_path);             // every directory along, mode 0770
+int file_create(const std::string& path);  // create or truncate, mode 0660; 0 or an errno value
+int file_rename(const std::string& from, const std::string& to);  // 0 or an errno value
 // Writes `data` to `path` through a temporary name, fsync and rename: the
 // file is either the old one or the new one. 0 or an errno value. When
 // `backup` is set the old file is kept as `<path>~`.

@@ -400,7 +400,7 @@ TEST_F(FileCacheTest, DeletingAndDroppingEntries) {
   EXPECT_EQ(filecache_write(none, "x"), EBADF);
   EXPECT_EQ(filecache_close(none), 0);
   EXPECT_TRUE(filecache_at_end(none, 0));
-  EXPECT_EQ(filecache_copy(none, 0, none, 1), 1);
+  EXPECT_EQ(filecache_copy(none, 0, none, 1), EBADF);
 }
 
 TEST_F(FileCacheTest, MemoryPressureNeverFreesAnEntryInUse) {

@@ -1,5 +1,5 @@
 // The core calls into the other subsystems only through these hooks, which
-// each subsystem fills when it starts (core/main.cpp wires them). A hook that
+// each subsystem fills when it starts (daemon/main.cpp wires them). A hook that
 // no subsystem has filled yet does nothing: the command is accepted and
 // ignored until that subsystem exists.
 #pragma once

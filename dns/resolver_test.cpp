@@ -9,7 +9,8 @@
 
 #include "core/config.h"
 #include "core/globals.h"
-#include "core/sockets.h"
+#include "core/network.h"
+#include "core/test_fixture.h"
 #include "dns/service.h"
 
 namespace velmor::dns {
@@ -201,32 +202,46 @@ TEST(DnsCache, KeepsTenThousandNamesDroppingTheLeastRecentlyUsed) {
   EXPECT_TRUE(cache.find("n0", 1 + 86400).empty());  // a TTL counts a day at most
 }
 
-// The binding to the dispatcher: a lookup belongs to the record that started
-// it, so closing the record drops it and a record that reuses the descriptor
-// has no lookup.
-TEST(DnsService, ClosingARecordDropsItsLookup) {
-  config.dns_servers = "127.255.255.254";
-  config.dns_timeout = 5;
-  config.dns_retries = 2;
-  dns_init();
-  ASSERT_EQ(service_handlers(svc::dns | kDatagram)->open_sockets(), 0);
-  link_up = 1;
-  int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK, 0);
-  SocketRecord* r = record_create(fd, svc::smtp_client, sockstate::lookup);
-  ASSERT_TRUE(r);
-  ASSERT_TRUE(record_lookup_start(*r, "far.example.org"));
+// The binding to the loop: an outward connection waits in phase lookup for
+// the resolver; closing it cancels its lookup then and there, and a lookup
+// the cache answers at once still reaches it through the loop.
+struct DnsService : SuiteTest {
+  struct Idle : Session {
+    void on_input(Connection&) override {}
+  };
+  void SetUp() override {
+    SuiteTest::SetUp();
+    config.dns_servers = "127.255.255.254";
+    config.dns_timeout = 5;
+    config.dns_retries = 2;
+    dns_register();
+    dns_start();
+    link_up = 1;
+  }
+  void TearDown() override {
+    dns_shutdown();
+    SuiteTest::TearDown();
+  }
+};
+
+TEST_F(DnsService, ClosingAConnectionCancelsItsLookupAtOnce) {
+  Connection* c = connect_to(svc::smtp_client, "far.example.org", 25, std::make_unique<Idle>());
+  ASSERT_NE(c, nullptr);
+  EXPECT_EQ(c->phase(), Phase::lookup);
   EXPECT_EQ(dns_resolver().waiting(), 1u);
-  socket_close(fd);
-  int again = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK, 0);
-  ASSERT_EQ(again, fd);
-  SocketRecord* reuse = record_create(again, svc::smtp_client, sockstate::lookup);
-  ASSERT_TRUE(reuse);
-  EXPECT_EQ(record_lookup(*reuse), 0u);
-  dns_poll();
+  c->close_now();
   EXPECT_EQ(dns_resolver().waiting(), 0u);
-  socket_close(again);
-  dns_shutdown();
-  link_up = 0;
+  EXPECT_EQ(connection_count(svc::smtp_client), 0);
+}
+
+TEST_F(DnsService, AnAnswerFromTheCacheReachesTheConnection) {
+  LoopbackPeer server;
+  dns_resolver().cache().store({Record{Section::answer, "cached.example", 1, 1, 60, 0, std::string("\x7f\0\0\x01", 4)}},
+                               server_now);
+  Connection* c = connect_to(svc::smtp_client, "cached.example", server.port, std::make_unique<Idle>());
+  for (int i = 0; i < 100 && c->phase() != Phase::open; ++i) net_pass(10);
+  EXPECT_EQ(c->phase(), Phase::open);
+  EXPECT_EQ(c->peer().text, "127.0.0.1");
 }
 
 }  // namespace

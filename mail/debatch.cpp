@@ -27,7 +27,6 @@
 #include "mail/alias.h"
 #include "mail/delivery.h"
 #include "mail/mailbox.h"
-#include "mail/pop_server.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
@@ -635,8 +634,6 @@ int mail_init() {
   hooks.background = mail_background;
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
-  smtp_server_register();
-  pop_server_init();
   return 0;
 }
 

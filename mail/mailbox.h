@@ -79,7 +79,7 @@ struct Mailbox {
   // reached without following links (core/safedir.h).
   std::string home;
   std::uint32_t flags = 0;
-  std::uint64_t in_use_by = 0;  // SocketRecord::id of the in-use mark's holder; 0 = none
+  std::uint64_t in_use_by = 0;  // Connection::id() of the in-use mark's holder; 0 = none
   int count = 0, unseen = 0;
   std::uint32_t next_uid = 1;
   bool changed = false;

@@ -136,7 +136,4 @@ DebatchStep debatch_step(std::chrono::steady_clock::time_point deadline);
 inline constexpr int kRetrySeconds = 60;
 void queue_retry_later();
 
-// The SMTP server (service 20).
-void smtp_server_register();
-
 }  // namespace velmor

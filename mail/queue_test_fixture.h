@@ -16,6 +16,7 @@
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "core/test_files.h"
+#include "core/test_fixture.h"
 
 namespace velmor {
 
@@ -38,11 +39,11 @@ inline std::vector<std::string> folder_names(const std::string& dir, bool number
   return names;
 }
 
-class QueueFixture : public ::testing::Test {
+class QueueFixture : public SuiteTest {
  protected:
   void SetUp() override {
+    SuiteTest::SetUp();
     root = scratch.path().string();
-    config_reset();
     paths.tmp_dir = root + "/tmp";
     filecache_init();
     config.mail_dir_incoming = root + "/in";
@@ -56,7 +57,10 @@ class QueueFixture : public ::testing::Test {
     queue_scan_incoming();
     queue_scan_outgoing();
   }
-  void TearDown() override { filecache_shutdown(); }
+  void TearDown() override {
+    filecache_shutdown();
+    SuiteTest::TearDown();
+  }
   std::string in(const std::string& n) { return root + "/in/" + n; }
 
   testing_files::ScratchDir scratch;

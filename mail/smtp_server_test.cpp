@@ -1,12 +1,15 @@
-// The SMTP server over loopback: the real service on an ephemeral port, a
-// plain client socket, and the dispatcher pumped in between; the file layer's
-// seam counts and fails the syncs, renames and writes of the queue commit.
+// The SMTP session through the test driver (no sockets): the real service
+// with its accept rule, line rules and group commit; the file layer's seam
+// counts and fails the syncs, renames and writes of the commit.
+#include "mail/smtp_server.h"
+
 #include <arpa/inet.h>
-#include <sys/socket.h>
 
-#include <chrono>
+#include <limits>
+#include <set>
 
-#include "core/sockets.h"
+#include "core/network.h"
+#include "core/test_link.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
 #include "users/users.h"
@@ -14,85 +17,209 @@
 namespace velmor {
 namespace {
 
-class SmtpServerTest : public QueueFixture {
+std::vector<std::string> reply_lines(const std::string& out) {
+  std::vector<std::string> lines;
+  for (std::size_t at = 0; at < out.size();) {
+    std::size_t end = out.find("\r\n", at);
+    if (end == std::string::npos) break;
+    lines.push_back(out.substr(at, end - at));
+    at = end + 2;
+  }
+  return lines;
+}
+
+class SmtpSessionTest : public QueueFixture {
  protected:
   void SetUp() override {
     QueueFixture::SetUp();
-    paths.bind_address = "127.0.0.1";
     config.sock_buffer = 16384;
     write_file(root + "/users", "ann,x,Ann," + root + "/ann,0\n");
     write_file(root + "/groups", "#0\n");
     ASSERT_EQ(user_load(root + "/users"), 0);
     ASSERT_EQ(groups_load(root + "/groups"), 0);
-    smtp_server_register();
-    ASSERT_EQ(listener_open(0, svc::smtp, 6, &listener), 0);
-  }
-  void TearDown() override {
-    sysio::reset();
-    sockets_close_all();
-    QueueFixture::TearDown();
+    smtp_register();
   }
 
-  std::string connect() {  // the greeting
-    sockaddr_in a{};
-    socklen_t len = sizeof a;
-    getsockname(listener, reinterpret_cast<sockaddr*>(&a), &len);
-    client = UniqueFd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    EXPECT_EQ(::connect(client.get(), reinterpret_cast<sockaddr*>(&a), len), 0);
-    return say("");
+  std::unique_ptr<TestLink> open(Peer peer = {}) {
+    auto link = std::make_unique<TestLink>(svc::smtp, std::move(peer));
+    EXPECT_TRUE(link->take().starts_with("220 "));
+    return link;
   }
-  // Sends `text`; the next reply line, the dispatcher pumped until it comes.
-  std::string say(std::string_view text) {
-    ::send(client.get(), text.data(), text.size(), 0);
-    std::string line;
-    auto end = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    while (line.find('\n') == std::string::npos && std::chrono::steady_clock::now() < end) {
-      dispatcher(10);
-      char c;
-      while (line.find('\n') == std::string::npos && ::recv(client.get(), &c, 1, MSG_DONTWAIT) == 1) line += c;
-    }
-    return line.substr(0, line.find('\r'));
+  // The reply lines to `text`, fed in pieces of `piece` bytes.
+  std::vector<std::string> say(TestLink& link, std::string_view text, std::size_t piece = 0) {
+    link.feed(text, piece);
+    return reply_lines(link.take());
   }
-  std::string send_message() {  // the reply to its end
-    say("MAIL FROM:<x@far.example>\r\n");
-    say("RCPT TO:<ann@site.example>\r\n");
-    say("DATA\r\n");
-    return say("Subject: s\r\n\r\nbody\r\n.\r\n");
+  std::vector<std::string> stored() { return folder_names(root + "/in", true); }
+  std::vector<std::string> hidden() {
+    std::vector<std::string> names;
+    for (const std::string& n : folder_names(root + "/in"))
+      if (n[0] == '.') names.push_back(n);
+    return names;
   }
-
-  int listener = -1;
-  UniqueFd client;
+  std::string message_of(const std::string& path) {
+    std::string data = read_file(path);
+    return data.substr(data.find("\r\nX-Sender: ") + 2);
+  }
 };
 
-TEST_F(SmtpServerTest, AMessageIsAcknowledgedOnlyOnceItsFileAndFolderAreSynced) {
-  connect();
+const char* const kEnvelope = "MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\nDATA\r\n";
+
+TEST_F(SmtpSessionTest, AMessageIsAcknowledgedOnlyOnceItsFileAndFolderAreSynced) {
+  auto link = open();
   sysio::reset();
-  EXPECT_EQ(send_message(), "250 OK");
+  EXPECT_EQ(say(*link, std::string(kEnvelope) + "Subject: s\r\n\r\nbody\r\n.\r\n").back(), "250 OK");
   EXPECT_EQ(sysio::count(sysio::Op::sync), 2u);  // syncfs, then the folder
   EXPECT_EQ(sysio::count(sysio::Op::rename), 1u);
-  ASSERT_EQ(folder_names(root + "/in").size(), 1u);
-  unlink(folder_names(root + "/in", true).front().c_str());
+  ASSERT_EQ(stored().size(), 1u);
+  unlink(stored().front().c_str());
   // The queue file's write, the syncfs, the rename, the folder sync.
   for (auto [op, n] : {std::pair{sysio::Op::write, 1}, {sysio::Op::sync, 1}, {sysio::Op::rename, 1}, {sysio::Op::sync, 2}}) {
     sysio::reset();
     sysio::fail_nth(op, n);
-    EXPECT_EQ(send_message(), "451 Requested action aborted: local error in processing") << int(op) << n;
-    EXPECT_EQ(folder_names(root + "/in"), std::vector<std::string>{}) << int(op) << n;
+    EXPECT_EQ(say(*link, std::string(kEnvelope) + "Subject: s\r\n\r\nbody\r\n.\r\n").back(),
+              "451 Requested action aborted: local error in processing")
+        << int(op) << n;
+    EXPECT_EQ(stored(), std::vector<std::string>{}) << int(op) << n;
+    EXPECT_EQ(hidden(), std::vector<std::string>{}) << int(op) << n;
   }
 }
 
-TEST_F(SmtpServerTest, IdVerifyRefusesASenderThatIsNoLocalUser) {
-  EXPECT_EQ(connect().find("[ID verify]"), std::string::npos);
-  say("MAIL FROM:<made_up@site.example>\r\n");
-  EXPECT_EQ(say("RCPT TO:<ann@site.example>\r\n"), "250 OK Recipient syntactically correct");
-  config.smtp_auth = address_list_parse("127.0.0.1");
-  EXPECT_NE(connect().find("SMTP Server [ID verify] (v"), std::string::npos);
-  say("MAIL FROM:<made_up@site.example>\r\n");
-  EXPECT_EQ(say("RCPT TO:<ann@site.example>\r\n"), "550 posting denied");
-  for (const char* real : {"MAIL FROM:<ann@site.example>\r\n", "MAIL FROM:<someone@far.example>\r\n"}) {
-    say(real);
-    EXPECT_EQ(say("RCPT TO:<ann@site.example>\r\n"), "250 OK Recipient syntactically correct");
+TEST_F(SmtpSessionTest, PipelinedCommandsInAnySplitAreAnsweredInOrder) {
+  const std::string input = "HELO me\r\nMAIL FROM:<>\r\nRCPT TO:<ann@site.example>\r\nDATA\r\n"
+                            "Subject: p\r\n\r\n.hidden\r\nbody\r\n.\r\nNOOP\r\nQUIT\r\n";
+  for (std::size_t piece : {0, 1, 2, 5}) {
+    auto link = std::make_unique<TestLink>(svc::smtp);
+    link->feed(input, piece);
+    auto lines = reply_lines(link->output());
+    ASSERT_EQ(lines.size(), 8u) << piece;
+    EXPECT_EQ(lines[1], "250 Hello me, how's life?");
+    EXPECT_EQ(lines[2], "250 OK Sender accepted");
+    EXPECT_EQ(lines[3], "250 OK Recipient syntactically correct");
+    EXPECT_TRUE(lines[4].starts_with("354 "));
+    EXPECT_EQ(lines[5], "250 OK");  // the commit came before the NOOP was read
+    EXPECT_EQ(lines[6], "250 OK");
+    EXPECT_TRUE(lines[7].starts_with("221 "));
+    EXPECT_TRUE(link->closed());
+    EXPECT_EQ(link->reason(), CloseReason::requested);
   }
+  auto files = stored();
+  ASSERT_EQ(files.size(), 4u);
+  for (const auto& f : files) {
+    EXPECT_NE(read_file(f).find("\r\nX-Sender: Unknown\r\n"), std::string::npos);
+    // Dot lines stay stuffed as sent; the terminator is stored.
+    EXPECT_TRUE(read_file(f).ends_with("\r\n\r\n.hidden\r\nbody\r\n.\r\n"));
+  }
+}
+
+TEST_F(SmtpSessionTest, OverlongLinesAreRefusedAndTheTransactionSurvives) {
+  auto link = open();
+  EXPECT_EQ(say(*link, "MAIL FROM:<ann@far.example>\r\n"), std::vector<std::string>{"250 OK Sender accepted"});
+  // 510 bytes without the line end is the longest line; one more is refused.
+  EXPECT_EQ(say(*link, "NOOP" + std::string(506, ' ') + "\r\n"), std::vector<std::string>{"250 OK"});
+  EXPECT_EQ(say(*link, "NOOP" + std::string(507, ' ') + "\r\n"), std::vector<std::string>{"500 Line too long"});
+  // Far longer than the input buffer, in pieces: one refusal, nothing stalls.
+  EXPECT_EQ(say(*link, "RCPT TO:<" + std::string(100000, 'x') + "@site.example>\r\n", 4093),
+            std::vector<std::string>{"500 Line too long"});
+  EXPECT_EQ(say(*link, "RCPT TO:<ann@site.example>\r\nDATA\r\nSubject: s\r\n\r\nok\r\n.\r\n"),
+            (std::vector<std::string>{"250 OK Recipient syntactically correct",
+                                      "354 Start mail input; end with <CRLF>.<CRLF>", "250 OK"}));
+  EXPECT_EQ(read_file(stored().at(0)).find("RCPT TO:<x"), std::string::npos);
+}
+
+TEST_F(SmtpSessionTest, AClientThatPipelinesWithoutReadingCostsBoundedMemory) {
+  auto link = open();
+  link->peer_window(0);
+  std::string noops;
+  for (int i = 0; i < 20000; ++i) noops += "NOOP\r\n";
+  link->feed(noops, 4096);
+  EXPECT_LE(link->connection().pending(), Connection::kHighWater + 600);
+  link->peer_window(std::numeric_limits<std::size_t>::max());
+  auto lines = reply_lines(link->take());
+  EXPECT_EQ(lines.size(), 20000u);
+  EXPECT_EQ(std::set<std::string>(lines.begin(), lines.end()), std::set<std::string>{"250 OK"});
+}
+
+TEST_F(SmtpSessionTest, TheDataPhaseEdges) {
+  auto link = open();
+  // A terminator split so that one read ends in "\r\n." and the next begins "\r\n".
+  link->feed(kEnvelope);
+  link->take();
+  EXPECT_EQ(say(*link, "Subject: split\r\n\r\nbody\r\n."), std::vector<std::string>{});
+  EXPECT_EQ(say(*link, "\r\n"), std::vector<std::string>{"250 OK"});
+  // No Date header: one is added as the last header line, also when the
+  // header arrives in pieces.
+  link->feed(kEnvelope);
+  link->take();
+  EXPECT_EQ(say(*link, "From: a@b\r\nSubject: undated\r\n\r\nx\r\n.\r\n", 3), std::vector<std::string>{"250 OK"});
+  // Bare LF line ends are stored as CR LF; a line of two dots stays two dots.
+  link->feed(kEnvelope);
+  link->take();
+  EXPECT_EQ(say(*link, "Subject: bare\nDate: Mon, 1 Jan 2024 00:00:00 +0000\n\n..\nend\n.\n"),
+            std::vector<std::string>{"250 OK"});
+  auto files = stored();
+  ASSERT_EQ(files.size(), 3u);
+  EXPECT_EQ(message_of(files[0]).substr(message_of(files[0]).find("\r\n\r\n")), "\r\n\r\nbody\r\n.\r\n");
+  std::string undated = message_of(files[1]);
+  std::string header = undated.substr(0, undated.find("\r\n\r\n"));
+  EXPECT_TRUE(header.substr(header.rfind("\r\n") + 2).starts_with("Date: ")) << header;
+  EXPECT_TRUE(message_of(files[2]).ends_with("\r\n\r\n..\r\nend\r\n.\r\n"));
+  // A client that goes away in the middle leaves nothing behind.
+  link->feed(kEnvelope);
+  link->feed("Subject: cut\r\n\r\n" + std::string(50000, 'x') + "\r\nmore");
+  link->vanish();
+  EXPECT_EQ(link->reason(), CloseReason::peer_reset);
+  EXPECT_EQ(stored().size(), 3u);
+  EXPECT_EQ(hidden(), std::vector<std::string>{});
+}
+
+TEST_F(SmtpSessionTest, RsetAndQuit) {
+  auto link = open();
+  EXPECT_EQ(say(*link, "MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\nRSET\r\nDATA\r\n"),
+            (std::vector<std::string>{"250 OK Sender accepted", "250 OK Recipient syntactically correct",
+                                      "250 Reset OK", "503 Need MAIL before DATA"}));
+  EXPECT_EQ(say(*link, "MAIL FROM:<x@far.example>\r\nRCPT TO:<ann@site.example>\r\n").size(), 2u);
+  EXPECT_EQ(hidden().size(), 1u);  // the transaction's file, not yet a message
+  auto lines = say(*link, "QUIT\r\nNOOP\r\n");
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_TRUE(lines[0].starts_with("221 ")) << lines[0];
+  EXPECT_EQ(link->reason(), CloseReason::requested);
+  EXPECT_EQ(stored(), std::vector<std::string>{});
+  EXPECT_EQ(hidden(), std::vector<std::string>{});
+  // A client that stops sending after its message still gets it committed
+  // and answered before the close.
+  auto other = open();
+  other->feed(std::string(kEnvelope) + "Subject: last\r\n\r\nx\r\n.\r\n");
+  other->finish();
+  EXPECT_EQ(reply_lines(other->output()).back(), "250 OK");
+  EXPECT_EQ(other->reason(), CloseReason::peer_closed);
+  EXPECT_EQ(stored().size(), 1u);
+}
+
+TEST_F(SmtpSessionTest, TheAcceptRuleRefusesBlocksAndAsksStrangersToIdentify) {
+  const Peer stranger{inet_addr("192.0.2.9"), 4000, "192.0.2.9"};
+  config.smtp_block = address_list_parse("192.0.2.0/24");
+  TestLink refused(svc::smtp, stranger);
+  EXPECT_TRUE(refused.output().starts_with("421 "));
+  EXPECT_TRUE(refused.output().ends_with(" connection refused\r\n"));
+  EXPECT_TRUE(refused.closed());
+  config.smtp_allow = address_list_parse("192.0.2.9");  // allow wins over block
+  TestLink allowed(svc::smtp, stranger);
+  EXPECT_TRUE(allowed.output().starts_with("220 "));
+
+  config.smtp_allow.clear();
+  config.smtp_block.clear();
+  auto plain = open();
+  EXPECT_EQ(say(*plain, "MAIL FROM:<made_up@site.example>\r\nRCPT TO:<ann@site.example>\r\n").back(),
+            "250 OK Recipient syntactically correct");
+  config.smtp_auth = address_list_parse("127.0.0.1");
+  TestLink verify(svc::smtp);
+  EXPECT_NE(verify.take().find("SMTP Server [ID verify] (v"), std::string::npos);
+  EXPECT_EQ(say(verify, "MAIL FROM:<made_up@site.example>\r\nRCPT TO:<ann@site.example>\r\n").back(),
+            "550 posting denied");
+  for (const char* real : {"MAIL FROM:<ann@site.example>\r\n", "MAIL FROM:<someone@far.example>\r\n"})
+    EXPECT_EQ(say(verify, std::string(real) + "RCPT TO:<ann@site.example>\r\n").back(),
+              "250 OK Recipient syntactically correct");
 }
 
 }  // namespace

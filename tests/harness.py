@@ -45,13 +45,13 @@ _PORT_KEY = re.compile(r'^%([a-z.]+)\.sock\.port\s*:', re.IGNORECASE)
 _NOT_OURS = {'proxy.external'}
 
 
-def wait_for(predicate, timeout=5.0):
+def wait_for(predicate, timeout=5.0, interval=0.05):
     """Polls `predicate` until it is true or `timeout` seconds pass; its last value."""
     deadline = time.monotonic() + timeout
     while time.monotonic() < deadline:
         if predicate():
             return True
-        time.sleep(0.05)
+        time.sleep(interval)
     return predicate()
 
 

@@ -13,7 +13,7 @@ import tempfile
 import time
 import unittest
 
-from harness import Suite, VELMOR_BIN, set_keys
+from harness import Suite, VELMOR_BIN, set_keys, wait_for
 
 DOMAIN = 'example.test'
 PASSWORD = 'sesame-42'
@@ -232,8 +232,7 @@ class BadInput(MailSuite):
         self.assertEqual(talk(b'NOOP'), [b'+OK\r\n'])
         # A line end split between two packets is still one line end.
         s.sendall(b'NOOP\r')
-        self.assertEqual(f.readline(), b'+OK\r\n')
-        time.sleep(0.05)
+        self.assertEqual(f.readline(), b'+OK\r\n')  # so the LF comes in a read of its own
         self.assertEqual(talk(b'\nNOOP'), [b'+OK\r\n'])
 
         # The other forms of the name the user database knows.
@@ -370,7 +369,9 @@ class Faults(MailSuite):
         self.assertEqual(talk(b'PASS ' + PASSWORD.encode()), [b'+OK 13 messages waiting for alice\r\n'])
         self.assertEqual(talk(b'DELE 1'), [b'+OK message 1 deleted\r\n'])
         s.sendall(b'QUIT\r\n')
-        time.sleep(0.01)
+        # Killed once the rewrite has begun (its new file exists) or is done.
+        self.assertTrue(wait_for(lambda: os.path.exists(self.inbox + '~') or os.path.getsize(self.inbox) != len(old),
+                                 10, interval=0.001))
         self.suite.proc.send_signal(signal.SIGKILL)
         self.suite.proc.wait(timeout=10)
         with open(self.inbox, 'rb') as f:

@@ -4,6 +4,7 @@ Debatching is off (mail.debatch.time 0), so every accepted message stays in
 the incoming queue where the tests read it back.
 """
 import os
+import select
 import shutil
 import smtplib
 import socket
@@ -13,7 +14,7 @@ import time
 import unittest
 
 import netns
-from harness import Suite, SuiteTestCase
+from harness import Suite, SuiteTestCase, wait_for
 
 NO_DEBATCH = {'mail.debatch.time': '0', 'mail.domains': 'localhost, site.example'}
 
@@ -56,6 +57,17 @@ class Conversation:
     def cmd(self, text):
         self.send(text + '\r\n')
         return self.line()
+
+    def waiting_bytes(self):
+        """Bytes the server sent that this side has not read yet."""
+        if not select.select([self.sock], [], [], 0)[0]:
+            return len(self.buf)
+        return len(self.buf) + len(self.sock.recv(1 << 20, socket.MSG_PEEK))
+
+    def wait_closed(self):
+        """Reads until the server closes the connection."""
+        while self.sock.recv(65536):
+            pass
 
     def close(self):
         self.sock.close()
@@ -117,9 +129,9 @@ class SmtpServerTest(SuiteTestCase):
         # QUIT after RCPT without DATA leaves nothing behind.
         self.assertEqual(c.cmd('MAIL FROM:<x@far.example>'), '250 OK Sender accepted')
         self.assertEqual(c.cmd('RCPT TO:<postmaster@localhost>'), '250 OK Recipient syntactically correct')
+        self.assertEqual(len(hidden_files(self.suite)), 1)  # the transaction's file
         self.assertRegex(c.cmd('QUIT'), r'^221 \S+ Velmor SMTP Server \(2\.0\.49\) closing connection at ')
-        c.close()
-        time.sleep(0.3)
+        c.wait_closed()  # the session has let go of everything by now
         self.assertEqual(queue_files(self.suite), [])
         self.assertEqual(hidden_files(self.suite), [])
 
@@ -136,7 +148,8 @@ class SmtpServerTest(SuiteTestCase):
         # the server waits for the client instead of dropping replies.
         count = 6000
         c.send('NOOP\r\n' * count)
-        time.sleep(0.5)
+        # Nothing is read until every reply has arrived.
+        self.assertTrue(wait_for(lambda: c.waiting_bytes() >= count * len('250 OK\r\n'), 10))
         replies = [c.line() for _ in range(count)]
         self.assertEqual(set(replies), {'250 OK'})
         self.assertEqual(c.cmd('NOOP'), '250 OK')
@@ -183,11 +196,11 @@ class SmtpServerTest(SuiteTestCase):
         c.cmd('RCPT TO:<postmaster@localhost>')
         self.assertTrue(c.cmd('DATA').startswith('354'))
         c.send(b'Subject: cut\r\n\r\n' + b'x' * 200000 + b'\r\nmore')
-        time.sleep(0.3)
+        self.assertEqual(len(hidden_files(self.suite)), 1)
         c.close()
-        time.sleep(0.5)
+        # The unfinished message's file goes with the connection.
+        self.assertTrue(wait_for(lambda: hidden_files(self.suite) == [], 10))
         self.assertEqual(queue_files(self.suite), [])
-        self.assertEqual(hidden_files(self.suite), [])
         # The server is still there for the next client.
         with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as s:
             s.sendmail('a@far.example', ['postmaster@localhost'], 'Subject: after\r\n\r\nx\r\n')
@@ -331,7 +344,7 @@ class CrashTest(unittest.TestCase):
             c.cmd('RCPT TO:<bob@remote.example>')
             c.cmd('DATA')
             c.send(b'Subject: half\r\n\r\n' + b'y' * 500000)
-            time.sleep(0.5)
+            self.assertEqual(len(hidden_files(suite)), 1)  # the message is being received
             suite.kill()  # SIGKILL
             c.close()
             files = queue_files(suite)

@@ -70,7 +70,7 @@ int change_password(std::string_view name, std::string_view old_password,
   const UserRecord* user = user_find(name);
   if (!user || new_password.empty()) return 0;
   std::string login = user->login;
-  if (user_set_password(login, new_password) != 1) {
+  if (user_set_password(login, new_password) != UserChange::done) {
     log_message("Password change failed: ", user_last_error());
     return 0;
   }
@@ -267,8 +267,8 @@ int users_command_run() {
       auto password = new_password(req, error);
       if (!password) return fail(error);
       if (password->empty()) return fail("the password is empty");
-      int rc = user_add(req.name, *password, req.full_name.value_or(""), home, req.group);
-      if (rc != 0) return fail(user_last_error());
+      if (user_add(req.name, *password, req.full_name.value_or(""), home, req.group) != UserChange::done)
+        return fail(user_last_error());
       make_path(home);
       std::printf("Added user %s (home %s, group %d)\n", req.name.c_str(), home.c_str(), req.group);
       if (groups_load(text_of(config.file_user_groups)) == 0 && !group_find(req.group) && group_default()) {
@@ -282,12 +282,12 @@ int users_command_run() {
       auto password = new_password(req, error);
       if (!password) return fail(error);
       if (password->empty()) return fail("the password is empty");
-      if (user_set_password(login, *password) != 1) return fail(user_last_error());
+      if (user_set_password(login, *password) != UserChange::done) return fail(user_last_error());
       std::printf("Changed the password of %s\n", login.c_str());
       break;
     }
     case Request::Action::remove:
-      if (user_remove(req.name) != 0) return fail(user_last_error());
+      if (user_remove(req.name) != UserChange::done) return fail(user_last_error());
       std::printf("Removed user %s (the home folder is left as it is)\n", req.name.c_str());
       break;
     case Request::Action::none:
@@ -317,7 +317,7 @@ int users_make_demo() {
     return 1;
   }
   std::string home = in_root("home/demo");
-  if (user_add("demo", password, "Demo User", home, 0) != 0) {
+  if (user_add("demo", password, "Demo User", home, 0) != UserChange::done) {
     std::printf("Couldn't add the demo user: %s\n", user_last_error().c_str());
     return 1;
   }

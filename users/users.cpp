@@ -203,16 +203,25 @@ bool save_or_undo(Undo undo) {
 // record "<tag>:<login>,<note>"; puts the field back when the file cannot be
 // written.
 template <typename Field>
-int change_field(std::string_view name, Field UserRecord::*field, Field value, const char* tag,
-                 std::string_view note) {
+UserChange change_field(std::string_view name, Field UserRecord::*field, Field value, const char* tag,
+                        std::string_view note) {
   UserRecord* user = find_login(name);
-  if (!user) return refuse(strprintf("no user %.*s", static_cast<int>(name.size()), name.data()));
+  if (!user) {
+    refuse(strprintf("no user %.*s", static_cast<int>(name.size()), name.data()));
+    return UserChange::not_found;
+  }
   Field old = std::move(user->*field);
   user->*field = std::move(value);
-  if (!save_or_undo([&] { user->*field = std::move(old); })) return 0;
+  if (!save_or_undo([&] { user->*field = std::move(old); })) return UserChange::not_saved;
   user_change_note(strprintf("%s:%s,%.*s", tag, user->login.c_str(), static_cast<int>(note.size()),
                              note.data()));
-  return 1;
+  return UserChange::done;
+}
+
+// Records why a field is refused.
+UserChange bad_field(std::string why) {
+  refuse(std::move(why));
+  return UserChange::bad_field;
 }
 
 }  // namespace
@@ -298,18 +307,15 @@ int user_check_password(std::string_view name, std::string_view password) {
   return constant_time_equals(hash, user->password_hash) ? 0 : 2;
 }
 
-int user_add(std::string_view name, std::string_view password, std::string_view full_name,
-             std::string_view home, int group) {
+UserChange user_add(std::string_view name, std::string_view password, std::string_view full_name,
+                    std::string_view home, int group) {
   for (const std::string& why : {login_problem(name), password_problem(password),
                                  field_problem("full name", full_name), home_problem(home)}) {
-    if (!why.empty()) {
-      refuse(why);
-      return 3;
-    }
+    if (!why.empty()) return bad_field(why);
   }
   if (find_login(name)) {
     refuse(strprintf("the user %.*s exists already", static_cast<int>(name.size()), name.data()));
-    return 4;
+    return UserChange::exists;
   }
   auto user = std::make_unique<UserRecord>();
   user->login = name;
@@ -320,36 +326,36 @@ int user_add(std::string_view name, std::string_view password, std::string_view 
   const UserRecord& added = *user;
   Bucket& bucket = table().buckets[bucket_of(name)];
   bucket.push_back(std::move(user));
-  if (!save_or_undo([&] { bucket.pop_back(); })) return 1;
+  if (!save_or_undo([&] { bucket.pop_back(); })) return UserChange::not_saved;
   user_change_note(strprintf("add:%s,%s,%s,%s,%d", added.login.c_str(),
                              added.password_hash.c_str(), added.full_name.c_str(),
                              added.home.c_str(), added.group));
-  return 0;
+  return UserChange::done;
 }
 
-int user_set_password(std::string_view name, std::string_view password) {
-  if (std::string why = password_problem(password); !why.empty()) return refuse(why);
+UserChange user_set_password(std::string_view name, std::string_view password) {
+  if (std::string why = password_problem(password); !why.empty()) return bad_field(why);
   std::string hash = md5_crypt(password, new_salt());
-  if (hash.size() > kMaxHash) return refuse("the password hash is too long");
+  if (hash.size() > kMaxHash) return bad_field("the password hash is too long");
   return change_field(name, &UserRecord::password_hash, std::move(hash), "pass", password);
 }
 
-int user_set_home(std::string_view name, std::string_view home) {
-  if (std::string why = home_problem(home); !why.empty()) return refuse(why);
+UserChange user_set_home(std::string_view name, std::string_view home) {
+  if (std::string why = home_problem(home); !why.empty()) return bad_field(why);
   return change_field(name, &UserRecord::home, std::string(home), "dir", home);
 }
 
-int user_set_name(std::string_view name, std::string_view full_name) {
-  if (std::string why = field_problem("full name", full_name); !why.empty()) return refuse(why);
+UserChange user_set_name(std::string_view name, std::string_view full_name) {
+  if (std::string why = field_problem("full name", full_name); !why.empty()) return bad_field(why);
   return change_field(name, &UserRecord::full_name, std::string(full_name), "name", full_name);
 }
 
-int user_set_group(std::string_view name, int group) {
+UserChange user_set_group(std::string_view name, int group) {
   return change_field(name, &UserRecord::group, group, "group", std::to_string(group));
 }
 
-int user_remove(std::string_view name) {
-  if (name.empty()) return 1;
+UserChange user_remove(std::string_view name) {
+  if (name.empty()) return UserChange::not_found;
   Bucket& bucket = table().buckets[bucket_of(name)];
   for (std::size_t i = 0; i < bucket.size(); ++i) {
     if (!str_iequals(bucket[i]->login, name)) continue;
@@ -358,12 +364,12 @@ int user_remove(std::string_view name) {
     auto undo = [&] {
       bucket.insert(bucket.begin() + static_cast<std::ptrdiff_t>(i), std::move(removed));
     };
-    if (!save_or_undo(undo)) return 2;
+    if (!save_or_undo(undo)) return UserChange::not_saved;
     user_change_note("remove:" + removed->login);
-    return 0;
+    return UserChange::done;
   }
   refuse(strprintf("no user %.*s", static_cast<int>(name.size()), name.data()));
-  return 1;
+  return UserChange::not_found;
 }
 
 const std::string& user_last_error() { return table().last_error; }

@@ -41,15 +41,22 @@ int user_save();
 const UserRecord* user_find(std::string_view key);
 // 0 correct; 1 no such user, no stored hash or no password; 2 wrong.
 int user_check_password(std::string_view name, std::string_view password);
-// 0 added; 1 failed; 3 a field holds a character the file cannot carry
-// (comma, CR, LF or NUL); 4 the login exists already.
-int user_add(std::string_view name, std::string_view password, std::string_view full_name,
-             std::string_view home, int group);
-int user_set_password(std::string_view name, std::string_view password);  // 1 changed; 0 not
-int user_set_home(std::string_view name, std::string_view home);          // 1 changed; 0 not
-int user_set_name(std::string_view name, std::string_view full_name);     // 1 changed; 0 not
-int user_set_group(std::string_view name, int group);                     // 1 changed; 0 not
-int user_remove(std::string_view name);  // 0 removed; 1 not found; 2 not saved
+// How a change to the table went; anything but `done` leaves the table, the
+// file and the change log as they were, and user_last_error() says why.
+enum class UserChange {
+  done,
+  bad_field,  // a field is empty, too long, or holds what the file cannot carry (comma, CR, LF, NUL)
+  exists,     // the login is taken already (user_add)
+  not_found,  // no such user
+  not_saved,  // the file could not be written
+};
+UserChange user_add(std::string_view name, std::string_view password, std::string_view full_name,
+                    std::string_view home, int group);
+UserChange user_set_password(std::string_view name, std::string_view password);
+UserChange user_set_home(std::string_view name, std::string_view home);
+UserChange user_set_name(std::string_view name, std::string_view full_name);
+UserChange user_set_group(std::string_view name, int group);
+UserChange user_remove(std::string_view name);
 // Why the last change that failed was refused ("the full name holds a comma").
 const std::string& user_last_error();
 std::string user_home(std::string_view name);        // "" when unknown

@@ -141,21 +141,21 @@ TEST_F(UsersTest, ChecksPasswordsAgainstCryptHashes) {
 
 TEST_F(UsersTest, EveryChangeIsSavedAndLogged) {
   load("");
-  ASSERT_EQ(user_add("alice", "first", "Alice Liddell", "/home/alice", 1), 0);
-  ASSERT_EQ(user_add("bob", "first", "", "/home/bob", 0), 0);
+  ASSERT_EQ(user_add("alice", "first", "Alice Liddell", "/home/alice", 1), UserChange::done);
+  ASSERT_EQ(user_add("bob", "first", "", "/home/bob", 0), UserChange::done);
   const std::string hash = user_find("alice")->password_hash;
   EXPECT_EQ(hash.substr(0, 3), "$1$");
   EXPECT_EQ(hash.find('$', 3), 8u);  // five salt characters
   EXPECT_NE(hash.substr(3, 5), user_find("bob")->password_hash.substr(3, 5));
   EXPECT_EQ(user_check_password("alice", "first"), 0);
 
-  EXPECT_EQ(user_set_password("ALICE", "second"), 1);
-  EXPECT_EQ(user_set_home("alice", "/srv/alice"), 1);
-  EXPECT_EQ(user_set_name("alice", "Alice L"), 1);
-  EXPECT_EQ(user_set_group("alice", 4), 1);
-  EXPECT_EQ(user_remove("BOB"), 0);
-  EXPECT_EQ(user_set_password("bob", "x"), 0);
-  EXPECT_EQ(user_remove("bob"), 1);
+  EXPECT_EQ(user_set_password("ALICE", "second"), UserChange::done);
+  EXPECT_EQ(user_set_home("alice", "/srv/alice"), UserChange::done);
+  EXPECT_EQ(user_set_name("alice", "Alice L"), UserChange::done);
+  EXPECT_EQ(user_set_group("alice", 4), UserChange::done);
+  EXPECT_EQ(user_remove("BOB"), UserChange::done);
+  EXPECT_EQ(user_set_password("bob", "x"), UserChange::not_found);
+  EXPECT_EQ(user_remove("bob"), UserChange::not_found);
 
   std::string log = changes();
   std::string expected = "add:alice," + hash + ",Alice Liddell,/home/alice,1\n";
@@ -184,20 +184,20 @@ TEST_F(UsersTest, RefusesWhatTheFileCannotCarryAndLeavesItUnchanged) {
   ASSERT_EQ(user_save(), 0);
   const std::string before = read_file(users_file());
 
-  EXPECT_EQ(user_add("bob", "pw", "Bob, Jr", "/home/bob", 0), 3);
+  EXPECT_EQ(user_add("bob", "pw", "Bob, Jr", "/home/bob", 0), UserChange::bad_field);
   EXPECT_NE(user_last_error().find("comma"), std::string::npos);
-  EXPECT_EQ(user_add("bob", "pw", "Bob", "/home/b\nob", 0), 3);
-  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string("/home/b\0b", 9), 0), 3);
-  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string(256, 'h'), 0), 3);
-  EXPECT_EQ(user_add("b,ob", "pw", "", "", 0), 3);
-  EXPECT_EQ(user_add("bo b", "pw", "", "", 0), 3);
-  EXPECT_EQ(user_add("|bob", "pw", "", "", 0), 3);
-  EXPECT_EQ(user_add("", "pw", "", "", 0), 3);
-  EXPECT_EQ(user_add("bob", "pw\nadd:evil,x", "", "", 0), 3);
-  EXPECT_EQ(user_add("Alice", "pw", "", "", 0), 4);  // the same user in another case
-  EXPECT_EQ(user_set_name("alice", "A, B"), 0);
-  EXPECT_EQ(user_set_home("alice", "/x\r"), 0);
-  EXPECT_EQ(user_set_password("alice", "a\rb"), 0);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", "/home/b\nob", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string("/home/b\0b", 9), 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("bob", "pw", "Bob", std::string(256, 'h'), 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("b,ob", "pw", "", "", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("bo b", "pw", "", "", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("|bob", "pw", "", "", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("", "pw", "", "", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("bob", "pw\nadd:evil,x", "", "", 0), UserChange::bad_field);
+  EXPECT_EQ(user_add("Alice", "pw", "", "", 0), UserChange::exists);  // the same user in another case
+  EXPECT_EQ(user_set_name("alice", "A, B"), UserChange::bad_field);
+  EXPECT_EQ(user_set_home("alice", "/x\r"), UserChange::bad_field);
+  EXPECT_EQ(user_set_password("alice", "a\rb"), UserChange::bad_field);
 
   EXPECT_EQ(read_file(users_file()), before);
   EXPECT_FALSE(fs::exists(dir_ / "changes"));
@@ -212,8 +212,8 @@ bool changes_fail_past_limit(std::size_t limit_bytes) {
   std::signal(SIGXFSZ, SIG_IGN);
   rlimit limit{static_cast<rlim_t>(limit_bytes), static_cast<rlim_t>(limit_bytes)};
   if (::setrlimit(RLIMIT_FSIZE, &limit) != 0) return false;
-  return user_add("bob", "pw", std::string(500, 'b'), "/home/bob", 0) == 1 &&
-         user_find("bob") == nullptr && user_set_name("alice", std::string(500, 'a')) == 0 &&
+  return user_add("bob", "pw", std::string(500, 'b'), "/home/bob", 0) == UserChange::not_saved &&
+         user_find("bob") == nullptr && user_set_name("alice", std::string(500, 'a')) == UserChange::not_saved &&
          user_find("alice")->full_name == "Alice" &&
          user_last_error().find("could not be written") != std::string::npos;
 }

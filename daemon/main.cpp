@@ -32,12 +32,14 @@
 #include "core/privileges.h"
 #include "core/process.h"
 #include "core/scheduler.h"
-#include "core/sockets.h"
+#include "core/network.h"
 #include "core/strfmt.h"
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/pop_server.h"
 #include "mail/queue.h"
+#include "mail/smtp_server.h"
 #include "users/admin.h"
 
 namespace velmor {
@@ -312,7 +314,7 @@ void guarded_poll(const char* name, F&& poll_step) {
 // Waits for socket readiness, or for a signal, until the next tick.
 void wait_until(std::int64_t tick) {
   std::int64_t ms = std::max<std::int64_t>(0, tick - monotonic_ms());
-  guarded_poll("dispatcher", [ms] { dispatcher(static_cast<int>(ms)); });  // a signal ends the wait early
+  guarded_poll("dispatcher", [ms] { net_pass(static_cast<int>(ms)); });  // a signal ends the wait early
 }
 
 // Every half second; each poll returns quickly.
@@ -325,7 +327,7 @@ void tick() {
   guarded_poll("child process", process_poll);
   // resends, time-outs, and the link monitor while the link is down or in doubt
   guarded_poll("resolver", dns_poll);
-  guarded_poll("idle time-out", sockets_check_timeouts);
+  guarded_poll("connection", net_tick);  // idle time-outs, the services' tick hooks
 }
 
 void poll() {
@@ -362,7 +364,7 @@ void shutdown_suite() {
   dialler_shutdown();
   dns_shutdown();
   log_message("Shutting down sockets");
-  sockets_close_all();
+  net_close_all();
   log_message("Shutting down filecache");
   filecache_shutdown();
   log_message("Shutting down logger");
@@ -370,6 +372,16 @@ void shutdown_suite() {
 }
 
 // ---- start-up ---------------------------------------------------------------
+
+// An admin.email without "@" gets the mail domain (the first of
+// mail.domains, else server.name): it goes into every greeting.
+void complete_admin_email() {
+  if (!config.admin_email || config.admin_email->find('@') != std::string::npos) return;
+  std::string domain = text_of(config.mail_domains);
+  domain = domain.substr(0, domain.find_first_of(", \t"));
+  if (domain.empty()) domain = text_of(config.server_name);
+  if (!domain.empty()) *config.admin_email += "@" + domain;
+}
 
 // The pid file is written under a temporary name and renamed into place, so
 // whoever sees it sees the whole number. When it cannot be written the suite
@@ -444,18 +456,27 @@ int start_and_run() {
   if (int rc = schedule_load(); rc != 0) return fail("Scheduler init failed", rc);
   // "Loading user database", "Loading user group options"; users_init says what failed.
   if (int rc = users_init()) return fail(nullptr, rc);
-  dns_init();  // its sockets open with the listeners
+  dns_register();  // its sockets open once the loop is up
   log_message("Initialising mail system");
   mail_init();
+  complete_admin_email();
+  // The services, in the order their listeners open.
+  pop_register();
+  smtp_register();
   log_message("Starting listening sockets");
-  if (sockets_init() != 0) {
+  // Without its control channel the suite could not be steered, and a
+  // squatter on the path would get what local tools send: no start.
+  if (net_start() != 0 || control_open() != 0) {
     log_message("Socket initialisation failed - see logs for more info");
-    sockets_close_all();
+    net_close_all();
+    control_remove();
     return fail("Socket initialisation failed - see logs for more info", 1);
   }
+  dns_start();
   if (std::string error = privileges_drop(); !error.empty()) {
     log_message(error);
-    sockets_close_all();
+    dns_shutdown();
+    net_close_all();
     control_remove();
     return fail(error.c_str(), 1);
   }

@@ -1,0 +1,90 @@
+// The test driver: a real Connection (the same line reader, output queue,
+// gates and close path as in the suite) over an in-memory transport, with a
+// clock the test moves. Sessions are driven without sockets:
+//
+//   TestLink link(svc::smtp);               // the registered service's own rules and session
+//   link.feed("HELO x\r\nNOOP\r\n", 3);     // in pieces of 3 bytes
+//   EXPECT_EQ(link.take(), "250 ...\r\n250 OK\r\n");
+//   link.advance(std::chrono::seconds(1));  // timers fire
+//   EXPECT_EQ(link.reason(), CloseReason::requested);
+//
+// After every piece of input the after-pass hooks run (as at the end of a
+// pass of the loop), so work they carry (the mail queue's group commit)
+// happens as in the suite.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <limits>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "core/connection.h"
+#include "core/connection_core.h"
+
+namespace velmor {
+
+class TestLink final : public ConnectionHost {
+ public:
+  // A connection of the registered service `service` from `peer` (loopback
+  // unless given): its accept rule, line rules, time-outs and session.
+  explicit TestLink(int service, Peer peer = {});
+  // A connection with a session of the test's own making.
+  TestLink(std::unique_ptr<Session> session, std::size_t input_capacity = 4096, Peer peer = {});
+  ~TestLink() override;
+  TestLink(const TestLink&) = delete;
+  TestLink& operator=(const TestLink&) = delete;
+
+  // The peer sends `bytes`, in pieces of `piece` bytes (0: all at once);
+  // the connection gets a turn after each piece.
+  void feed(std::string_view bytes, std::size_t piece = 0);
+  // The peer finishes sending (its end of data), or vanishes.
+  void finish();
+  void vanish();
+  // What the peer received so far: all of it, or what came since the last take.
+  const std::string& output() const { return to_peer_; }
+  std::string take();
+  // The peer reads at most this many more bytes (then the transport says
+  // "would block"); unlimited by default.
+  void peer_window(std::size_t bytes);
+  // Moves the clock; timers that come due fire.
+  void advance(std::chrono::milliseconds by);
+  // One more turn (after something outside changed the connection).
+  void turn();
+
+  Connection& connection() { return *connection_; }
+  bool closed() const { return connection_->closed(); }
+  std::optional<CloseReason> reason() const { return reason_; }
+
+  // ConnectionHost
+  void touch(Connection&) override { touched_ = true; }
+  void timer_changed(Connection&, std::int64_t due) override { due_ = due; }
+  void release(Connection& c) override;
+  std::int64_t now_ms() const override { return now_ms_; }
+
+ private:
+  struct Memory final : Transport {
+    explicit Memory(TestLink& l) : link(l) {}
+    TestLink& link;
+    Io read(char* to, std::size_t room, std::size_t& got) override;
+    Io write(std::span<const std::string_view> parts, std::size_t& put) override;
+  };
+  void begin(Peer peer);
+  void pump();
+  void settle();
+
+  std::unique_ptr<Connection> connection_;
+  std::string from_peer_, to_peer_;
+  std::size_t taken_ = 0;
+  std::size_t window_ = std::numeric_limits<std::size_t>::max();
+  bool eof_ = false, reset_ = false;
+  std::optional<CloseReason> reason_;
+  bool touched_ = false;
+  std::int64_t due_ = 0;
+  std::int64_t now_ms_ = 1'000'000;
+};
+
+}  // namespace velmor
