@@ -45,8 +45,6 @@ class ImapBuffer final : public ImapSink {
   // The output with its ranges read from `file`; nullopt when a range could
   // not be read whole.
   std::optional<std::string> flatten(ByteSource& file) const;
-  // The bytes the output will have.
-  std::uint64_t size() const { return size_; }
   bool empty() const { return pieces_.empty(); }
   void clear();
 
@@ -57,7 +55,6 @@ class ImapBuffer final : public ImapSink {
     bool is_range = false, unstuff = false;
   };
   std::vector<Piece> pieces_;
-  std::uint64_t size_ = 0;
 };
 
 // The plain text of `length` stored bytes from `offset` (which begins a

@@ -122,6 +122,16 @@ TEST(ImapRender, DotLinesAreUnstuffedAndCounted) {
     }
   }
   EXPECT_EQ(b.fetch("BODY.PEEK[]<1000.10>"), "* 7 FETCH (BODY[]<1000> {0}\r\n UID 1)\r\n");
+  // The text goes out as ranges of the file, unstuffed where they must be.
+  FetchRequest req;
+  ASSERT_EQ(imap_fetch_parse("BODY.PEEK[TEXT]", req), FetchParse::ok);
+  TextSource in(b.text);
+  FetchTarget target{b.last(), 0, 1, 0};
+  ImapBuffer first, second;
+  imap_fetch_render(req, target, in, {}, first);
+  first.replay(second);
+  EXPECT_EQ(second.flatten(in), first.flatten(in));
+  EXPECT_EQ(first.flatten(in), "* 1 FETCH (BODY[TEXT] {23}\r\n.hidden line\r\n.\r\nlast\r\n UID 1)\r\n");
 }
 
 TEST(ImapRender, OverviewKeepsTheTextCountsAndOldOnesAreCountedOnDemand) {
