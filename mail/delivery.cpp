@@ -18,6 +18,7 @@
 #include "core/strfmt.h"
 #include "core/util.h"
 #include "mail/delivery.h"
+#include "mail/imap_address.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
 #include "mail/queue.h"
@@ -721,33 +722,13 @@ int mailbox_append(const std::string& queue_file, std::string_view recipient, st
 
 namespace {
 
-// The address a receipt goes to: of the From value's words, the last that
-// holds an "@" (angle brackets and quotes removed); without one, the words
-// joined and completed with our domain.
+// The address a receipt goes to: of the From value's words, the last
+// address; without one, the words joined and completed with our domain.
 std::string receipt_address(std::string_view from) {
-  std::string last, words;
-  std::size_t i = 0;
-  while (i < from.size()) {
-    while (i < from.size() && (from[i] == ' ' || from[i] == '\t' || from[i] == ',')) ++i;
-    if (i >= from.size()) break;
-    std::string word;
-    if (from[i] == '"') {
-      std::size_t end = from.find('"', i + 1);
-      word = from.substr(i + 1, end == std::string_view::npos ? std::string_view::npos : end - i - 1);
-      i = end == std::string_view::npos ? from.size() : end + 1;
-    } else if (from[i] == '<') {
-      std::size_t end = from.find('>', i + 1);
-      word = from.substr(i + 1, end == std::string_view::npos ? std::string_view::npos : end - i - 1);
-      i = end == std::string_view::npos ? from.size() : end + 1;
-    } else if (from[i] == '(') {
-      std::size_t end = from.find(')', i + 1);
-      i = end == std::string_view::npos ? from.size() : end + 1;
-      continue;
-    } else {
-      std::size_t end = from.find_first_of(" \t,<(\"", i);
-      word = from.substr(i, end == std::string_view::npos ? std::string_view::npos : end - i);
-      i = end == std::string_view::npos ? from.size() : end;
-    }
+  std::string last, words, word;
+  std::size_t cursor = 0;
+  for (AddressToken t; (t = address_token_next(from, cursor, word)) != AddressToken::end;) {
+    if (t == AddressToken::comma) continue;
     if (word.find('@') != std::string::npos) {
       last = word;
     } else {

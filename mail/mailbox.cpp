@@ -321,6 +321,10 @@ void append_entry(std::string& out, const MessageRecord& m) {
     out += clean(*v);
     out += '\n';
   }
+  if (m.dots != kUncounted) {
+    strappendf(out, "#text %llu,%u,%llu\n", static_cast<unsigned long long>(m.dots), m.end_line,
+               static_cast<unsigned long long>(m.body_lines));
+  }
   for (const auto& p : m.parts) {
     strappendf(out, "#mime\n%u,%u,%u,%d,%d,%d\n", p.length, p.lines, p.body_offset, p.encoding, p.level, p.number);
     for (const std::string* v : {&p.content_type, &p.description, &p.content_id}) {
@@ -680,6 +684,9 @@ struct MessageParser::State {
   std::string boundary, header;
   bool in_header = true, after_terminator = false;
   std::uint64_t header_end = 0;
+  // The counts of the text a reader is given (MessageRecord::dots ...).
+  std::uint64_t dots = 0, body_lines = 0, last_length = 0;
+  bool last_in_body = false;
   std::unique_ptr<MimeScanner> mime;
 
   void examine(std::string_view h) {
@@ -758,6 +765,10 @@ struct MessageParser::State {
         return true;
       }
       after_terminator = is_terminator_line(line.text);
+      if (line.text.front() == '.') ++dots;
+      last_in_body = !in_header || after_terminator;  // a "." line ending the header is the body's
+      if (last_in_body) ++body_lines;
+      last_length = line.length;
       if (in_header) {
         if (is_empty_line(line.text) || after_terminator) {
           examine(header);
@@ -800,6 +811,13 @@ struct MessageParser::State {
     rec.total_length = end - offset;
     rec.length = rec.total_length - separator_length;
     rec.header_length = header_end - offset;
+    if (after_terminator) {  // the closing "." line is not part of the text
+      --dots;
+      if (last_in_body) --body_lines;
+      rec.end_line = static_cast<std::uint32_t>(last_length);
+    }
+    rec.dots = dots;
+    rec.body_lines = body_lines;
   }
 };
 
@@ -958,6 +976,16 @@ int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live_out)
       p.encoding = static_cast<int>(v[3]);
       p.level = static_cast<int>(v[4]);
       p.number = static_cast<int>(v[5]);
+    } else if (line.substr(0, 6) == "#text ") {
+      // dots, the closing line's length, body lines; they must fit the message
+      unsigned long long v[3];
+      if (!current || !numbers(line.substr(6), v, 3) || (v[1] != 0 && v[1] != 2 && v[1] != 3) ||
+          v[1] > current->length || v[0] > current->length - v[1] || v[2] > current->length) {
+        return 1;
+      }
+      current->dots = v[0];
+      current->end_line = static_cast<std::uint32_t>(v[1]);
+      current->body_lines = v[2];
     } else if (line == "#end") {
       if (!current) return 1;
       current = nullptr;

@@ -42,6 +42,8 @@ struct MimePart {
   int level = 1, number = 1;
 };
 
+inline constexpr std::uint64_t kUncounted = ~std::uint64_t{0};
+
 struct MessageRecord {
   std::string from, to, subject, reply_to;
   std::time_t internal_date = 0, sent_date = 0;
@@ -52,6 +54,16 @@ struct MessageRecord {
   std::uint64_t header_length = 0;  // offset of the body from the message start
   std::list<MimePart> parts;
   bool flags_pending = false;       // changed since the overview last recorded its flags
+  // The text a reader is given is the stored one behind the separator line,
+  // without the "." line that ends it and with the dots of transmission
+  // form taken out: `dots` lines carry such a dot (header lines too),
+  // `end_line` is the length of the closing "." line (0 when there is none)
+  // and `body_lines` counts the body's lines without it. Counted while
+  // parsing; kUncounted in a record from an overview written before they
+  // were kept (a reader counts them when it needs them).
+  std::uint64_t dots = kUncounted;
+  std::uint64_t body_lines = 0;
+  std::uint32_t end_line = 0;
 };
 // "Message start" is the start of its separator line throughout: a message
 // without one (a damaged file's first message) has total_length == length.
@@ -240,7 +252,9 @@ std::string mailbox_box_for_address(std::string_view address);
 // "#uidnext" and "#length" again; "#flags <uid> <flags>" for a message's
 // new flags, "#expunge <uid>" for a removed message. A reader that knows
 // only the message blocks skips those lines (and, after a removal, finds
-// the lengths do not add up and parses the mailbox instead).
+// the lengths do not add up and parses the mailbox instead). Inside a
+// message block, "#text <dots>,<end_line>,<body_lines>" follows the four
+// header values; a reader that does not know the line skips it too.
 std::string mailbox_overview_text(const Mailbox& box);
 // 0, or 1 for a text that is cut off or does not add up. Identifiers must
 // rise from one message block to the next.
