@@ -85,6 +85,24 @@ struct Config {
   std::int32_t nntp_sock_max = 20;  // nntp.sock.max
   std::int32_t proxy_icp_sock_port = 3130;  // proxy.icp.sock.port
   std::int32_t proxy_external_sock_port = 8080;  // proxy.external.sock.port
+  // The TLS listeners: off unless the master file switches them on (the one
+  // --init writes does).
+  bool smtps_sock_enabled = false;  // smtps.sock.enabled
+  std::int32_t smtps_sock_port = 465;  // smtps.sock.port
+  std::int32_t smtps_sock_timeout = 120;  // smtps.sock.timeout
+  std::int32_t smtps_sock_max = 20;  // smtps.sock.max
+  bool submission_sock_enabled = false;  // submission.sock.enabled
+  std::int32_t submission_sock_port = 587;  // submission.sock.port
+  std::int32_t submission_sock_timeout = 120;  // submission.sock.timeout
+  std::int32_t submission_sock_max = 20;  // submission.sock.max
+  bool pops_sock_enabled = false;  // pops.sock.enabled
+  std::int32_t pops_sock_port = 995;  // pops.sock.port
+  std::int32_t pops_sock_timeout = 120;  // pops.sock.timeout
+  std::int32_t pops_sock_max = 20;  // pops.sock.max
+  bool imaps_sock_enabled = false;  // imaps.sock.enabled
+  std::int32_t imaps_sock_port = 993;  // imaps.sock.port
+  std::int32_t imaps_sock_timeout = 120;  // imaps.sock.timeout
+  std::int32_t imaps_sock_max = 20;  // imaps.sock.max
   AddressList smtp_allow;  // smtp.allow
   AddressList smtp_auth;  // smtp.auth
   AddressList smtp_block;  // smtp.block
@@ -258,6 +276,9 @@ struct Config {
   ConfigText admin_email;  // admin.email
   ConfigText server_name;  // server.name
   ConfigText server_user;  // server.user: started as root, run as this user once bound
+  ConfigText tls_cert;  // tls.cert: the server's certificate and its chain (PEM)
+  ConfigText tls_key;  // tls.key: its private key (PEM)
+  bool tls_plain_login = true;  // tls.plain.login: passwords in the clear from outside the local networks
   std::int32_t sock_buffer = 0;  // sock.buffer
   std::int32_t sock_session_max = 3600;  // sock.session.max: seconds a connection may last (0 = no limit)
   std::int32_t cache_big = 0;  // cache.big (kilobytes in the file)

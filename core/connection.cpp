@@ -16,6 +16,7 @@
 #include "core/globals.h"
 #include "core/log.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 
 namespace velmor {
 
@@ -39,6 +40,7 @@ const char* close_reason_text(CloseReason reason) {
     case CloseReason::lookup_failed: return "lookup failed";
     case CloseReason::shutdown: return "shutdown";
     case CloseReason::failed: return "failed";
+    case CloseReason::tls_failed: return "TLS failed";
   }
   return "?";
 }
@@ -88,6 +90,15 @@ Transport::Io PlainTransport::write(std::span<const std::string_view> parts, std
   return Io::failed;
 }
 
+bool PlainTransport::can_upgrade(const TlsPlan& plan) const {
+  return fd_ && (plan.role == TlsRole::client || tls_available());
+}
+
+std::unique_ptr<Transport> PlainTransport::upgrade(const TlsPlan& plan) {
+  if (!can_upgrade(plan)) return nullptr;
+  return tls_transport(std::move(fd_), plan);
+}
+
 // ---- Connection: the session's side ----------------------------------------------
 
 Connection::Connection(ConnectionHost& host, std::uint64_t id, int service, std::size_t capacity)
@@ -99,7 +110,64 @@ Connection::~Connection() = default;
 
 bool Connection::secure() const { return transport_ && transport_->secure(); }
 
-bool Connection::gate_open() const { return !closed_ && !close_pending_ && phase_ == Phase::open && !paused_ && !was_full_; }
+bool Connection::gate_open() const {
+  return !closed_ && !close_pending_ && phase_ == Phase::open && !paused_ && !was_full_ && tls_step_ == TlsStep::none;
+}
+
+Connection::TlsStart Connection::start_tls() { return begin_tls(TlsPlan{}); }
+
+Connection::TlsStart Connection::start_tls_client(std::string host, TlsVerify verify) {
+  return begin_tls(TlsPlan{TlsRole::client, std::move(host), verify});
+}
+
+Connection::TlsStart Connection::begin_tls(TlsPlan plan) {
+  if (closed_ || close_pending_ || phase_ != Phase::open || !transport_) return TlsStart::unavailable;
+  if (tls_step_ != TlsStep::none || transport_->secure()) return TlsStart::already;
+  if (!transport_->can_upgrade(plan)) return TlsStart::unavailable;
+  // Whatever the peer sent behind the command was sent before it could know
+  // the answer: it is no part of the encrypted dialogue.
+  drop_input(in_end_ - in_start_);
+  skipping_ = lf_pending_ = false;
+  tls_plan_ = std::make_unique<TlsPlan>(std::move(plan));
+  tls_step_ = TlsStep::queued;
+  out_.emplace_back().upgrade = true;
+  if (!in_callback_) host_.touch(*this);
+  return TlsStart::started;
+}
+
+// The upgrade point reached the front of the output queue: what came
+// before it is sent. Anything read meanwhile is dropped again.
+bool Connection::upgrade_transport() {
+  out_.pop_front();
+  drop_input(in_end_ - in_start_);
+  std::unique_ptr<Transport> next = transport_->upgrade(*tls_plan_);
+  tls_plan_.reset();
+  if (!next) {
+    log_write(strprintf("Service %d: TLS could not start for %s", service_, peer_.text.c_str()), logchan::errors);
+    close_now(CloseReason::tls_failed);
+    return false;
+  }
+  transport_ = std::move(next);
+  tls_step_ = TlsStep::handshaking;
+  advance();
+  return !close_pending_ && !closed_;
+}
+
+// Drives the transport's own work (a handshake). A failure closes the
+// connection; a finished handshake lets the session have its input.
+void Connection::advance() {
+  if (!transport_ || closed_ || close_pending_) return;
+  Transport::Io io = transport_->advance();
+  if (io == Transport::Io::failed || io == Transport::Io::closed) {
+    tls_note_failure(peer_.text, service_, transport_->failure());
+    close_now(CloseReason::tls_failed);
+    return;
+  }
+  if (io == Transport::Io::ok && tls_step_ == TlsStep::handshaking) {
+    tls_step_ = TlsStep::none;
+    dirty_ = true;
+  }
+}
 
 void Connection::drop_input(std::size_t n) {
   in_start_ += std::min(n, in_end_ - in_start_);
@@ -359,10 +427,15 @@ bool Connection::fill_stage(OutItem& item) {
 void Connection::flush() {
   if (close_pending_) return;  // closing at once: what is queued is dropped
   while (!out_.empty() && !closed_ && transport_) {
+    if (out_.front().upgrade) {
+      if (!upgrade_transport()) return;
+      continue;
+    }
     std::string_view parts[16];
     std::size_t count = 0, total = 0;
     for (auto it = out_.begin(); it != out_.end() && count < 16 && total < 4 * kStage; ++it) {
       OutItem& item = *it;
+      if (item.upgrade) break;  // sent in the clear up to here
       if (!item.is_file) {
         parts[count++] = std::string_view(item.bytes).substr(item.done);
         total += item.bytes.size() - item.done;
@@ -396,6 +469,7 @@ void Connection::flush() {
     }
     for (std::size_t left = put; !out_.empty();) {
       OutItem& item = out_.front();
+      if (item.upgrade) break;
       const std::size_t size = item.is_file ? item.stage.size() : item.bytes.size();
       std::size_t take = std::min(left, size - item.done);
       item.done += take;
@@ -414,6 +488,7 @@ void Connection::flush() {
 
 void Connection::read_some() {
   if (closed_ || close_pending_ || !transport_) return;
+  if (tls_step_ == TlsStep::queued) return;  // read under TLS, once it has started
   if (!in_) in_ = std::make_unique<char[]>(capacity_);
   for (int i = 0; i < kReadsPerTurn; ++i) {
     if (in_start_ > 0) {  // keep the unread bytes at the front
@@ -488,8 +563,9 @@ void ConnectionCore::open(Connection& c) {
 void ConnectionCore::serve(Connection& c, bool readable) {
   if (c.closed_) return;
   ++c.in_callback_;
+  c.advance();
   c.flush();
-  if (readable) c.read_some();
+  if (readable || (c.transport_ && c.transport_->read_ready())) c.read_some();
   c.dirty_ = c.dirty_ || (c.peer_eof_ && c.phase_ == Phase::open);
   c.deliver();
   c.flush();
@@ -500,8 +576,12 @@ void ConnectionCore::serve(Connection& c, bool readable) {
     return;
   }
   // Input still waiting after this turn's rounds: another turn soon (the
-  // buffer may be full, so no readiness would bring one).
+  // buffer may be full, so no readiness would bring one). The same for
+  // bytes a transport holds decrypted: the descriptor will not say so.
   if (c.dirty_ && c.gate_open()) c.host_.touch(c);
+  else if (c.transport_ && c.transport_->read_ready() && c.transport_->needs() == Transport::Need::none &&
+           wants_read(c))
+    c.host_.touch(c);
 }
 
 void ConnectionCore::fire_timer(Connection& c) {
@@ -513,7 +593,9 @@ void ConnectionCore::fire_timer(Connection& c) {
 
 bool ConnectionCore::wants_read(const Connection& c) {
   if (c.closed_ || !c.transport_) return false;
-  if (c.transport_->wants_read()) return true;
+  const Transport::Need need = c.transport_->needs();
+  if (need == Transport::Need::read) return true;
+  if (need == Transport::Need::write || c.tls_step_ == Connection::TlsStep::queued) return false;
   if (c.phase_ == Phase::closing) return !c.peer_eof_;  // drained, so a close is not a reset
   if (c.phase_ != Phase::open || c.peer_eof_ || c.in_end_ - c.in_start_ >= c.capacity_) return false;
   return !(c.partner_ && c.partner_->was_full_);
@@ -522,7 +604,12 @@ bool ConnectionCore::wants_read(const Connection& c) {
 bool ConnectionCore::wants_write(const Connection& c) {
   if (c.closed_ || !c.transport_) return false;
   if (c.phase_ == Phase::connecting) return true;
-  return !c.out_.empty() || c.transport_->wants_write();
+  switch (c.transport_->needs()) {
+    case Transport::Need::write: return true;
+    case Transport::Need::read: return false;  // nothing moves until the peer's bytes come
+    case Transport::Need::none: break;
+  }
+  return !c.out_.empty();
 }
 
 }  // namespace velmor

@@ -62,6 +62,8 @@ enum class CloseReason {
   lookup_failed,   // an outward connection's host has no address
   shutdown,        // the suite is stopping
   failed,          // a session callback threw, or the core could not go on
+  tls_failed,      // the TLS handshake failed (garbage, no common ground, an
+                   // unverified peer), or TLS is off where it was required
 };
 const char* close_reason_text(CloseReason reason);
 
@@ -85,22 +87,52 @@ struct Peer {
 // Dotted text of a network-order address.
 std::string dotted(std::uint32_t address_nbo);
 
-// How bytes leave and arrive: a plain socket today; a TLS transport (which
-// reads and writes records, and may need to read before it can write during
-// a handshake) slots in later without any session changing.
+// Who speaks first in a TLS handshake, and how a client checks the server.
+enum class TlsRole { server, client };
+enum class TlsVerify {
+  none,  // encrypt without asking who answers (opportunistic STARTTLS)
+  peer,  // the certificate must chain to the system's trusted roots and name the host
+};
+// What a connection upgraded to TLS (Connection::start_tls).
+struct TlsPlan {
+  TlsRole role = TlsRole::server;
+  std::string host{};  // client: the server's name (SNI, and checked with TlsVerify::peer)
+  TlsVerify verify = TlsVerify::none;
+};
+
+// How bytes leave and arrive: a plain socket, or TLS over it (core/tls.h).
+// A transport that must exchange bytes of its own before data can move (a
+// handshake, or a record cut off mid-way) says so through needs(), and the
+// core drives it with advance() at every turn; sessions never see any of it.
 class Transport {
  public:
   enum class Io { ok, would_block, closed, failed };
+  // What the transport waits for before its data can move.
+  enum class Need { none, read, write };
   virtual ~Transport() = default;
   // Reads up to `room` bytes. ok with `got` > 0; closed at the peer's end of
   // data; failed when the connection broke.
   virtual Io read(char* to, std::size_t room, std::size_t& got) = 0;
-  // Writes from the parts in order; `put` is how many bytes went.
+  // Writes from the parts in order; `put` is how many bytes went. After
+  // would_block the next call starts with the same bytes (maybe more of them,
+  // maybe at another address), as a TLS record cut off mid-way needs.
   virtual Io write(std::span<const std::string_view> parts, std::size_t& put) = 0;
+  // Encrypted, with the handshake done.
   virtual bool secure() const { return false; }
-  // A handshake needs readiness the session did not ask for.
-  virtual bool wants_read() const { return false; }
-  virtual bool wants_write() const { return false; }
+  // One step of the transport's own work: ok = data may flow; would_block =
+  // waiting for needs(); failed = it cannot go on (the connection closes).
+  virtual Io advance() { return Io::ok; }
+  virtual Need needs() const { return Need::none; }
+  // Bytes may be read without the descriptor becoming readable (decrypted
+  // bytes held inside the transport).
+  virtual bool read_ready() const { return false; }
+  // Why the last failure happened, for the log ("" = not known).
+  virtual std::string failure() const { return {}; }
+  // Whether upgrade() can work now (TLS is on, for the server role).
+  virtual bool can_upgrade(const TlsPlan&) const { return false; }
+  // The same connection under TLS; this transport hands its descriptor over
+  // and is dropped. nullptr when it cannot.
+  virtual std::unique_ptr<Transport> upgrade(const TlsPlan&) { return nullptr; }
 };
 
 // The plain transport over a connected, non-blocking socket (owned).
@@ -109,6 +141,8 @@ class PlainTransport final : public Transport {
   explicit PlainTransport(UniqueFd fd) : fd_(std::move(fd)) {}
   Io read(char* to, std::size_t room, std::size_t& got) override;
   Io write(std::span<const std::string_view> parts, std::size_t& put) override;
+  bool can_upgrade(const TlsPlan& plan) const override;
+  std::unique_ptr<Transport> upgrade(const TlsPlan& plan) override;
   int fd() const { return fd_.get(); }
 
  private:
@@ -167,8 +201,29 @@ class Connection {
   int service() const { return service_; }
   Phase phase() const { return phase_; }
   const Peer& peer() const { return peer_; }
+  // Encrypted, with the handshake done.
   bool secure() const;
   bool closed() const { return closed_; }
+
+  // ---- TLS in place (STARTTLS, STLS) -----------------------------------------
+  enum class TlsStart {
+    started,      // the upgrade is under way
+    unavailable,  // TLS is off (no certificate loaded): answer as for no TLS
+    already,      // secure already, or an upgrade is under way
+  };
+  // Upgrades this connection to TLS as the server: what the session queued
+  // before the call (its "ready" reply) is sent in the clear, then the
+  // handshake runs, then everything queued after the call goes encrypted.
+  // Input the peer sent before the handshake (bytes behind the command in
+  // the same packet, anything sent while the reply went out) is discarded,
+  // never read as a command of the encrypted session; the session is offered
+  // no input until the handshake has finished, and should forget what the
+  // clear-text part of the dialogue told it. A failed handshake closes the
+  // connection with CloseReason::tls_failed.
+  TlsStart start_tls();
+  // The same as the client of `plan.host` (after the server's "ready" reply
+  // was read; a reply's unread rest is discarded the same way).
+  TlsStart start_tls_client(std::string host, TlsVerify verify);
 
   // ---- input ---------------------------------------------------------------
   // The next line, without its line end; the view stays valid until the
@@ -253,12 +308,16 @@ class Connection {
     std::string bytes;      // a byte chunk (consecutive sends join one chunk) ...
     FileRange file;         // ... or a file range
     bool is_file = false;
+    bool upgrade = false;   // ... or the point where TLS starts (tls_plan_)
     std::size_t done = 0;   // of `bytes`, or of `stage`
     std::string stage;      // the file's next bytes, transformed
     bool line_start = true; // the transform's position
   };
 
   bool gate_open() const;
+  TlsStart begin_tls(TlsPlan plan);
+  bool upgrade_transport();
+  void advance();
   std::string_view data() const { return {in_.get() + in_start_, in_end_ - in_start_}; }
   void drop_input(std::size_t n);
   void swallow_lf();
@@ -296,6 +355,12 @@ class Connection {
   bool dirty_ = false;       // something changed since on_input last ran
   bool gated_ = false;       // on_input stopped because input was held back
   bool paced_by_lines_ = true;
+
+  // TLS in place: queued = the upgrade waits in the output queue (nothing is
+  // read meanwhile); handshaking = the new transport works on it.
+  enum class TlsStep { none, queued, handshaking };
+  TlsStep tls_step_ = TlsStep::none;
+  std::unique_ptr<TlsPlan> tls_plan_;
 
   // Output.
   std::deque<OutItem> out_;

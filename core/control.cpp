@@ -20,6 +20,7 @@
 #include "core/log.h"
 #include "core/network.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 #include "core/util.h"
 
 namespace velmor {
@@ -202,7 +203,7 @@ void control_command(std::string_view text, const std::function<void(std::string
     return;
   }
   if (str_iequals(text, "reload config")) {
-    config_load();
+    if (config_load() == 0) tls_load();  // a renewed certificate, for new connections
   } else if (str_iequals(text, "reload users")) {
     if (hooks.reload_users) hooks.reload_users();
   } else if (str_iequals(text, "reload groups")) {

@@ -34,6 +34,7 @@
 #include "core/log.h"
 #include "core/privileges.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 
 namespace velmor {
 
@@ -271,8 +272,18 @@ void Network::accept_batch(Connection& listener) {
       ::close(fd);
       continue;
     }
+    std::unique_ptr<Transport> transport;
+    if (desc->implicit_tls) {
+      transport = tls_transport(UniqueFd(fd), TlsPlan{});
+      if (!transport) {  // no certificate: nothing to speak here
+        tls_note_failure(who.text, number, "TLS is off (no certificate loaded)");
+        continue;  // the descriptor closed with the failed attempt
+      }
+    } else {
+      transport = std::make_unique<PlainTransport>(UniqueFd(fd));
+    }
     auto made = ConnectionCore::make(*this, ++last_id, number, static_cast<std::size_t>(socket_buffer_size()));
-    ConnectionCore::set_transport(*made, std::make_unique<PlainTransport>(UniqueFd(fd)), fd);
+    ConnectionCore::set_transport(*made, std::move(transport), fd);
     ConnectionCore::set_peer(*made, who);
     Connection& c = add(std::move(made), fd, true);
     Entry& e = entries[c.id()];

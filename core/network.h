@@ -26,10 +26,14 @@ namespace velmor {
 // Service numbers (status displays and logs know services by them).
 namespace svc {
 inline constexpr int imap = 10;
+inline constexpr int imaps = 11;       // IMAP with TLS from the first byte
 inline constexpr int smtp = 20;
 inline constexpr int smtp_client = 21;
+inline constexpr int smtps = 22;       // SMTP submission with TLS from the first byte
+inline constexpr int submission = 23;  // SMTP submission, STARTTLS before AUTH
 inline constexpr int pop = 30;
 inline constexpr int pop_client = 31;
+inline constexpr int pops = 32;        // POP3 with TLS from the first byte
 inline constexpr int nntp = 40;
 inline constexpr int news_client = 41;
 inline constexpr int web = 50;
@@ -85,6 +89,12 @@ struct ServiceDescriptor {
   // The idle clock restarts at a complete line (command protocols), or at
   // any byte received (relays).
   bool paced_by_lines = true;
+  // TLS from the first byte: the handshake runs before the session hears
+  // anything; with no certificate loaded, what is accepted is closed at once.
+  bool implicit_tls = false;
+  // Another listener of the plain service of this number (its sessions and
+  // accept rule): a session tells submission from SMTP by its service number.
+  int plain = 0;
 };
 // Adds (or replaces) a service. Its listener opens at net_start.
 void service_register(ServiceDescriptor service);

@@ -18,11 +18,13 @@
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/network.h"
+#include "core/tls.h"
 
 namespace velmor {
 
 inline void reset_process_state() {
   net_reset();
+  tls_reset();
   config_reset();
   paths = SuitePaths{};
   hooks = SuiteHooks{};

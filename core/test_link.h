@@ -8,6 +8,11 @@
 //   link.advance(std::chrono::seconds(1));  // timers fire
 //   EXPECT_EQ(link.reason(), CloseReason::requested);
 //
+// Connection::start_tls works here too, without any cryptography: once the
+// bytes queued before it are out, the connection counts as secure() and the
+// dialogue goes on in the clear, so a session's STARTTLS can be tested for
+// what it answers, what it forgets and what pipelined input it drops.
+//
 // After every piece of input the after-pass hooks run (as at the end of a
 // pass of the loop), so work they carry (the mail queue's group commit)
 // happens as in the suite.
@@ -67,10 +72,14 @@ class TestLink final : public ConnectionHost {
 
  private:
   struct Memory final : Transport {
-    explicit Memory(TestLink& l) : link(l) {}
+    explicit Memory(TestLink& l, bool tls = false) : link(l), tls(tls) {}
     TestLink& link;
+    bool tls;
     Io read(char* to, std::size_t room, std::size_t& got) override;
     Io write(std::span<const std::string_view> parts, std::size_t& put) override;
+    bool secure() const override { return tls; }
+    bool can_upgrade(const TlsPlan&) const override { return !tls; }
+    std::unique_ptr<Transport> upgrade(const TlsPlan&) override { return std::make_unique<Memory>(link, true); }
   };
   void begin(Peer peer);
   void pump();

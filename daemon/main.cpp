@@ -5,6 +5,7 @@
 // them down in order. Each subsystem wires itself in at the marked places.
 #include <arpa/inet.h>
 #include <fcntl.h>
+#include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -34,6 +35,7 @@
 #include "core/scheduler.h"
 #include "core/network.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
@@ -60,9 +62,12 @@ constexpr const char* kUsage =
     "  --control PATH    the control socket (default DIR/run/control)\n"
     "  --bind ADDR       listen on this IPv4 address only (default: every address)\n"
     "  --init            write the default installation into the root folder and exit;\n"
-    "                    files that exist are left alone. Services listen on unprivileged\n"
-    "                    ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119, web 8000)\n"
-    "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80\n"
+    "                    files that exist are left alone, and a self-signed TLS certificate\n"
+    "                    for this host is made when there is none. Services listen on\n"
+    "                    unprivileged ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119,\n"
+    "                    web 8000; over TLS: SMTP 1465, submission 1587, POP3 1995, IMAP 1993)\n"
+    "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80; SMTP 465,\n"
+    "                    submission 587, POP3 995, IMAP 993\n"
     "  --user NAME       with --init: server.user, the user the suite runs as once its\n"
     "                    listeners are bound when started as root\n"
     "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
@@ -165,6 +170,35 @@ void replace_all(std::string& text, std::string_view from, std::string_view to) 
     text.replace(at, from.size(), to);
 }
 
+// A self-signed certificate for this host where the master file's tls.cert
+// and tls.key name files that do not exist yet; handed to --user when
+// running as root, so the suite can read its key once it runs as that user.
+int make_certificate(const Options& options) {
+  if (config_load_file(paths.master()) != 0) return 0;  // said so already
+  auto where = [](const ConfigText& key) {
+    const std::string& path = text_of(key);
+    return path.empty() || path[0] == '/' ? path : path_join(paths.root, path);
+  };
+  const std::string cert = where(config.tls_cert), key = where(config.tls_key);
+  if (cert.empty() || key.empty() || file_size(cert) >= 0 || file_size(key) >= 0) return 0;
+  int uid = -1, gid = -1;
+  if (!options.user.empty() && geteuid() == 0) {
+    if (const passwd* pw = getpwnam(options.user.c_str())) {
+      uid = static_cast<int>(pw->pw_uid);
+      gid = static_cast<int>(pw->pw_gid);
+    } else {
+      std::printf("No user %s yet: the TLS key stays root's; hand it over before starting\n", options.user.c_str());
+    }
+  }
+  ::mkdir(std::string(path_dir(key)).c_str(), 0750);
+  if (std::string error = tls_make_self_signed(cert, key, host_name(), uid, gid); !error.empty()) {
+    std::printf("Cannot make the TLS certificate: %s\n", error.c_str());
+    return 1;
+  }
+  std::printf("Made a self-signed TLS certificate for %s: %s\n", host_name().c_str(), cert.c_str());
+  return 0;
+}
+
 // Writes every embedded default file that does not exist yet, with the host
 // name and the ports filled in, and makes the folders the suite uses.
 int init_installation(const Options& options) {
@@ -176,6 +210,10 @@ int init_installation(const Options& options) {
       {"@IMAP_PORT@", standard ? "143" : "1143"},
       {"@NNTP_PORT@", standard ? "119" : "1119"},
       {"@WEB_PORT@", standard ? "80" : "8000"},
+      {"@SMTPS_PORT@", standard ? "465" : "1465"},
+      {"@SUBMISSION_PORT@", standard ? "587" : "1587"},
+      {"@POPS_PORT@", standard ? "995" : "1995"},
+      {"@IMAPS_PORT@", standard ? "993" : "1993"},
       {"@SERVER_USER@", options.user},
   };
   make_path(paths.root);
@@ -209,6 +247,7 @@ int init_installation(const Options& options) {
     // The master file starts as a copy of its template.
     if (f.path == "config/templates/master" && install("config/master", f.data)) return 1;
   }
+  if (make_certificate(options) != 0) return 1;
   // Later subsystems add their own first-run steps here (sample users, ...).
   if (users_make_demo() != 0) return 1;
   std::printf("Velmor installation in %s: %d files written, %d left as they were\n", paths.root.c_str(), written,
@@ -460,9 +499,12 @@ int start_and_run() {
   log_message("Initialising mail system");
   mail_init();
   complete_admin_email();
-  // The services, in the order their listeners open.
+  // The services, in the order their listeners open; the TLS listeners
+  // follow the plain services whose sessions they share.
   pop_register();
   smtp_register();
+  tls_register_services();
+  tls_load();  // "TLS certificate loaded: ..." or why TLS is off
   log_message("Starting listening sockets");
   // Without its control channel the suite could not be steered, and a
   // squatter on the path would get what local tools send: no start.
