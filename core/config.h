@@ -286,6 +286,8 @@ struct ConfigKeyInfo {
   int multiplier;  // 1, or 1024 for the two keys given in kilobytes
 };
 const std::vector<ConfigKeyInfo>& config_keys();
+// What reads a key (a line of the manual page); "" for a key without an entry.
+std::string_view config_key_reader(std::string_view key);
 
 // Reads the master file (paths.master()) and applies every key in it. Keys
 // missing from the file keep their current value. 0 = loaded; 1 = the file

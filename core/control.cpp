@@ -221,6 +221,9 @@ void control_command(std::string_view text, const std::function<void(std::string
     list_queue(hooks.list_news_queue, "end nq\n", reply);
   } else if (str_iequals(text, "status")) {
     reply(status_text());
+  } else if (str_iequals(text, "incoming")) {
+    auto [waiting, retry] = hooks.incoming_mail_count ? hooks.incoming_mail_count() : std::pair<std::size_t, std::size_t>{};
+    reply(strprintf("iq:%zu\nretry:%zu\n", waiting, retry));
   } else if (str_iequals(text, "test")) {
     reply(strprintf("test:%ld\n", static_cast<long>(server_now)));
   } else {

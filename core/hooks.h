@@ -9,6 +9,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 
 namespace velmor {
 
@@ -42,6 +43,9 @@ struct SuiteHooks {
   std::function<void(const std::function<void(std::string_view)>& send)> list_mail_queue;
   std::function<void(const std::function<void(std::string_view)>& send)> list_news_queue;
   std::function<std::size_t()> outgoing_mail_count;
+  // Messages of the incoming queue not yet delivered, and how many of them
+  // wait for a later try after a temporary failure.
+  std::function<std::pair<std::size_t, std::size_t>()> incoming_mail_count;
   // "lookup NAME": resolves an address and calls `done` once, when the
   // lookup ends, with the dotted address or an empty text when it failed.
   std::function<void(std::string_view name, std::function<void(std::string_view address)> done)> lookup;

@@ -395,6 +395,12 @@ void service_register(ServiceDescriptor service) {
 
 const ServiceDescriptor* service_find(int number) { return net().service(number); }
 
+std::vector<const ServiceDescriptor*> service_list() {
+  std::vector<const ServiceDescriptor*> out;
+  for (const auto& s : net().services) out.push_back(&s);
+  return out;
+}
+
 Admission service_admit(const ServiceDescriptor& service, std::uint32_t peer_nbo) {
   progress_code = 140500;
   if (service.allow && address_list_match(*service.allow, peer_nbo)) return Admission::accepted;
@@ -432,15 +438,20 @@ void start_accepted(Connection& c, const ServiceDescriptor& service) {
 
 // ---- start-up and shutdown -----------------------------------------------------------
 
-int net_listen(int service, int port) {
+int net_listen(int service, int port, std::string* error) {
   auto& n = net();
-  if (!n.ensure_epoll()) return -1;
+  auto why = [&](std::string text) {
+    if (error) *error = std::move(text);
+    return -1;
+  };
+  if (!n.ensure_epoll()) return why("no event poll");
   int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (fd < 0) {
-    std::string msg = strprintf("TCP Socket create for port:%d failed: %s", port, sys_error().c_str());
+    std::string reason = sys_error();
+    std::string msg = strprintf("TCP Socket create for port:%d failed: %s", port, reason.c_str());
     serious(msg);
     log_message(msg);
-    return -1;
+    return why(reason);
   }
   int one = 1;
   setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
@@ -448,21 +459,27 @@ int net_listen(int service, int port) {
   a.sin_family = AF_INET;
   a.sin_port = htons(static_cast<std::uint16_t>(port));
   a.sin_addr.s_addr = htonl(INADDR_ANY);
-  auto fail = [&](const std::string& msg) {
+  auto fail = [&](const std::string& msg, std::string reason) {
     serious(msg, kLogUnbuffered);
     log_message(msg);
     ::close(fd);
-    return -1;
+    return why(std::move(reason));
   };
   if (!paths.bind_address.empty() && inet_pton(AF_INET, paths.bind_address.c_str(), &a.sin_addr) != 1)
-    return fail("Bind address not understood: " + paths.bind_address);
+    return fail("Bind address not understood: " + paths.bind_address, "the address is not understood");
   int bound;
   {
     BindingPrivileges root;  // the only step that may need root
     bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
   }
-  if (bound != 0) return fail(strprintf("Bind Failed - is another server running on this port: %d", port));
-  if (::listen(fd, 128) != 0) return fail(strprintf("Listen failed on port %d: %s", port, sys_error().c_str()));
+  if (bound != 0) {
+    std::string reason = sys_error();
+    return fail(strprintf("Bind Failed - is another server running on this port: %d", port), reason);
+  }
+  if (::listen(fd, 128) != 0) {
+    std::string reason = sys_error();
+    return fail(strprintf("Listen failed on port %d: %s", port, reason.c_str()), reason);
+  }
   socklen_t len = sizeof a;
   getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len);
   auto made = ConnectionCore::make(n, ++n.last_id, service, 0);
@@ -473,7 +490,7 @@ int net_listen(int service, int port) {
   return ntohs(a.sin_port);
 }
 
-int net_start() {
+int net_start(std::vector<ListenReport>* report) {
   auto& n = net();
   if (!n.ensure_epoll()) return 1;
   // Serving many clients needs many descriptors: take what the system allows.
@@ -482,12 +499,25 @@ int net_start() {
     lim.rlim_cur = lim.rlim_max == RLIM_INFINITY ? 65536 : lim.rlim_max;
     setrlimit(RLIMIT_NOFILE, &lim);
   }
-  std::vector<std::pair<int, int>> wanted;  // copied: opening touches nothing of the list
-  for (const auto& s : n.services)
-    if (s.port && (!s.enabled || *s.enabled)) wanted.emplace_back(s.number, *s.port);
-  for (auto [number, port] : wanted)
-    if (net_listen(number, port) < 0) return 1;
-  return 0;
+  std::vector<ListenReport> wanted;  // copied: opening touches nothing of the list
+  std::vector<int> numbers;
+  for (const auto& s : n.services) {
+    if (!s.port) continue;
+    wanted.push_back({.service = s.name,
+                      .address = paths.bind_address.empty() ? "0.0.0.0" : paths.bind_address,
+                      .port = *s.port,
+                      .enabled = !s.enabled || *s.enabled});
+    numbers.push_back(s.number);
+  }
+  int rc = 0;
+  for (std::size_t i = 0; i < wanted.size(); ++i) {
+    if (wanted[i].enabled && net_listen(numbers[i], wanted[i].port, &wanted[i].error) < 0) {
+      if (wanted[i].error.empty()) wanted[i].error = "failed";
+      rc = 1;
+    }
+  }
+  if (report) *report = std::move(wanted);
+  return rc;
 }
 
 void net_close_all() {

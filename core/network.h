@@ -17,6 +17,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core/config.h"
 #include "core/connection.h"
@@ -89,17 +90,30 @@ struct ServiceDescriptor {
 // Adds (or replaces) a service. Its listener opens at net_start.
 void service_register(ServiceDescriptor service);
 const ServiceDescriptor* service_find(int number);
+// Every registered service, in the order of registration.
+std::vector<const ServiceDescriptor*> service_list();
 Admission service_admit(const ServiceDescriptor& service, std::uint32_t peer_nbo);
 
 // ---- start-up and shutdown ----------------------------------------------------
 
+// What net_start did with one registered service that has a port key.
+struct ListenReport {
+  std::string service;  // its name
+  std::string address;  // the address listened on ("0.0.0.0": every address)
+  int port = 0;         // the port asked for
+  bool enabled = true;  // false: switched off in the configuration, nothing opened
+  std::string error;    // why the port could not be taken ("" = listening)
+};
 // Opens a listener for every registered, enabled service with a port key,
-// in the order they were registered. 0 = done; 1 = a listener failed (logged).
-int net_start();
+// in the order they were registered; a port that cannot be taken does not
+// stop the others from being tried, so every failure is named. 0 = every
+// listener is open; 1 = at least one failed (logged). `report`, when given,
+// gets one entry per service with a port key.
+int net_start(std::vector<ListenReport>* report = nullptr);
 // Opens a listener of `service` on `port` of paths.bind_address (every
 // address when empty); port 0 takes an ephemeral one. The port bound; -1
-// when it failed (logged).
-int net_listen(int service, int port);
+// when it failed (logged, and the reason put in `error` when given).
+int net_listen(int service, int port, std::string* error = nullptr);
 // Closes every connection (their sessions hear CloseReason::shutdown),
 // listener and watched descriptor.
 void net_close_all();

@@ -41,6 +41,7 @@ using Clock = std::chrono::steady_clock;
 
 std::time_t g_last_traffic = 0;
 std::time_t g_retry_at = 0;  // rescan for files left after a temporary failure
+std::set<std::string> g_waiting_retry;  // those files, until the rescan lists them again
 bool g_debatch_pending = false;
 
 // A message that has passed this many relays is looping.
@@ -189,6 +190,8 @@ class Debatch final : public AliasSink {
       return false;
     }
     ++copies;
+    mail_log(strprintf("Archived: %s appended to %.*s (%llu bytes)", path_.c_str(), static_cast<int>(target.size()),
+                       target.data(), static_cast<unsigned long long>(filecache_length(file_))));
     return true;
   }
 
@@ -248,7 +251,9 @@ class Debatch final : public AliasSink {
       filecache_destroy(outgoing_);
       return;
     }
-    if (!commit_outgoing(outgoing_, !write_failed_))
+    std::string rcpts;
+    for (const std::string& r : outgoing_rcpts_) rcpts += (rcpts.empty() ? "" : ", ") + r;
+    if (!commit_outgoing(outgoing_, !write_failed_, rcpts))
       retry.insert(retry.end(), outgoing_rcpts_.begin(), outgoing_rcpts_.end());
   }
 
@@ -276,13 +281,13 @@ class Debatch final : public AliasSink {
       return;
     }
     int rc = filecache_write(out, "MAIL FROM:<" + outgoing_sender() + ">\r\nRCPT TO:<" + std::string(address) + ">\r\n");
-    if (!commit_outgoing(out, rc == 0)) retry.emplace_back(address);
+    if (!commit_outgoing(out, rc == 0, address)) retry.emplace_back(address);
   }
 
   // Copies the message (from its DATA line) behind an outgoing envelope,
   // syncs the file into place and lists it; a failure is temporary (the
   // disk may be full) and false.
-  bool commit_outgoing(CacheFile& out, bool ok) {
+  bool commit_outgoing(CacheFile& out, bool ok, std::string_view recipients) {
     if (ok && filecache_copy(file_, env_.data_offset, out, kToEnd) != 0) ok = false;
     std::string name = filecache_path(out);
     if (!ok) filecache_destroy(out);
@@ -292,6 +297,8 @@ class Debatch final : public AliasSink {
     }
     ++copies;
     queue_add_outgoing(name);
+    mail_log(strprintf("Queued to send: %.*s in %s (%llu bytes)", static_cast<int>(recipients.size()),
+                       recipients.data(), name.c_str(), static_cast<unsigned long long>(file_size(name))));
     return true;
   }
 
@@ -450,8 +457,8 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
       return nullptr;
     }
   }
-  d->trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
-                       env.sender.c_str());
+  // The record carries the log's own time stamp, like every line of the mail log.
+  d->trace = strprintf("%llu %s", static_cast<unsigned long long>(size), env.sender.c_str());
   return d;
 }
 
@@ -496,7 +503,7 @@ bool debatch_recipient(Debatch& d) {
 void debatch_finish(Debatch& d) {
   if (d.awaiting) mailbox_commit_staged();  // nothing is settled before its copies are
   d.finish_outgoing();
-  log_write(d.trace, logchan::mail_trace, kLogNoStamp);
+  log_write(d.trace, logchan::mail_trace);
   const std::string& path = d.path_;
   if (d.moved) {
     filecache_close(d.file_);
@@ -523,6 +530,8 @@ void debatch_finish(Debatch& d) {
     }
     filecache_close(d.file_);
     log_write("Mail debatch: " + d.failure + " - " + path + " left in the queue for a later try", logchan::errors);
+    mail_log("Kept for a later try: " + path + ": " + d.failure);
+    g_waiting_retry.insert(path);
     queue_retry_later();
   }
 }
@@ -616,6 +625,7 @@ int mail_init() {
   queue_init(now);
   g_last_traffic = now;
   g_retry_at = 0;
+  g_waiting_retry.clear();
   g_debatch_pending = false;
   log_message("    Loading mail alias entries", {}, logfac::house);
   alias_load();
@@ -628,12 +638,18 @@ int mail_init() {
 
   hooks.mailrescan = [] {
     queue_scan_outgoing();
+    g_waiting_retry.clear();  // listed again
     queue_scan_incoming();
   };
   hooks.maildebatch = [] { mail_debatch_one(); };
   hooks.background = mail_background;
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
+  hooks.incoming_mail_count = [] {
+    std::size_t retry = g_waiting_retry.size();
+    return std::pair<std::size_t, std::size_t>{queue_incoming().size() + (g_job ? 1 : 0) + g_parked.size() + retry,
+                                               retry};
+  };
   return 0;
 }
 
@@ -642,6 +658,7 @@ void mail_debatch_one() { debatch_for(Clock::now() + kDebatchSlice, true); }
 void mail_poll() {
   if (g_retry_at && server_now >= g_retry_at) {
     g_retry_at = 0;
+    g_waiting_retry.clear();
     queue_scan_incoming();
   }
   if (!queue_incoming().empty() && config.mail_debatch_time > 0 &&

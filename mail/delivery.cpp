@@ -299,6 +299,8 @@ bool forwarded(const Recipient& r, const SafeDir& home, ByteSource& in, const Qu
     return false;
   }
   debug("Forwarded to:", target);
+  mail_log(strprintf("Forwarded: %s to %s by %s/.forward (%llu bytes)", r.user->login.c_str(), target.c_str(),
+                     r.user->home.c_str(), static_cast<unsigned long long>(in.size())));
   return true;
 }
 
@@ -320,7 +322,11 @@ void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std
     msg += as_transmission_body(body);
     return filecache_write(out, msg);
   });
-  if (rc) debug("Vacation reply could not be queued:", error_text(rc));
+  if (rc) {
+    debug("Vacation reply could not be queued:", error_text(rc));
+  } else {
+    mail_log("Vacation reply: to " + s + " for " + r.user->login);
+  }
 }
 
 // How much of a message one piece writes or parses.
@@ -648,10 +654,15 @@ struct LocalDelivery::State {
         written.reset();
         if (rec.total_length != at - slot.offset || next != kNoMessage) return failed(EIO);
         mailbox_append_stage(*box, slot, std::move(rec),
-                             [done = std::move(committed), login = r.user->login, where = path](int error) {
-                               if (error)
+                             [done = std::move(committed), login = r.user->login, where = path, to = recipient,
+                              size = at - slot.offset](int error) {
+                               if (error) {
                                  log_write("Mail delivery for `" + login + "' waits: " + where + ": " + error_text(error),
                                            logchan::errors);
+                               } else {
+                                 mail_log(strprintf("Delivered: %s to %s (%llu bytes)", to.c_str(), where.c_str(),
+                                                    static_cast<unsigned long long>(size)));
+                               }
                                if (done) done(error);
                              });
         return LocalOutcome::staged;

@@ -469,6 +469,8 @@ bool mail_filter_match(std::string_view filter, const std::string& path) {
   return found;
 }
 
+void mail_log(std::string_view line) { log_write(line, logchan::mail); }
+
 void mail_move_to_oddments(const std::string& path, std::string_view reason) {
   std::string dir = oddments_dir();
   make_path(dir);
@@ -479,8 +481,12 @@ void mail_move_to_oddments(const std::string& path, std::string_view reason) {
   log_write(strprintf("%.*s: %s moved to %s", static_cast<int>(reason.size()), reason.data(), path.c_str(),
                       target.c_str()),
             logchan::errors);
-  if (file_rename(path, target) != 0)
+  if (file_rename(path, target) != 0) {
     log_write("Mail queue: can't move " + path + " to oddments", logchan::errors);
+    return;
+  }
+  mail_log(strprintf("Oddment: %s moved to %s: %.*s", path.c_str(), target.c_str(), static_cast<int>(reason.size()),
+                     reason.data()));
 }
 
 // ---- error mails --------------------------------------------------------------------
@@ -502,6 +508,18 @@ std::string mail_body_lines(std::string_view text) {
   }
   return out;
 }
+
+namespace {
+
+// The reason an error mail gives, as one line for the mail log.
+std::string first_text_line(std::string_view text) {
+  std::string_view line = text.substr(0, text.find_first_of("\r\n"));
+  return std::string(line.empty() ? std::string_view("(no reason given)") : line);
+}
+
+std::string about(const std::string& file) { return file.empty() ? std::string() : " about " + file; }
+
+}  // namespace
 
 ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file, bool headers_only) {
   std::string recipient(to);
@@ -525,6 +543,7 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
   // Never answer the null sender: that is how mail loops and backscatter start.
   if (recipient.empty() || recipient == "<>") {
     log_message("mail send_error: no error mail to the null sender", {}, logfac::maildebatch);
+    mail_log("No error mail to the null sender" + about(file) + ": " + first_text_line(text));
     return ErrorMail::skipped;
   }
   if (source && (str_istarts_with(env.first_line, "X-Loop:") || file_contains(source, {"\nX-Loop:"}))) {
@@ -599,6 +618,7 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
     return ErrorMail::failed;
   }
   queue_add_incoming(path);
+  mail_log("Error mail to " + recipient + about(file) + ": " + first_text_line(text));
   return ErrorMail::sent;
 }
 

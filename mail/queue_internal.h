@@ -120,6 +120,10 @@ std::optional<std::string> queue_pop_incoming();
 // The "listmq" listing, one datagram per call of `send`.
 void queue_list(const std::function<void(std::string_view)>& send);
 
+// One line of the mail log (stamped like every other line there) for each
+// delivery, forward, message queued to be sent, error mail and oddment.
+void mail_log(std::string_view line);
+
 // Noted whenever an SMTP connection receives data (the quiet period before
 // debatching runs from the last traffic).
 void mail_note_traffic();

@@ -183,10 +183,12 @@ class Suite:
         rc, out = self.ctl('test', timeout=5)
         return rc == 0 and out.startswith('test:')
 
-    def ctl(self, command, timeout=10):
-        """Runs velmorctl --root R COMMAND -> (returncode, stdout)."""
-        r = subprocess.run([VELMORCTL_BIN, '--root', self.root, command], stdin=subprocess.DEVNULL,
-                           stdout=subprocess.PIPE, stderr=subprocess.STDOUT, timeout=timeout, text=True)
+    def ctl(self, command, timeout=10, raw=False):
+        """Runs velmorctl --root R COMMAND -> (returncode, stdout); with `raw`,
+        the suite's replies as they came (status: "is:...")."""
+        r = subprocess.run([VELMORCTL_BIN, '--root', self.root] + (['--raw'] if raw else []) + [command],
+                           stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.STDOUT,
+                           timeout=timeout, text=True)
         return r.returncode, r.stdout
 
     def signal(self, signum):
