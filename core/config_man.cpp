@@ -72,6 +72,11 @@ std::map<std::string, std::string> init_values() {
           {"@SMTP_PORT@", "2525 (25 with --standard-ports)"}, {"@POP_PORT@", "1110 (110 with --standard-ports)"},
           {"@IMAP_PORT@", "1143 (143 with --standard-ports)"}, {"@NNTP_PORT@", "1119 (119 with --standard-ports)"},
           {"@WEB_PORT@", "8000 (80 with --standard-ports)"},
+          {"@SMTP_ENABLED@", "yes when this build runs the service, else no"},
+          {"@POP_ENABLED@", "yes when this build runs the service, else no"},
+          {"@IMAP_ENABLED@", "yes when this build runs the service, else no"},
+          {"@NNTP_ENABLED@", "yes when this build runs the service, else no"},
+          {"@WEB_ENABLED@", "yes when this build runs the service, else no"},
       };
       for (const auto& [from, to] : kWords)
         for (std::size_t at; (at = value.find(from)) != std::string::npos;) value.replace(at, from.size(), to);

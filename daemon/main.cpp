@@ -53,17 +53,21 @@ namespace {
 
 // How the console names each service, and the ports the default
 // installation gives it (unprivileged, and with --standard-ports). A service
-// is listed only once it is built: register_services() below says which.
+// is listed, and switched on by --init, only once it is built:
+// register_services() below says which.
 struct ServiceName {
   std::string_view name;  // the service's own name
   const char* title;
-  std::string_view port_placeholder;  // in the default configuration
+  std::string_view port_placeholder;     // in the default configuration
+  std::string_view enabled_placeholder;  // "yes" when built, else "no"
   int port, standard_port;
 };
 constexpr ServiceName kServiceNames[] = {
-    {"smtp", "SMTP", "@SMTP_PORT@", 2525, 25}, {"pop", "POP3", "@POP_PORT@", 1110, 110},
-    {"imap", "IMAP", "@IMAP_PORT@", 1143, 143}, {"nntp", "NNTP", "@NNTP_PORT@", 1119, 119},
-    {"web", "web server", "@WEB_PORT@", 8000, 80},
+    {"smtp", "SMTP", "@SMTP_PORT@", "@SMTP_ENABLED@", 2525, 25},
+    {"pop", "POP3", "@POP_PORT@", "@POP_ENABLED@", 1110, 110},
+    {"imap", "IMAP", "@IMAP_PORT@", "@IMAP_ENABLED@", 1143, 143},
+    {"nntp", "NNTP", "@NNTP_PORT@", "@NNTP_ENABLED@", 1119, 119},
+    {"web", "web server", "@WEB_PORT@", "@WEB_ENABLED@", 8000, 80},
 };
 
 const ServiceName* service_name(std::string_view name) {
@@ -239,8 +243,13 @@ int init_installation(const Options& options) {
       {"@HOSTNAME@", host_name()},
       {"@SERVER_USER@", options.user},
   };
-  for (const auto& s : kServiceNames)
+  register_services();
+  for (const auto& s : kServiceNames) {
     values.emplace_back(s.port_placeholder, std::to_string(standard ? s.standard_port : s.port));
+    bool built = false;
+    for (const ServiceDescriptor* d : service_list()) built = built || d->name == s.name;
+    values.emplace_back(s.enabled_placeholder, built ? "yes" : "no");
+  }
   make_path(paths.root);
   if (!file_is_directory(paths.root)) {
     std::printf("Cannot make the installation folder %s: %s\n", paths.root.c_str(), std::strerror(errno));
