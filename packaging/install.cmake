@@ -28,8 +28,20 @@ if("$ENV{DESTDIR}" STREQUAL "")
     set(user_args)  # nobody to switch to: the suite runs as whoever starts it
   endif()
 endif()
-execute_process(COMMAND ${VELMOR_BIN} --root ${root} --init --standard-ports --no-demo ${user_args}
-                COMMAND_ERROR_IS_FATAL ANY)
+if("$ENV{DESTDIR}" STREQUAL "" AND NOT owner)
+  # An install by a user into a prefix of their own (to have the programs on
+  # PATH): the installation folder is written when that user may, else later
+  # by hand.
+  execute_process(COMMAND ${VELMOR_BIN} --root ${root} --init --standard-ports --no-demo ${user_args}
+                  RESULT_VARIABLE init_failed)
+  if(init_failed)
+    message(STATUS "No installation written in ${root}: make one with velmor --root DIR --init")
+    return()
+  endif()
+else()
+  execute_process(COMMAND ${VELMOR_BIN} --root ${root} --init --standard-ports --no-demo ${user_args}
+                  COMMAND_ERROR_IS_FATAL ANY)
+endif()
 if(owner)
   # -h: a link inside the tree is changed itself, never what it points to.
   execute_process(COMMAND chown -hR ${VELMOR_USER}:${VELMOR_USER} ${root} COMMAND_ERROR_IS_FATAL ANY)

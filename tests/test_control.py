@@ -1,6 +1,7 @@
 """The control channel, through velmorctl and through plain datagram sockets."""
 
 import os
+import re
 import smtplib
 import socket
 import stat
@@ -145,6 +146,9 @@ class VelmorctlTest(SuiteTestCase):
         self.suite.ctl('maildebatch')
         self.assertTrue(wait_for(lambda: 'Incoming mail: 0 messages waiting to be delivered'
                                  in ' '.join(self.suite.ctl('status')[1].split()), 10))
+        # ... and the mail log says where it went.
+        self.assertRegex(self.suite.log('mail'), r'(?m) -> Delivered: demo@localhost to %s \(\d+ bytes\)$'
+                         % re.escape(self.suite.path('home/demo/mail/inbox')))
 
 
 class VelmorctlCommandLineTest(unittest.TestCase):
