@@ -244,12 +244,13 @@ int user_load(const std::string& path) {
 namespace {
 
 // The comment ("|") and empty lines the file starts with, as they are.
+// Lines end where for_each_line ends them (at a CR too), so no user line
+// is ever taken into the header and written back twice.
 std::string_view header_of(std::string_view text) {
   std::size_t pos = 0;
   while (pos < text.size()) {
-    std::size_t end = text.find('\n', pos);
+    std::size_t end = text.find_first_of("\r\n", pos);
     std::string_view line = text.substr(pos, end == std::string_view::npos ? std::string_view::npos : end - pos);
-    while (!line.empty() && line.back() == '\r') line.remove_suffix(1);
     if (!line.empty() && line[0] != '|') break;
     pos = end == std::string_view::npos ? text.size() : end + 1;
   }

@@ -115,6 +115,13 @@ TEST_F(UsersTest, TheCommentHeaderIsKeptAcrossSaves) {
   EXPECT_TRUE(saved.starts_with(header + "ann,")) << saved;
   ASSERT_EQ(users_parse("| no line end"), 0);
   EXPECT_EQ(users_text(), "| no line end\n");
+  // A lone CR ends a line: the user behind it is a user, not header text
+  // (which would write it twice, and then once more at every save).
+  ASSERT_EQ(users_parse(std::string("| note\rbob,") + kBlankHash + "\n"), 0);
+  std::string text = users_text();
+  ASSERT_EQ(users_parse(text), 0);
+  EXPECT_EQ(users_text(), text);
+  EXPECT_EQ(user_list().size(), 1u);
 }
 
 TEST_F(UsersTest, FindsByLoginDottedFullNameAndInitials) {
