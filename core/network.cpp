@@ -506,7 +506,8 @@ int net_start(std::vector<ListenReport>* report) {
     wanted.push_back({.service = s.name,
                       .address = paths.bind_address.empty() ? "0.0.0.0" : paths.bind_address,
                       .port = *s.port,
-                      .enabled = !s.enabled || *s.enabled});
+                      .enabled = !s.enabled || *s.enabled,
+                      .error = {}});
     numbers.push_back(s.number);
   }
   int rc = 0;

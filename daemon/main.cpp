@@ -492,6 +492,7 @@ void report_listeners(const std::vector<ListenReport>& report) {
 // Writes the pid file (see core/pidfile.h). False when another instance
 // published its own since start-up began: this one must not run.
 bool publish_pid_file() {
+  make_parent_dirs(paths.pid_file);
   switch (pid_file.publish(getpid())) {
     case PidFile::Claim::running:
       return false;
