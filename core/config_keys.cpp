@@ -248,8 +248,8 @@ const std::vector<ConfigKeyInfo>& config_keys() {
 }
 
 std::string_view config_key_reader(std::string_view key) {
-  // What reads each key, for the manual page made from this table (a test
-  // checks that every key has an entry). The first rule that matches wins:
+  // What reads each key, for the manual page made from this table (the
+  // build stops when a key has no entry). The first rule that matches wins:
   // a rule ending in "." or "_" covers every key it begins, any other names
   // one key. "Still to come" marks a part of the suite not built yet: its
   // keys are kept and written back, and nothing acts on them.
