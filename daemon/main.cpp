@@ -373,16 +373,6 @@ void shutdown_suite() {
 
 // ---- start-up ---------------------------------------------------------------
 
-// An admin.email without "@" gets the mail domain (the first of
-// mail.domains, else server.name): it goes into every greeting.
-void complete_admin_email() {
-  if (!config.admin_email || config.admin_email->find('@') != std::string::npos) return;
-  std::string domain = text_of(config.mail_domains);
-  domain = domain.substr(0, domain.find_first_of(", \t"));
-  if (domain.empty()) domain = text_of(config.server_name);
-  if (!domain.empty()) *config.admin_email += "@" + domain;
-}
-
 // The pid file is written under a temporary name and renamed into place, so
 // whoever sees it sees the whole number. When it cannot be written the suite
 // runs without one.
@@ -459,7 +449,6 @@ int start_and_run() {
   dns_register();  // its sockets open once the loop is up
   log_message("Initialising mail system");
   mail_init();
-  complete_admin_email();
   // The services, in the order their listeners open.
   pop_register();
   smtp_register();
