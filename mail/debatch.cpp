@@ -427,8 +427,8 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
       return nullptr;
     }
   }
-  d->trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
-                       env.sender.c_str());
+  // Stamped like every other mail-log line (the SMTP lines share the file).
+  d->trace = strprintf("%llu <%s>", static_cast<unsigned long long>(size), env.sender.c_str());
   return d;
 }
 
@@ -474,7 +474,7 @@ bool debatch_recipient(Debatch& d) {
 void debatch_finish(Debatch& d) {
   if (d.awaiting) mailbox_commit_staged();  // nothing is settled before its copies are
   d.finish_outgoing();
-  log_write(d.trace, logchan::mail_trace, kLogNoStamp);
+  log_write(d.trace, logchan::mail_trace);
   const std::string& path = d.path_;
   if (d.moved) {
     filecache_close(d.file_);

@@ -227,7 +227,7 @@ void SmtpSession::rcpt(Connection& c, std::string_view arg) {
     static const char* const why[] = {"", "SMTP Posting denied - mail from blocked site",
                                       "SMTP posting denied - sender not a valid local user",
                                       "SMTP posting denied - local user not allowed to send"};
-    log_message(why[denial_], {}, logfac::house);
+    log_message(why[denial_], " (" + c.peer().text + ")", logfac::house);
     c.send("550 posting denied\r\n");
     return;
   }
@@ -373,7 +373,7 @@ void SmtpSession::command(Connection& c, std::string_view line) {
   } else if (str_iequals(verb, "noop")) {
     c.send("250 OK\r\n");
   } else if (str_iequals(verb, "quit")) {
-    log_message("SMTP server closing connection", {}, logfac::house);
+    log_message("SMTP server closing connection to ", c.peer().text, logfac::house);
     c.send(strprintf("221 %s Velmor SMTP Server (%s) closing connection at %s\r\n",
                      text_of(config.server_name).c_str(), kVersion, time_text(std::time(nullptr)).c_str()));
     c.close_after_send();
@@ -418,7 +418,8 @@ void SmtpSession::finish_message(Connection& c) {
   }
   int rc = write_failed_ ? EIO : filecache_purge(queue_);
   if (rc != 0) {
-    log_write("SMTP: message not queued, the queue file could not be written: " + queue_path_, logchan::errors);
+    log_write("SMTP: message from " + c.peer().text + " not queued, the queue file could not be written: " + queue_path_,
+              logchan::errors);
     unlink(queue_hidden_.c_str());
     discard();
     c.send(kLocalError);

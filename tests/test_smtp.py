@@ -4,6 +4,7 @@ Debatching is off (mail.debatch.time 0), so every accepted message stays in
 the incoming queue where the tests read it back.
 """
 import os
+import re
 import select
 import shutil
 import smtplib
@@ -347,6 +348,12 @@ class LimitAndRecipientTest(unittest.TestCase):
         self.assertIn(b'Subject: for postmaster', read(self.suite.path('home/demo/mail/inbox')))
         self.assertIn(b'Subject: for postmaster', read(self.suite.path('home/demo/mail/work')))
         self.assertEqual(queue_files(self.suite, 'mail/odd'), [])
+        # One mail log: every line has the same stamp, and the SMTP lines name the client.
+        log = self.suite.log('mail').splitlines()
+        self.assertTrue(all(re.match(r'\d\d:\d\d:\d\d, \d\d \w{3} -> ', line) for line in log), log)
+        self.assertTrue(any(line.endswith(' 127.0.0.1 - RCPT TO:<nosuchuser@site.example>') for line in log), log)
+        self.assertTrue(any(re.search(r'-> \d+ <ann@far\.example> PostMaster@site\.example demo_work@localhost', line)
+                            for line in log), log)
 
     def test_the_greeting_names_the_administrator_with_the_domain_after_a_reload(self):
         for reload in (False, True):
