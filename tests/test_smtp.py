@@ -123,6 +123,7 @@ class SmtpServerTest(SuiteTestCase):
         self.assertEqual(c.cmd('DATA'), '503 Need RCPT before DATA')
         self.assertEqual(c.cmd('RCPT TO:<>'), '501 Syntax: RCPT TO:<address>')
         self.assertEqual(c.cmd('VRFY nosuchuser'), '550 Unknown user (Server only checks mailbox/login names)')
+        self.assertRegex(c.cmd('VRFY demo'), r'^250 .* <demo@localhost>$')  # loopback is the site's own
         self.assertEqual(c.cmd('TURN'), '502 TURN not available')
         self.assertEqual(c.cmd('NOOP'), '250 OK')
         self.assertEqual(c.cmd('RSET'), '250 Reset OK')
