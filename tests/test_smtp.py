@@ -136,6 +136,7 @@ class SmtpServerTest(SuiteTestCase):
         self.assertEqual(len(hidden_files(self.suite)), 1)  # the transaction's file
         self.assertRegex(c.cmd('QUIT'), r'^221 \S+ Velmor SMTP Server \(2\.0\.49\) closing connection at ')
         c.wait_closed()  # the session has let go of everything by now
+        c.close()
         self.assertEqual(queue_files(self.suite), [])
         self.assertEqual(hidden_files(self.suite), [])
 
