@@ -72,6 +72,10 @@ void log_flush_all();  // every buffer, at shutdown
 // One line per From/To/Message-ID/Subject header of a header block, channel
 // 8, each "<tag> - <line>" (the tag names the connection and its client).
 void log_header_summary(std::string_view tag, std::string_view header_text);
+// The same with a message or transfer number as the tag.
+inline void log_header_summary(int number, std::string_view header_text) {
+  log_header_summary(std::to_string(number), header_text);
+}
 
 // The path routed to channel 1, for the crash handler (which may only use
 // async-signal-safe calls): a NUL-terminated copy kept at log_init time.

@@ -56,7 +56,7 @@ std::string redirect_address(const GroupOptions& group, std::string_view key) {
   const std::string& to = group.text(key);
   if (to.empty()) return {};
   if (to.find('@') != std::string::npos) return to;
-  return to + "@" + primary_mail_domain();
+  return to + "@" + mail_primary_domain();
 }
 
 bool is_temporary(int error) {
@@ -310,7 +310,7 @@ void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std
   if (!vacation_note_sent(path_join(r.user->home, ".vacation.sent"), sender, now())) return;
   FileSource text(std::move(fd));
   std::string_view body = text.view(0, static_cast<std::size_t>(std::min<std::uint64_t>(text.size(), 256 * 1024)));
-  std::string me = r.user->login + "@" + primary_mail_domain();
+  std::string me = r.user->login + "@" + mail_primary_domain();
   std::string s(sender);
   int rc = queue_new_message([&](CacheFile& out) {
     std::string msg = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + s + ">\r\nDATA\r\n";
@@ -737,7 +737,7 @@ std::string receipt_address(std::string_view from) {
   }
   if (!last.empty()) return last;
   if (words.empty()) return {};
-  return words + "@" + primary_mail_domain();
+  return words + "@" + mail_primary_domain();
 }
 
 bool plain_address(std::string_view a) {
@@ -785,7 +785,7 @@ int mailbox_mark_seen(Mailbox& box, MessageRecord& message, std::uint64_t offset
   const UserRecord* u = user_find(user);
   std::string login = u ? u->login : std::string(user);
   std::string full_name = u ? u->full_name : login;
-  std::string domain = primary_mail_domain();
+  std::string domain = mail_primary_domain();
   std::string me = login + "@" + domain;
   auto date = value("Date");
   std::string text = "MAIL FROM:<" + me + ">\r\nRCPT TO:<" + to + ">\r\nDATA\r\nTo: " + *from + "\r\nFrom: " +

@@ -335,12 +335,13 @@ std::optional<std::string> mail_local_user(std::string_view address) {
   return name;
 }
 
+std::string mail_primary_domain() { return primary_mail_domain(); }
 
 std::string mail_message_id(std::string_view header_name) {
   static unsigned long sequence = 0;
   std::string name = header_name.empty() ? std::string("Message-ID:") : std::string(header_name);
   return strprintf("%s <Velmor-%s-%ld.%ld@%s>\r\n", name.c_str(), kVersion, static_cast<long>(std::time(nullptr)),
-                   static_cast<long>(std::clock()) + static_cast<long>(++sequence), primary_mail_domain().c_str());
+                   static_cast<long>(std::clock()) + static_cast<long>(++sequence), mail_primary_domain().c_str());
 }
 
 // ---- the reject list -------------------------------------------------------------

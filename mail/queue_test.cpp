@@ -57,10 +57,10 @@ TEST_F(QueueTest, LocalUsersAndThePrimaryDomain) {
   EXPECT_EQ(mail_local_user("ann@"), std::nullopt);
   EXPECT_EQ(mail_local_user("<>"), std::nullopt);
   EXPECT_EQ(mail_local_user(""), std::nullopt);
-  EXPECT_EQ(primary_mail_domain(), "site.example");
+  EXPECT_EQ(mail_primary_domain(), "site.example");
   config.mail_domains.reset();
   config.server_name = "host.example";
-  EXPECT_EQ(primary_mail_domain(), "host.example");
+  EXPECT_EQ(mail_primary_domain(), "host.example");
   EXPECT_EQ(mail_local_user("ann@site.example"), std::nullopt);
 }
 

@@ -307,7 +307,7 @@ void SmtpSession::vrfy(Connection& c, std::string_view arg) {
     return;
   }
   c.send(strprintf("250 %s <%s@%s>\r\n", clip(u->full_name, kEchoMax).c_str(), clip(u->login, kEchoMax).c_str(),
-                   primary_mail_domain().c_str()));
+                   mail_primary_domain().c_str()));
 }
 
 // The service extensions EHLO names, one a line. What a later extension
