@@ -326,4 +326,13 @@ int yes_no_word(std::string_view text);
 // The socket buffer size actually used: sock.buffer, never below 1024.
 int socket_buffer_size();
 
+// The site's primary mail domain: the first entry of mail.domains (at most
+// 120 characters), or server.name when mail.domains is unset or empty.
+std::string primary_mail_domain();
+// The administrator's address as greetings and error mails name it:
+// admin.email, completed with the mail domain (the first of mail.domains,
+// else server.name) when it has no "@". Worked out at every use, so a
+// reload of the configuration never loses the domain.
+std::string admin_address();
+
 }  // namespace velmor

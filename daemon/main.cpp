@@ -458,16 +458,6 @@ void shutdown_suite() {
 
 // ---- start-up ---------------------------------------------------------------
 
-// An admin.email without "@" gets the mail domain (the first of
-// mail.domains, else server.name): it goes into every greeting.
-void complete_admin_email() {
-  if (!config.admin_email || config.admin_email->find('@') != std::string::npos) return;
-  std::string domain = text_of(config.mail_domains);
-  domain = domain.substr(0, domain.find_first_of(", \t"));
-  if (domain.empty()) domain = text_of(config.server_name);
-  if (!domain.empty()) *config.admin_email += "@" + domain;
-}
-
 constexpr const char* kRefusal = "Velmor server is already running, or has died messily - cannot start new server";
 
 // Says what became of each service's port; the last word on a port that
@@ -595,7 +585,6 @@ int start_and_run() {
   dns_register();  // its sockets open once the loop is up
   log_message("Initialising mail system");
   mail_init();
-  complete_admin_email();
   register_services();
   log_message("Starting listening sockets");
   std::vector<ListenReport> listening;

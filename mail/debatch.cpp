@@ -22,7 +22,6 @@
 #include "core/hooks.h"
 #include "core/log.h"
 #include "core/strfmt.h"
-#include "core/textfile.h"
 #include "core/util.h"
 #include "mail/alias.h"
 #include "mail/delivery.h"
@@ -30,6 +29,7 @@
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
+#include "mail/recipient.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -54,7 +54,7 @@ constexpr auto kDebatchSlice = std::chrono::milliseconds(10);
 // How long the overviews' upkeep may run in one go.
 constexpr auto kUpkeepSlice = std::chrono::milliseconds(4);
 
-class Debatch final : public AliasSink {
+class Debatch final : public QueueSink {
  public:
   Debatch(std::string path, CacheFile file) : path_(std::move(path)), file_(std::move(file)) {}
   ~Debatch() override {
@@ -64,8 +64,6 @@ class Debatch final : public AliasSink {
   const std::string path_;
   CacheFile file_;
   QueueEnvelope env_;
-  std::shared_ptr<const GroupOptions> sender_group;  // a local sender's group
-  bool sender_local = false;
   std::size_t next = 0;     // the envelope recipient to handle next
 
   int copies = 0;           // copies safely made (mailboxes, files, error mails)
@@ -103,11 +101,6 @@ class Debatch final : public AliasSink {
   }
 
   // ---- AliasSink ----
-  std::string local_user(std::string_view address) override {
-    return mail_local_user(address).value_or(std::string());
-  }
-  bool user_exists(std::string_view user) override { return velmor::user_exists(user); }
-
   // A local copy is queued here and written by run_deliveries(), a piece
   // at a time; it counts once its mailbox's commit has synced it.
   bool deliver_local(std::string_view user, std::string_view to_address) override {
@@ -195,19 +188,8 @@ class Debatch final : public AliasSink {
     return true;
   }
 
-  bool read_list(std::string_view target, std::vector<std::string>& lines) override {
-    std::string list_path(target);
-    if (!list_path.empty() && list_path.front() == '$') list_path.erase(0, 1);
-    std::optional<std::string> text = read_text_file(list_path);
-    if (!text) return false;
-    for_each_line(*text, [&](std::string_view line) { lines.emplace_back(line.substr(0, 128)); });
-    return true;
-  }
-
-  // Group mail ("+N") is for senders whose group may override the mail
-  // limits: the permission to reach a whole group.
   bool deliver_group(int number) override {
-    if (!sender_local || !sender_group || !(sender_group->mail_flags & gflag::mail_override)) {
+    if (!may_mail_group()) {
       error(strprintf("You do not have the permission to email group %d\r\n", number), {});
       return false;
     }
@@ -217,14 +199,7 @@ class Debatch final : public AliasSink {
   }
 
   void loop_report() override {
-    error("Aliasing loop whilst processing the following article\r\n", text_of(config.admin_email));
-  }
-
-  std::tm local_time() override {
-    std::time_t now = server_now ? server_now : std::time(nullptr);
-    std::tm tm{};
-    localtime_r(&now, &tm);
-    return tm;
+    error("Aliasing loop whilst processing the following article\r\n", admin_address());
   }
 
   void temporary(const std::string& recipient, std::string_view user) {
@@ -258,8 +233,11 @@ class Debatch final : public AliasSink {
   }
 
  private:
+  // A forced sender never replaces the null sender: an error mail must not
+  // be answered by another.
   std::string outgoing_sender() const {
-    if (config.mail_from_force && !config.mail_from_force->empty()) return *config.mail_from_force;
+    if (!env_.sender.empty() && config.mail_from_force && !config.mail_from_force->empty())
+      return *config.mail_from_force;
     return env_.sender;
   }
 
@@ -444,8 +422,7 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
     log_message("Article was POPed", {}, logfac::house);
   } else {
     std::optional<std::string> user = mail_local_user(env.sender);
-    d->sender_local = user.has_value();
-    d->sender_group = user_group(user.value_or(std::string()));
+    d->set_sender(env.sender);
     if (d->sender_group && refused_by_group(*d, *d->sender_group, user ? *user : env.sender, size)) {
       filecache_close(d->file_);
       if (d->moved) return nullptr;
@@ -457,8 +434,8 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
       return nullptr;
     }
   }
-  // The record carries the log's own time stamp, like every line of the mail log.
-  d->trace = strprintf("%llu %s", static_cast<unsigned long long>(size), env.sender.c_str());
+  // Stamped like every other mail-log line (the SMTP lines share the file).
+  d->trace = strprintf("%llu <%s>", static_cast<unsigned long long>(size), env.sender.c_str());
   return d;
 }
 
@@ -486,13 +463,14 @@ bool debatch_recipient(Debatch& d) {
     d.next = d.env_.recipients.size();  // the header named the recipient
     return true;
   }
-  std::optional<std::string> local = mail_local_user(address);
-  if (local) {
-    if (alias_resolve(alias_table(), *local, d)) return true;
-    if (user_exists(*local) && d.deliver_local(*local, address)) return true;
-    d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
-  } else if (!alias_resolve(alias_table(), address, d)) {
-    d.deliver_remote(address);
+  RecipientResult to = route_recipient(address, d);
+  if (to.route == RecipientRoute::unknown_user) {
+    d.error(strprintf("Local user %s does not exist\r\n", to.local.c_str()), {});
+  } else if (to.route == RecipientRoute::no_administrator) {
+    // Kept for the operator rather than bounced: postmaster must reach someone.
+    log_write("Mail debatch: postmaster mail has nobody to go to (no postmaster alias, and admin.email names no user)",
+              logchan::errors);
+    d.fail("No administrator for postmaster mail - set a postmaster alias or admin.email");
   }
   return true;
 }

@@ -147,6 +147,37 @@ TEST_F(DebatchTest, FetchedMailGoesByTheListedHeaderAndOutwardUnderTheForcedSend
   std::vector<std::string> out = folder_names(root + "/out", true);
   ASSERT_EQ(out.size(), 1u);
   EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<relay@site.example>\r\nRCPT TO:<b@far.example>\r\n") + kMessage);
+  // An error mail keeps the null sender, so nobody answers it.
+  write_file(in("3"), std::string("MAIL FROM:<>\r\nRCPT TO:<c@far.example>\r\n") + kMessage);
+  debatch_file(in("3"));
+  out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 2u);
+  EXPECT_EQ(read_file(out[1]), std::string("MAIL FROM:<>\r\nRCPT TO:<c@far.example>\r\n") + kMessage);
+}
+
+TEST_F(DebatchTest, PostmasterMailGoesToTheAdministratorOrWaitsInOddments) {
+  auto postmaster = [&](const std::string& name, const char* to) {
+    write_file(in(name), "MAIL FROM:<x@far.example>\r\nRCPT TO:<" + std::string(to) + ">\r\n" + kMessage);
+    debatch_file(in(name));
+  };
+  config.admin_email = "bob";  // admin.email's local user
+  postmaster("1", "PostMaster@site.example");
+  EXPECT_NE(read_file(root + "/home/bob/mail/inbox").find("Subject: s"), std::string::npos);
+  alias_table() = alias_parse("postmaster carl\n");  // an alias comes first
+  postmaster("2", "postmaster");
+  EXPECT_NE(read_file(root + "/home/carl/mail/inbox").find("Subject: s"), std::string::npos);
+  alias_table().clear();
+  config.admin_email = "ops@far.example";  // an administrator elsewhere
+  postmaster("3", "postmaster@site.example");
+  std::vector<std::string> out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 1u);
+  EXPECT_NE(read_file(out[0]).find("RCPT TO:<ops@far.example>\r\n"), std::string::npos);
+  // Nobody at all: kept for the operator, and no error mail to the sender.
+  config.admin_email = "postmaster";
+  postmaster("4", "postmaster@site.example");
+  EXPECT_EQ(folder_names(root + "/odd", true).size(), 1u);
+  EXPECT_TRUE(queue_incoming().empty());
+  EXPECT_TRUE(folder_names(root + "/in", true).empty());
 }
 
 TEST_F(DebatchTest, GroupMailReachesEveryMemberOnlyFromAPermittedSender) {

@@ -335,13 +335,7 @@ std::optional<std::string> mail_local_user(std::string_view address) {
   return name;
 }
 
-std::string mail_primary_domain() {
-  if (!config.mail_domains || config.mail_domains->empty()) return text_of(config.server_name);
-  std::string_view d = *config.mail_domains;
-  d = d.substr(d.find_first_not_of(" \t,") == std::string_view::npos ? d.size() : d.find_first_not_of(" \t,"));
-  d = d.substr(0, d.find_first_of(" \t,\r\n"));
-  return std::string(d.substr(0, 120));
-}
+std::string mail_primary_domain() { return primary_mail_domain(); }
 
 std::string mail_message_id(std::string_view header_name) {
   static unsigned long sequence = 0;
@@ -560,9 +554,11 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
     }
     return ErrorMail::failed;
   }
-  std::string admin = text_of(config.admin_email);
+  std::string admin = admin_address();
   std::string head;
-  head += "MAIL FROM:<" + admin + ">\r\n";
+  // From the null sender: a report about a report is never sent, so two
+  // sites can never bounce mail to each other for ever.
+  head += "MAIL FROM:<>\r\n";
   head += "RCPT TO:<" + recipient + ">\r\n";
   head += "DATA\r\n";
   head += "Date: " + mail_date_text(std::time(nullptr)) + "\r\n";
