@@ -37,6 +37,7 @@
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/pop_client.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
 #include "mail/smtp_server.h"
@@ -463,6 +464,7 @@ int start_and_run() {
   // The services, in the order their listeners open.
   pop_register();
   smtp_register();
+  pop_client_register();  // outward only: no listener
   log_message("Starting listening sockets");
   // Without its control channel the suite could not be steered, and a
   // squatter on the path would get what local tools send: no start.

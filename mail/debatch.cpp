@@ -1,7 +1,9 @@
 // Debatching: one incoming file is checked against the sender's group
 // limits, every recipient is resolved through the alias table, local
 // recipients get the message in their mailbox and outside ones a file of the
-// outgoing queue. The recipients of a file are handled one per step, and the
+// outgoing queue (fetched mail excepted: it reaches local mailboxes only,
+// and a fetched message nobody local receives goes to oddments). The
+// recipients of a file are handled one per step, and the
 // poll works for a bounded time, so a message for many never holds up the
 // connections. Each mailbox and each outside address gets one copy however
 // often it is named. The incoming file is deleted only when every copy made
@@ -27,6 +29,7 @@
 #include "mail/alias.h"
 #include "mail/delivery.h"
 #include "mail/mailbox.h"
+#include "mail/pop_client.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
@@ -156,6 +159,12 @@ class Debatch final : public AliasSink {
 
   void deliver_remote(std::string_view address) override {
     if (moved || !remote_.emplace(address).second) return;
+    if (env_.fetched) {
+      // Fetched mail is the site's own, collected from its providers: sent
+      // out again it would go back where it came from, and come back.
+      log_message("Fetched mail not sent on to ", address, logfac::maildebatch);
+      return;
+    }
     std::string_view domain = address_domain(address);
     if (!domain.empty() && config.smtp_direct && wildcard_match(domain, *config.smtp_direct)) {
       send_direct(address);
@@ -483,7 +492,9 @@ bool debatch_recipient(Debatch& d) {
   if (local) {
     if (alias_resolve(alias_table(), *local, d)) return true;
     if (user_exists(*local) && d.deliver_local(*local, address)) return true;
-    d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
+    // A fetched message's sender is the site's own account at a provider:
+    // nobody there is told; unless delivered, it goes to oddments.
+    if (!d.env_.fetched) d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
   } else if (!alias_resolve(alias_table(), address, d)) {
     d.deliver_remote(address);
   }
@@ -500,6 +511,9 @@ void debatch_finish(Debatch& d) {
   const std::string& path = d.path_;
   if (d.moved) {
     filecache_close(d.file_);
+  } else if (d.failure.empty() && d.env_.fetched && d.copies == 0) {
+    filecache_close(d.file_);
+    mail_move_to_oddments(path, "Fetched mail for no local user");
   } else if (d.failure.empty()) {
     filecache_close(d.file_);
     filecache_delete(path);
@@ -651,6 +665,7 @@ void mail_poll() {
   // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
   mailbox_upkeep(Clock::now() + kUpkeepSlice);
+  pop_client_poll();  // the timed fetch, while the link is up
 }
 
 bool mail_background() {
