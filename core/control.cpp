@@ -145,11 +145,18 @@ bool start_listing(const sockaddr_un& to, socklen_t to_len, std::vector<std::str
   return true;
 }
 
-void drop_stalled_listings() {
+// Every tick: a listing whose reader took nothing for too long is dropped;
+// the others are offered their next datagrams again, so that a wake-up
+// missed for any reason costs a tick, not the rest of the listing.
+void tend_listings() {
   auto& all = listings();
   for (auto it = all.begin(); it != all.end();) {
     auto next = std::next(it);
-    if (server_now - it->progress > kListingStall) end_listing(it);
+    if (server_now - it->progress > kListingStall) {
+      end_listing(it);
+    } else {
+      send_listing(it);
+    }
     it = next;
   }
 }
@@ -361,7 +368,7 @@ int control_open() {
     c.made = true;
   }
   c.fd = fd;
-  every_tick(drop_stalled_listings);
+  every_tick(tend_listings);
   if (!watch_readable(fd, control_read)) {
     control_remove();
     return 1;

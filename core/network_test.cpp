@@ -484,7 +484,7 @@ TEST_F(NetworkTest, AQueueListingWaitsForItsReader) {
     ssize_t n = ::recv(reader.get(), buf, sizeof buf, MSG_DONTWAIT);
     if (n > 0) got.emplace_back(buf, static_cast<std::size_t>(n));
     return !got.empty() && got.back() == "end mq\n";
-  }));
+  })) << got.size() << " " << (got.empty() ? std::string() : got.back());
   ASSERT_EQ(got.size(), 102u);
   EXPECT_EQ(got[0], "start mq\n");
   EXPECT_EQ(got[57], "entry 56");

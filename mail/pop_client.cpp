@@ -391,7 +391,9 @@ void PopClientSession::pump(Connection& c) {
   if (!counted_ || quit_sent_ || c.closed()) return;
   const bool last = retrs_out_ == 0 && (next_ == 0 || stopping_);
   if (finished_.size() >= kBatch || (last && !finished_.empty())) hand_over();
-  auto room = [&] { return pipelining_ ? sent_.size() < kWindow : sent_.empty(); };
+  // Without pipelining a command waits for the whole answer to the last
+  // one, a message included.
+  auto room = [&] { return pipelining_ ? sent_.size() < kWindow : sent_.empty() && reading_ == Reading::reply; };
   while (!to_delete_.empty() && room()) {
     std::uint32_t n = to_delete_.front();
     to_delete_.pop_front();
