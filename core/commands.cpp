@@ -32,6 +32,11 @@ std::time_t transfer_started = 0;
 // Whether the kicks of this transfer started any connection: with nothing
 // to fetch or send there is nothing to wait for.
 bool transfer_work = false;
+// Whether a client was seen running: one that is counted from its kick on
+// may be over (a fast server) before the next poll looks.
+bool clients_seen = false;
+
+bool clients_running() { return count(hooks.pop_client_count) || count(hooks.smtp_client_count); }
 
 // A transfer waits this long for the link before it gives up.
 constexpr std::time_t kLinkWait = 600;
@@ -98,14 +103,14 @@ void mail_transfer_poll() {
       mail_transfer_state = 2;
       transfer_started = server_now;
       transfer_work = start_transfer();
+      clients_seen = clients_running();
       break;
     case 2:
-      if (count(hooks.pop_client_count) || count(hooks.smtp_client_count) || !transfer_work ||
-          server_now - transfer_started >= kStartGrace)
+      if (clients_seen || clients_running() || !transfer_work || server_now - transfer_started >= kStartGrace)
         mail_transfer_state = 3;
       break;
     case 3:
-      if (!count(hooks.smtp_client_count) && !count(hooks.pop_client_count) &&
+      if (!clients_running() &&
           connection_count(svc::smtp) + connection_count(svc::smtp_client) == 0) {
         mail_transfer_state = 0;
         run(hooks.disconnect);

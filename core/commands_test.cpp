@@ -122,6 +122,19 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   EXPECT_EQ(mail_transfer_state, 0);
   EXPECT_EQ(calls.back(), "disconnect");
 
+  // A connection counted from its kick on and over before the next poll
+  // (a fast server): no grace either.
+  hooks.popkick = [this] {
+    pop_clients = 1;
+    return true;
+  };
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  pop_clients = 0;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+
   // Without the mail clients nothing can start: no grace.
   hooks.popkick = hooks.smtpkick = nullptr;
   mail_transfer_state = 5;

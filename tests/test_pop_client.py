@@ -365,7 +365,7 @@ class MailTransferTest(FetchCase):
         self.assertEqual(len(server.messages), 2)  # nothing fetched while the link is down
         self.link = True
         self.assertTrue(wait_for(lambda: 'Mail transfer complete, disconnecting' in suite.log('main')),
-                        suite.log('main'))
+                        suite.log('main') + suite.log('errors') + repr(server.commands))
         self.assertEqual(server.messages, [])
         self.assertEqual(len(self.queued()), 2)
         log = suite.log('main')
