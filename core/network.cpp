@@ -552,7 +552,7 @@ void net_pass(int timeout_ms) {
       if (s->writable && (ev.events & (EPOLLOUT | EPOLLERR | EPOLLHUP))) {
         auto writable = std::move(s->writable);  // one wait, one call
         s->writable = nullptr;
-        n.set_events(fd, *s, s->ready ? EPOLLIN : 0);
+        n.set_events(fd, *s, s->ready ? std::uint32_t{EPOLLIN} : 0u);
         guarded("descriptor handler", writable);
         s = n.slot(fd);  // the callback may have unwatched or reused it
         if (!s || s->generation != generation) continue;
@@ -639,7 +639,7 @@ bool watch_readable(int fd, std::function<void()> ready) {
   if (old && (old->connection || old->ready)) return false;
   Slot& s = old && old->writable ? *old : n.claim(fd);
   s.ready = std::move(ready);
-  if (!n.set_events(fd, s, EPOLLIN | (s.writable ? EPOLLOUT : 0))) {
+  if (!n.set_events(fd, s, EPOLLIN | (s.writable ? std::uint32_t{EPOLLOUT} : 0u))) {
     serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
     s.ready = nullptr;
     if (!s.writable) n.drop_raw(fd);
@@ -656,7 +656,7 @@ bool watch_writable(int fd, std::function<void()> ready) {
   // A slot still registered (its last wait is being answered) is kept.
   if (!s || (!s->ready && !s->writable && !s->watched)) s = &n.claim(fd);
   s->writable = std::move(ready);
-  if (!n.set_events(fd, *s, (s->ready ? EPOLLIN : 0) | EPOLLOUT)) {
+  if (!n.set_events(fd, *s, (s->ready ? std::uint32_t{EPOLLIN} : 0u) | EPOLLOUT)) {
     serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
     s->writable = nullptr;
     if (!s->ready) n.drop_raw(fd);
