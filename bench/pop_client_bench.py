@@ -7,7 +7,6 @@ Run through bench/pop_client.sh, which installs Dovecot and fetchmail when
 they are missing."""
 
 import os
-import random
 import shutil
 import subprocess
 import sys
@@ -16,32 +15,19 @@ import time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(os.path.dirname(HERE), 'tests'))
+sys.path.insert(0, HERE)
 import dovecot  # noqa: E402
+import pop3_bench  # noqa: E402
 from dns_server import NameServer, response, test_address  # noqa: E402
 from harness import Suite  # noqa: E402
 
 MESSAGES = int(os.environ.get('POP_CLIENT_BENCH_MESSAGES', '5000'))
 ROUNDS = int(os.environ.get('POP_CLIENT_BENCH_ROUNDS', '3'))
-WORDS = ('mail suite local server message queue delivery mailbox overview index header body '
-         'line dial link modem proxy cache news group article reader client').split()
 
 
 def make_messages(count):
-    """Messages with LF line ends, sizes from about 1 to 12 KB."""
-    rnd = random.Random(7)
-    out = []
-    for i in range(count):
-        lines = ['From: Sender %d <sender%d@elsewhere.test>' % (i % 97, i % 97),
-                 'To: bench@example.test',
-                 'Subject: message number %d about %s' % (i, rnd.choice(WORDS)),
-                 'Message-ID: <%d.bench@elsewhere.test>' % i,
-                 '']
-        for _ in range(rnd.randint(10, 160)):
-            lines.append(' '.join(rnd.choice(WORDS) for _ in range(rnd.randint(4, 12))))
-        if i % 50 == 0:
-            lines.append('.a line starting with a dot')
-        out.append(('\n'.join(lines) + '\n').encode())
-    return out
+    """The POP3 benchmark's messages (about 1 to 12 KB), LF line ends."""
+    return [('\n'.join(lines) + '\n').encode() for lines in pop3_bench.make_messages(count)]
 
 
 def wait(predicate, timeout=600):
