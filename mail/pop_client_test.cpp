@@ -171,6 +171,15 @@ TEST_F(PopClientTest, ADroppedConnectionLeavesNoPartialFileAndDeletesNothing) {
   EXPECT_TRUE(second->closed());
   EXPECT_TRUE(everything().empty());
   EXPECT_EQ(second->output().find("DELE"), std::string::npos);
+
+  // A server that stops half way through a message: the loop's time-out
+  // ends it the same way.
+  auto third = connect();
+  third->feed(login(true, 1));
+  third->feed("+OK\r\nSubject: 1\r\n\r\nhalf");
+  third->connection().close_now(CloseReason::timed_out);
+  EXPECT_TRUE(third->closed());
+  EXPECT_TRUE(everything().empty());
 }
 
 TEST_F(PopClientTest, RefusalsAndStrayRepliesEndTheConnection) {
