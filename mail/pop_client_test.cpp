@@ -217,5 +217,25 @@ TEST_F(PopClientTest, ARunConnectsEachAccountOnceWhileTheLinkIsUp) {
   EXPECT_FALSE(hooks.popkick());  // nothing to fetch: a transfer need not wait
 }
 
+TEST_F(PopClientTest, TheMailPollFetchesEveryPopTimeMinutes) {
+  LoopbackPeer server;
+  config.pop_hosts = "a:x@127.0.0.1:" + std::to_string(server.port);
+  link_up = 1;
+  ++server_now;
+  pop_client_poll();  // pop.time 0: never by time
+  EXPECT_EQ(hooks.pop_client_count(), 0);
+  config.pop_time = 5;
+  pop_client_poll();
+  EXPECT_EQ(hooks.pop_client_count(), 1);
+  net_close_all();
+  server_now += 300;
+  pop_client_poll();  // not yet due
+  EXPECT_EQ(hooks.pop_client_count(), 0);
+  ++server_now;
+  pop_client_poll();
+  EXPECT_EQ(hooks.pop_client_count(), 1);
+  net_close_all();
+}
+
 }  // namespace
 }  // namespace velmor
