@@ -11,7 +11,7 @@
 #include <chrono>
 #include <ctime>
 #include <deque>
-#include <set>
+#include <map>
 #include <unordered_map>
 #include <utility>
 
@@ -45,7 +45,9 @@ constexpr std::size_t kMaxUnsettled = 64;
 class PopClientSession;
 
 struct PopClient {
-  std::set<std::string> busy;  // accounts with a connection (user, host and port)
+  // Accounts with a connection (user, host and port): the serial of the
+  // session that holds each, which alone may free it.
+  std::map<std::string, std::uint64_t> busy;
   std::unordered_map<std::uint64_t, PopClientSession*> live;  // by serial, for the commits
   std::uint64_t next_serial = 1;
   std::time_t next_run = 0;
@@ -73,6 +75,7 @@ class PopClientSession final : public Session {
   void on_close(Connection& c, CloseReason reason) override;
   // The group commit has run for message `number`.
   void committed(std::uint32_t number, int error);
+  std::uint64_t serial() const { return serial_; }
 
  private:
   enum class Command { greeting, user, pass, capa, stat, retr, dele, quit };
@@ -116,6 +119,7 @@ class PopClientSession final : public Session {
   int retrs_out_ = 0;          // RETR commands not yet answered in full
   bool stopping_ = false;      // ask for nothing more; settle and QUIT
   bool quit_sent_ = false;
+  bool released_ = false;
 
   // The message arriving.
   std::uint32_t number_ = 0;
@@ -130,9 +134,13 @@ class PopClientSession final : public Session {
   std::uint32_t fetched_ = 0;
 };
 
+// Once, at the close or (for a session never connected) at its end: by
+// the time the session itself goes, a new run may hold the account.
 void PopClientSession::release() {
+  if (released_) return;
+  released_ = true;
   client().live.erase(serial_);
-  client().busy.erase(key_);
+  if (auto it = client().busy.find(key_); it != client().busy.end() && it->second == serial_) client().busy.erase(it);
   discard_unsettled();
   if (client().live.empty() && (status_bits & status::pop_client_running))
     status_bits = (status_bits & ~status::pop_client_running) | status::pop_client_ended | status::changed;
@@ -488,8 +496,9 @@ int pop_fetch_run() {
     }
     std::string host = a.host;
     std::uint16_t port = a.port;
-    pc.busy.insert(key);
-    if (connect_to(svc::pop_client, host, port, pop_client_session(std::move(a)))) ++started;
+    auto session = std::make_unique<PopClientSession>(std::move(a));
+    pc.busy[key] = session->serial();
+    if (connect_to(svc::pop_client, host, port, std::move(session))) ++started;
   }
   if (started) status_bits |= status::pop_client_running | status::changed;
   return started;

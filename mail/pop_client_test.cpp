@@ -210,6 +210,13 @@ TEST_F(PopClientTest, ARunConnectsEachAccountOnceWhileTheLinkIsUp) {
   EXPECT_EQ(hooks.pop_client_count(), 2);
   EXPECT_NE(status_bits & status::pop_client_running, 0u);
   EXPECT_EQ(pop_fetch_run(), 0);  // both still fetching
+  {
+    // Another session of the same account ending (an old one that goes
+    // after a new run began) does not free the account.
+    TestLink old(pop_client_session(PopAccount{"a", "x", "127.0.0.1", server.port, false}));
+    old.finish();
+  }
+  EXPECT_EQ(pop_fetch_run(), 0);
   net_close_all();
   EXPECT_EQ(status_bits & status::pop_client_running, 0u);
   EXPECT_NE(status_bits & status::pop_client_ended, 0u);
