@@ -113,15 +113,6 @@ TEST_F(PopClientTest, WithoutPipeliningOneCommandAtATimeAndSeveralMessagesShareA
   EXPECT_EQ(queued().size(), 2u);
 }
 
-TEST_F(PopClientTest, AKeptAccountDeletesNothing) {
-  auto link = connect(true);
-  link->feed(login(true, 2));
-  link->take();
-  link->feed("+OK\r\nSubject: 2\r\n\r\n.\r\n+OK\r\nSubject: 1\r\n\r\n.\r\n");
-  EXPECT_EQ(link->take(), "QUIT\r\n");
-  EXPECT_EQ(queued().size(), 2u);
-}
-
 TEST_F(PopClientTest, NothingIsDeletedThatIsNotSafelyQueued) {
   // The commit's sync fails: no file, no DELE, and no more asked for.
   auto link = connect();
@@ -151,15 +142,6 @@ TEST_F(PopClientTest, NothingIsDeletedThatIsNotSafelyQueued) {
 }
 
 TEST_F(PopClientTest, ADroppedConnectionLeavesNoPartialFileAndDeletesNothing) {
-  // Dropped in the middle of a message.
-  auto link = connect();
-  link->feed(login(true, 2));
-  link->take();
-  link->feed("+OK\r\nSubject: 2\r\n\r\nhalf a bo");
-  link->vanish();
-  EXPECT_TRUE(link->closed());
-  EXPECT_TRUE(everything().empty());
-
   // Dropped with a whole message waiting for its batch: nothing was
   // deleted for it, so it is dropped too (the next run fetches it).
   auto second = connect();
