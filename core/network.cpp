@@ -68,6 +68,7 @@ struct Slot {
   std::uint32_t generation = 0;  // tells a reused descriptor from its predecessor
   std::uint64_t connection = 0;  // the connection on it, or 0 ...
   std::function<void()> ready;   // ... a raw descriptor's callback
+  std::function<void()> writable;  // and its one writable wait
   bool watched = false;
   std::uint32_t events = 0;
 };
@@ -123,6 +124,13 @@ class Network final : public ConnectionHost {
     return s;
   }
   bool set_events(int fd, Slot& s, std::uint32_t ev);
+  // Forgets a raw descriptor's slot (out of the epoll set too).
+  void drop_raw(int fd) {
+    Slot* s = slot(fd);
+    if (!s || s->connection) return;
+    if (s->watched) epoll_ctl(epoll_fd, EPOLL_CTL_DEL, fd, nullptr);
+    *s = Slot{};
+  }
   void sync(Connection& c);
   Connection& add(std::unique_ptr<Connection> c, int fd, bool counted);
   const ServiceDescriptor* service(int number) const {
@@ -530,7 +538,7 @@ void net_close_all() {
     if (it != n.entries.end()) it->second.connection->close_now(CloseReason::shutdown);
   }
   for (std::size_t fd = 0; fd < n.slots.size(); ++fd)
-    if (n.slots[fd].ready) unwatch(static_cast<int>(fd));
+    if (n.slots[fd].ready || n.slots[fd].writable) unwatch(static_cast<int>(fd));
   n.released.clear();
 }
 
@@ -569,10 +577,25 @@ void net_pass(int timeout_ms) {
     Slot* s = n.slot(fd);
     // A descriptor closed earlier in this pass may already serve another.
     if (!s || s->generation != static_cast<std::uint32_t>(ev.data.u64 >> 32)) continue;
-    if (s->ready) {
-      auto ready = s->ready;  // the callback may unwatch its own descriptor
+    if (s->ready || s->writable) {
       progress_code = 140106;
-      guarded("descriptor handler", ready);
+      const std::uint32_t generation = s->generation;
+      if (s->writable && (ev.events & (EPOLLOUT | EPOLLERR | EPOLLHUP))) {
+        auto writable = std::move(s->writable);  // one wait, one call
+        s->writable = nullptr;
+        n.set_events(fd, *s, s->ready ? std::uint32_t{EPOLLIN} : 0u);
+        guarded("descriptor handler", writable);
+        s = n.slot(fd);  // the callback may have unwatched or reused it
+        if (!s || s->generation != generation) continue;
+        if (!s->ready && !s->writable) {
+          n.drop_raw(fd);  // nothing waits on it any more
+          continue;
+        }
+      }
+      if (s->ready && (ev.events & (EPOLLIN | EPOLLERR | EPOLLHUP))) {
+        auto ready = s->ready;  // the callback may unwatch its own descriptor
+        guarded("descriptor handler", ready);
+      }
       continue;
     }
     auto it = n.entries.find(s->connection);
@@ -643,12 +666,31 @@ void every_tick(std::function<void()> hook) { net().tick_hooks.push_back(std::mo
 bool watch_readable(int fd, std::function<void()> ready) {
   auto& n = net();
   if (fd < 0 || !n.ensure_epoll()) return false;
-  if (Slot* old = n.slot(fd); old && (old->connection || old->ready)) return false;
-  Slot& s = n.claim(fd);
+  Slot* old = n.slot(fd);
+  if (old && (old->connection || old->ready)) return false;
+  Slot& s = old && old->writable ? *old : n.claim(fd);
   s.ready = std::move(ready);
-  if (!n.set_events(fd, s, EPOLLIN)) {
+  if (!n.set_events(fd, s, EPOLLIN | (s.writable ? std::uint32_t{EPOLLOUT} : 0u))) {
     serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
-    s = Slot{};
+    s.ready = nullptr;
+    if (!s.writable) n.drop_raw(fd);
+    return false;
+  }
+  return true;
+}
+
+bool watch_writable(int fd, std::function<void()> ready) {
+  auto& n = net();
+  if (fd < 0 || !ready || !n.ensure_epoll()) return false;
+  Slot* s = n.slot(fd);
+  if (s && s->connection) return false;
+  // A slot still registered (its last wait is being answered) is kept.
+  if (!s || (!s->ready && !s->writable && !s->watched)) s = &n.claim(fd);
+  s->writable = std::move(ready);
+  if (!n.set_events(fd, *s, (s->ready ? std::uint32_t{EPOLLIN} : 0u) | EPOLLOUT)) {
+    serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
+    s->writable = nullptr;
+    if (!s->ready) n.drop_raw(fd);
     return false;
   }
   return true;
@@ -657,9 +699,8 @@ bool watch_readable(int fd, std::function<void()> ready) {
 void unwatch(int fd) {
   auto& n = net();
   Slot* s = n.slot(fd);
-  if (!s || !s->ready) return;
-  if (s->watched) epoll_ctl(n.epoll_fd, EPOLL_CTL_DEL, fd, nullptr);
-  *s = Slot{};
+  if (!s || (!s->ready && !s->writable)) return;
+  n.drop_raw(fd);
 }
 
 // ---- connections ----------------------------------------------------------------------

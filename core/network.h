@@ -140,6 +140,12 @@ void run_after_pass();
 // "Call this when this descriptor is readable" for datagram and other raw
 // descriptors the caller owns. false when it cannot be watched.
 bool watch_readable(int fd, std::function<void()> ready);
+// "Call this once when this descriptor can be written" (a datagram socket
+// whose reader's queue was full): the wait ends with the call; ask again to
+// wait again. The descriptor may also be watched for reading. false when it
+// cannot be watched.
+bool watch_writable(int fd, std::function<void()> ready);
+// Stops watching a raw descriptor, for reading and writing.
 void unwatch(int fd);
 
 // ---- connections -----------------------------------------------------------------

@@ -41,6 +41,7 @@
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/pop_client.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
 #include "mail/smtp_server.h"
@@ -89,6 +90,7 @@ std::string service_title(std::string_view name) {
 void register_services() {
   pop_register();
   smtp_register();
+  pop_client_register();  // outward only: no listener
 }
 
 // "SMTP 2525, POP3 1110": the built services with their default ports.

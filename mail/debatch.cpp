@@ -1,7 +1,9 @@
 // Debatching: one incoming file is checked against the sender's group
 // limits, every recipient is resolved through the alias table, local
 // recipients get the message in their mailbox and outside ones a file of the
-// outgoing queue. The recipients of a file are handled one per step, and the
+// outgoing queue (fetched mail excepted: it reaches local mailboxes only,
+// and a fetched message nobody local receives goes to oddments). The
+// recipients of a file are handled one per step, and the
 // poll works for a bounded time, so a message for many never holds up the
 // connections. Each mailbox and each outside address gets one copy however
 // often it is named. The incoming file is deleted only when every copy made
@@ -26,6 +28,7 @@
 #include "mail/alias.h"
 #include "mail/delivery.h"
 #include "mail/mailbox.h"
+#include "mail/pop_client.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
@@ -150,6 +153,12 @@ class Debatch final : public QueueSink {
 
   void deliver_remote(std::string_view address) override {
     if (moved || !remote_.emplace(address).second) return;
+    if (env_.fetched) {
+      // Fetched mail is the site's own, collected from its providers: sent
+      // out again it would go back where it came from, and come back.
+      log_message("Fetched mail not sent on to ", address, logfac::maildebatch);
+      return;
+    }
     std::string_view domain = address_domain(address);
     if (!domain.empty() && config.smtp_direct && wildcard_match(domain, *config.smtp_direct)) {
       send_direct(address);
@@ -465,7 +474,9 @@ bool debatch_recipient(Debatch& d) {
   }
   RecipientResult to = route_recipient(address, d);
   if (to.route == RecipientRoute::unknown_user) {
-    d.error(strprintf("Local user %s does not exist\r\n", to.local.c_str()), {});
+    // A fetched message's sender is the site's own account at a provider:
+    // nobody there is told; unless delivered, it goes to oddments.
+    if (!d.env_.fetched) d.error(strprintf("Local user %s does not exist\r\n", to.local.c_str()), {});
   } else if (to.route == RecipientRoute::no_administrator) {
     // Kept for the operator rather than bounced: postmaster must reach someone.
     log_write("Mail debatch: postmaster mail has nobody to go to (no postmaster alias, and admin.email names no user)",
@@ -485,6 +496,9 @@ void debatch_finish(Debatch& d) {
   const std::string& path = d.path_;
   if (d.moved) {
     filecache_close(d.file_);
+  } else if (d.failure.empty() && d.env_.fetched && d.copies == 0) {
+    filecache_close(d.file_);
+    mail_move_to_oddments(path, "Fetched mail for no local user");
   } else if (d.failure.empty()) {
     filecache_close(d.file_);
     filecache_delete(path);
@@ -646,6 +660,7 @@ void mail_poll() {
   // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
   mailbox_upkeep(Clock::now() + kUpkeepSlice);
+  pop_client_poll();  // the timed fetch, while the link is up
 }
 
 bool mail_background() {

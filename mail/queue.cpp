@@ -15,6 +15,7 @@
 #include "core/config.h"
 #include "core/globals.h"
 #include "core/log.h"
+#include "core/network.h"
 #include "core/strfmt.h"
 #include "core/textfile.h"
 #include "core/util.h"
@@ -179,18 +180,23 @@ PendingIncoming queue_open_incoming_pending() {
 namespace {
 struct Commit {
   std::string path, hidden;
-  int owner;
+  std::function<void(int error)> done;
 };
 std::vector<Commit> g_commits;
 }  // namespace
 
-void queue_commit_later(std::string path, std::string hidden, int owner) {
-  g_commits.push_back({std::move(path), std::move(hidden), owner});
+void queue_commit_later(std::string path, std::string hidden, std::function<void(int error)> done) {
+  g_commits.push_back({std::move(path), std::move(hidden), std::move(done)});
 }
 
 bool queue_commit_pending() { return !g_commits.empty(); }
 
-void queue_commit(const std::function<void(int owner, int error)>& done) {
+void queue_commit_register() {
+  // Each service that commits asks; a second hook finds nothing left to do.
+  after_pass([] { queue_commit(); });
+}
+
+void queue_commit() {
   std::vector<Commit> batch;
   batch.swap(g_commits);
   if (batch.empty()) return;
@@ -221,7 +227,7 @@ void queue_commit(const std::function<void(int owner, int error)>& done) {
       log_write(strprintf("Mail queue: %s not queued: %s", batch[i].path.c_str(), error_text(errors[i]).c_str()),
                 logchan::errors);
     }
-    done(batch[i].owner, errors[i]);
+    if (batch[i].done) batch[i].done(errors[i]);
   }
 }
 

@@ -79,23 +79,29 @@ enum class ErrorMail {
 ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file,
                           bool headers_only = false);
 
-// Incoming files committed in groups (the SMTP server): the message is
-// written to its hidden name and flushed without a sync of its own; one
-// commit then syncs the file system once, renames every finished file into
-// place and syncs the folder once, so a burst of messages costs two syncs in
-// all rather than two each. Nothing is acknowledged before its commit.
+// Incoming files committed in groups (the SMTP server, the POP3 client):
+// the message is written to its hidden name and flushed without a sync of
+// its own; one commit then syncs the file system once, renames every
+// finished file into place and syncs the folder once, so a burst of
+// messages costs two syncs in all rather than two each. Nothing is
+// acknowledged (or deleted at its source) before its commit. The commit
+// runs after the loop's pass (queue_commit_register).
 struct PendingIncoming {
   CacheFile file;         // writes go to the hidden name
   std::string path;       // the final name
   std::string hidden;     // the name it is written under
 };
 PendingIncoming queue_open_incoming_pending();
-// Queues a flushed file for the next commit; `owner` identifies who waits.
-void queue_commit_later(std::string path, std::string hidden, int owner);
+// Queues a flushed file for the next commit; `done(error)` is called when it
+// has run (error 0: the file is in place, durable and in the incoming list;
+// otherwise the hidden file is gone). Whoever waits for `done` and may go
+// away first must make it harmless (it is called in any case).
+void queue_commit_later(std::string path, std::string hidden, std::function<void(int error)> done);
 bool queue_commit_pending();
-// Runs the commit; `done(owner, error)` is called for each file (error 0:
-// the file is in place, durable and in the incoming list).
-void queue_commit(const std::function<void(int owner, int error)>& done);
+// Runs the commit for every file queued so far.
+void queue_commit();
+// Has the loop run the commit after every pass.
+void queue_commit_register();
 
 // Keeps a queue file for the recipients still to do: `first_line`, these
 // recipients and the message from its DATA line are written under the

@@ -123,7 +123,7 @@ std::string mail_date_text(std::time_t t) { return date_text(t, "%a, %d %b %Y %H
 
 void MessageReceiver::end_of_header(std::string& out) {
   in_header_ = false;
-  if (date_seen_) return;
+  if (date_seen_ || !add_date) return;
   out += "Date: ";
   out += mail_date_text(now ? now : std::time(nullptr));
   out += "\r\n";

@@ -87,6 +87,7 @@ class MessageReceiver {
   bool done() const { return done_; }
   bool date_added() const { return date_added_; }
   std::time_t now = 0;  // for the generated Date header (0: time(nullptr))
+  bool add_date = true;  // false: the header is kept as it came (fetched mail)
 
  private:
   void end_of_header(std::string& out);

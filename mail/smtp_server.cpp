@@ -428,7 +428,14 @@ void SmtpSession::finish_message(Connection& c) {
   }
   serial_ = server().next_serial++;
   server().waiting[serial_] = this;
-  queue_commit_later(queue_path_, queue_hidden_, static_cast<int>(serial_));
+  queue_commit_later(queue_path_, queue_hidden_, [serial = serial_](int error) {
+    auto& waiting = server().waiting;
+    auto it = waiting.find(serial);
+    if (it == waiting.end()) return;  // its connection has closed meanwhile
+    SmtpSession* s = it->second;
+    waiting.erase(it);
+    s->committed(error);
+  });
   state_ = State::committing;
   c.pause_input();
 }
@@ -440,19 +447,6 @@ void SmtpSession::committed(int error) {
   if (!conn_) return;
   conn_->send(error == 0 ? "250 OK\r\n" : kLocalError);
   conn_->resume_input();
-}
-
-// After every pass: one commit for every message finished in it.
-void commit_pending() {
-  if (!queue_commit_pending()) return;
-  queue_commit([](int owner, int error) {
-    auto& waiting = server().waiting;
-    auto it = waiting.find(static_cast<std::uint64_t>(owner));
-    if (it == waiting.end()) return;  // its connection has closed meanwhile
-    SmtpSession* s = it->second;
-    waiting.erase(it);
-    s->committed(error);
-  });
 }
 
 }  // namespace
@@ -473,7 +467,7 @@ void smtp_register() {
       .line_limit = kMaxCommandLine,
       .line_ends = LineEnds::cr_too,
   });
-  after_pass(commit_pending);
+  queue_commit_register();  // one commit for every message finished in a pass
 }
 
 }  // namespace velmor
