@@ -29,7 +29,7 @@ std::time_t transfer_started = 0;
 
 void start_transfer() {
   run(hooks.popkick);
-  run(hooks.smtpkick);
+  if (hooks.smtpkick) hooks.smtpkick();
 }
 
 // A suite without the mail clients has nothing to wait for: the link is
@@ -42,7 +42,7 @@ int internal_command(std::string_view word) {
   log_message("Internal command: ", word);
   static const std::pair<std::string_view, std::function<void()> SuiteHooks::*> words[] = {
       {"connect", &SuiteHooks::dial},          {"disconnect", &SuiteHooks::disconnect},
-      {"popkick", &SuiteHooks::popkick},       {"smtpkick", &SuiteHooks::smtpkick},
+      {"popkick", &SuiteHooks::popkick},       {"smtpkick", nullptr},
       {"newskick", &SuiteHooks::newskick},     {"mailrescan", &SuiteHooks::mailrescan},
       {"maildebatch", &SuiteHooks::maildebatch}, {"newsdebatch", &SuiteHooks::newsdebatch},
       {"mailtransfer", nullptr},
@@ -51,6 +51,7 @@ int internal_command(std::string_view word) {
     if (!str_iequals(word, name)) continue;
     if (name == "connect") mail_transfer_state = 0;
     if (name == "mailtransfer") mail_transfer_state = 4;
+    if (name == "smtpkick" && hooks.smtpkick) hooks.smtpkick();
     if (hook) run(hooks.*hook);
     return 1;
   }

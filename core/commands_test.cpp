@@ -22,7 +22,10 @@ class CommandsTest : public ::testing::Test {
     hooks.dial = note("dial");
     hooks.disconnect = note("disconnect");
     hooks.popkick = note("popkick");
-    hooks.smtpkick = note("smtpkick");
+    hooks.smtpkick = [this] {
+      calls.push_back("smtpkick");
+      return true;
+    };
     hooks.newskick = note("newskick");
     hooks.mailrescan = note("mailrescan");
     hooks.maildebatch = note("maildebatch");
@@ -105,7 +108,8 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   EXPECT_EQ(calls.back(), "disconnect");
 
   // Without the mail clients nothing can start: no grace.
-  hooks.popkick = hooks.smtpkick = nullptr;
+  hooks.popkick = nullptr;
+  hooks.smtpkick = nullptr;
   mail_transfer_state = 5;
   mail_transfer_poll();
   mail_transfer_poll();

@@ -19,7 +19,7 @@ struct SuiteHooks {
   std::function<void()> dial;          // "connect"
   std::function<void()> disconnect;    // "disconnect"
   std::function<void()> popkick;       // POP3 client fetch check now
-  std::function<void()> smtpkick;      // SMTP client on the outgoing queue now
+  std::function<bool()> smtpkick;      // SMTP client on the outgoing queue now (true: a connection started)
   std::function<void()> newskick;      // news fetch for all servers
   std::function<void()> mailrescan;    // rescan incoming, then outgoing
   std::function<void()> maildebatch;   // debatch one incoming file now

@@ -39,6 +39,7 @@
 #include "dns/service.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
+#include "mail/smtp_client.h"
 #include "mail/smtp_server.h"
 #include "users/admin.h"
 
@@ -463,6 +464,7 @@ int start_and_run() {
   // The services, in the order their listeners open.
   pop_register();
   smtp_register();
+  smtp_client_register();
   log_message("Starting listening sockets");
   // Without its control channel the suite could not be steered, and a
   // squatter on the path would get what local tools send: no start.

@@ -30,6 +30,7 @@
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
+#include "mail/smtp_client.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -650,6 +651,7 @@ void mail_poll() {
   // A slice per poll, bounded in time; while files wait, mail_background()
   // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
+  smtp_client_poll();
   mailbox_upkeep(Clock::now() + kUpkeepSlice);
 }
 
