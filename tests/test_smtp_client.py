@@ -134,6 +134,8 @@ class SmtpClientTest(unittest.TestCase):
         return int(out.split('\n')[0][3:]) if rc == 0 else 0
 
     def sink(self, address, *options):
+        if not os.path.exists(SINK):
+            self.skipTest('smtp-sink (package postfix) is not installed')
         s = Sink(address, *options)
         self.addCleanup(s.close)
         return s
