@@ -26,10 +26,14 @@ int count(const std::function<int()>& hook) { return hook ? hook() : 0; }
 // transfer is over once this long has passed, so the link is not held open.
 constexpr std::time_t kStartGrace = 60;
 std::time_t transfer_started = 0;
+bool transfer_started_nothing = false;
 
-void start_transfer() {
+// False when the kicks are known to have started no client (a fetch kick
+// that cannot tell counts as having started one).
+bool start_transfer() {
   run(hooks.popkick);
-  if (hooks.smtpkick) hooks.smtpkick();
+  bool started = hooks.smtpkick && hooks.smtpkick();
+  return started || hooks.popkick;
 }
 
 // A suite without the mail clients has nothing to wait for: the link is
@@ -74,11 +78,11 @@ void mail_transfer_poll() {
       log_message("Mail transfer - connected, and starting transfer");
       mail_transfer_state = 2;
       transfer_started = server_now;
-      start_transfer();
+      transfer_started_nothing = !start_transfer();
       break;
     case 2:
       if (count(hooks.pop_client_count) || count(hooks.smtp_client_count) || no_mail_clients() ||
-          server_now - transfer_started >= kStartGrace)
+          transfer_started_nothing || server_now - transfer_started >= kStartGrace)
         mail_transfer_state = 3;
       break;
     case 3:

@@ -107,8 +107,16 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   EXPECT_EQ(mail_transfer_state, 0);
   EXPECT_EQ(calls.back(), "disconnect");
 
-  // Without the mail clients nothing can start: no grace.
+  // A kick that says it started nothing needs no grace either.
   hooks.popkick = nullptr;
+  hooks.smtpkick = [] { return false; };
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+
+  // Without the mail clients nothing can start: no grace.
   hooks.smtpkick = nullptr;
   mail_transfer_state = 5;
   mail_transfer_poll();
