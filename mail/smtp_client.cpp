@@ -52,6 +52,18 @@ std::string lower(std::string_view s) {
 
 void note_running();
 
+// Does an EHLO reply offer this extension (the first word of a line)?
+bool offers(std::string_view reply, std::string_view extension) {
+  while (!reply.empty()) {
+    std::string_view line = reply.substr(0, reply.find('\n'));
+    reply.remove_prefix(std::min(reply.size(), line.size() + 1));
+    if (line.size() < 4) continue;
+    line.remove_prefix(4);
+    if (str_iequals(line.substr(0, line.find(' ')), extension)) return true;
+  }
+  return false;
+}
+
 // ---- routes ------------------------------------------------------------------
 
 struct Route {
@@ -295,7 +307,7 @@ class SmtpClientSession final : public Session {
   void on_close(Connection& c, CloseReason reason) override;
 
  private:
-  enum class Step { greeting, helo, mail, rcpt, data, dot, rset, quit };
+  enum class Step { greeting, ehlo, helo, mail, rcpt, data, dot, rset, quit };
 
   void answer(Connection& c);
   void next_message(Connection& c);
@@ -314,6 +326,8 @@ class SmtpClientSession final : public Session {
   int id_;
   bool turned_;
   bool reached_ = false;  // the server greeted us
+  bool pipelining_ = false;  // MAIL, RCPT and DATA go out together
+  bool mail_ok_ = false;     // the transaction's MAIL was taken
   Step step_ = Step::greeting;
   SmtpReply reply_;
   std::unique_ptr<Message> msg_;
@@ -356,9 +370,17 @@ void SmtpClientSession::answer(Connection& c) {
         return;
       }
       reached_ = true;
-      c.send("HELO " + text_of(config.server_name) + "\r\n");
-      step_ = Step::helo;
+      c.send("EHLO " + text_of(config.server_name) + "\r\n");
+      step_ = Step::ehlo;
       return;
+    case Step::ehlo:
+      if (kind == 5) {  // an older server: plain HELO
+        c.send("HELO " + text_of(config.server_name) + "\r\n");
+        step_ = Step::helo;
+        return;
+      }
+      pipelining_ = kind == 2 && offers(reply_.text(), "PIPELINING");
+      [[fallthrough]];
     case Step::helo:
       if (kind != 2) {
         quit(c);
@@ -367,24 +389,30 @@ void SmtpClientSession::answer(Connection& c) {
       next_message(c);
       return;
     case Step::mail:
-      if (kind == 2) {
-        step_ = Step::rcpt;
-        send_rcpt(c);
+      mail_ok_ = kind == 2;
+      step_ = Step::rcpt;
+      if (mail_ok_) {
+        if (!pipelining_) send_rcpt(c);
         return;
       }
       for (std::size_t i = 0; i < msg_->recipients.size(); ++i)
         if (!refused(c, i, "MAIL FROM")) return;
-      settle(c, true);
+      if (!pipelining_) settle(c, true);
       return;
     case Step::rcpt: {
+      // After a refused MAIL, the replies to the commands sent behind it
+      // say nothing about the recipients.
       std::size_t i = msg_->next_rcpt++;
-      if (kind == 2) {
+      if (!mail_ok_) {
+      } else if (kind == 2) {
         msg_->accepted.push_back(i);
       } else if (!refused(c, i, "RCPT TO")) {
         return;
       }
       if (msg_->next_rcpt < msg_->recipients.size()) {
-        send_rcpt(c);
+        if (!pipelining_) send_rcpt(c);
+      } else if (pipelining_) {
+        step_ = Step::data;
       } else if (msg_->accepted.empty()) {
         settle(c, true);
       } else {
@@ -397,10 +425,16 @@ void SmtpClientSession::answer(Connection& c) {
     case Step::dot: {
       const bool at_data = step_ == Step::data;
       if (at_data && reply_.code() == 354) {
-        send_body(c);
+        if (!msg_->accepted.empty()) {
+          send_body(c);
+        } else {
+          // A pipelined DATA taken with nobody to send to: an empty end.
+          c.send(".\r\n");
+          step_ = Step::dot;
+        }
         return;
       }
-      if (!at_data && kind == 2) {
+      if (!at_data && kind == 2 && !msg_->accepted.empty()) {
         log_write(strprintf("SMTP client: %s sent to %s", msg_->path.c_str(), c.peer().text.c_str()), logchan::mail);
         msg_->accepted.clear();
         settle(c, false);
@@ -493,7 +527,12 @@ void SmtpClientSession::next_message(Connection& c) {
       continue;
     }
     msg_ = std::move(m);
-    c.send("MAIL FROM:<" + msg_->sender + ">\r\n");
+    std::string commands = "MAIL FROM:<" + msg_->sender + ">\r\n";
+    if (pipelining_) {
+      for (const std::string& r : msg_->recipients) commands += "RCPT TO:<" + r + ">\r\n";
+      commands += "DATA\r\n";
+    }
+    c.send(commands);
     step_ = Step::mail;
     return;
   }

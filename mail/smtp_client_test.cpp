@@ -62,7 +62,7 @@ class SmtpClientTest : public QueueFixture {
   std::unique_ptr<TestLink> greeted() {
     auto link = std::make_unique<TestLink>(smtp_turn_session());
     link->feed("220 there\r\n");
-    EXPECT_EQ(link->take(), "HELO here.example\r\n");
+    EXPECT_EQ(link->take(), "EHLO here.example\r\n");
     link->feed("250 hi\r\n");
     return link;
   }
@@ -74,8 +74,8 @@ TEST_F(SmtpClientTest, RepliesAreReadWholeAndTheFileGoesOnlyAfterTheDot) {
   std::string path = queue("1", message("bob@far.example", "Subject: hi\r\n\r\n..dot\r\nend\r\n"));
   TestLink link(smtp_turn_session());
   link.feed("220-there\r\n220-more\r\n220 ready\r\n", 1);
-  EXPECT_EQ(link.take(), "HELO here.example\r\n");
-  link.feed("250-hi\r\n250-PIPELINING\r\n250 SIZE\r\n", 4);
+  EXPECT_EQ(link.take(), "EHLO here.example\r\n");
+  link.feed("250-hi\r\n250-8BITMIME\r\n250 SIZE\r\n", 4);
   EXPECT_EQ(link.take(), "MAIL FROM:<ann@site.example>\r\n");
   link.feed("250 ok\r", 1);
   link.feed("\n");
@@ -170,6 +170,39 @@ TEST_F(SmtpClientTest, RefusalsBeforeTheDataResetTheTransaction) {
   auto mails = error_mails();
   ASSERT_EQ(mails.size(), 1u);
   EXPECT_NE(mails[0].find("after DATA"), std::string::npos);
+}
+
+// A server that offers PIPELINING gets MAIL, RCPT and DATA at once; the
+// replies are matched in order, and after a refused MAIL those behind it
+// say nothing about the recipients. One that knows no EHLO gets HELO.
+TEST_F(SmtpClientTest, PipelinedCommandsAreSettledByTheirRepliesInOrder) {
+  std::string first = queue("1", message("a@x.example"));
+  std::string second = queue("2", message("b@x.example,c@x.example"));
+  TestLink link(smtp_turn_session());
+  link.feed("220 there\r\n");
+  EXPECT_EQ(link.take(), "EHLO here.example\r\n");
+  link.feed("250-there\r\n250-PIPELINING\r\n250 8BITMIME\r\n");
+  EXPECT_EQ(link.take(), "MAIL FROM:<ann@site.example>\r\nRCPT TO:<a@x.example>\r\nDATA\r\n");
+  link.feed("451 try later\r\n503 need MAIL\r\n503 need RCPT\r\n");
+  EXPECT_EQ(link.take(), "RSET\r\n");
+  EXPECT_TRUE(exists(first));
+  link.feed("250 ok\r\n");
+  EXPECT_EQ(link.take(),
+            "MAIL FROM:<ann@site.example>\r\nRCPT TO:<b@x.example>\r\nRCPT TO:<c@x.example>\r\nDATA\r\n");
+  link.feed("250 ok\r\n550 unknown\r\n250 ok\r\n354 go\r\n", 3);
+  EXPECT_EQ(link.take(), "Subject: hi\r\n\r\nhello\r\n.\r\n");
+  link.feed("250 ok\r\n");
+  EXPECT_FALSE(exists(second));
+  EXPECT_EQ(error_mails().size(), 1u);
+  EXPECT_TRUE(error_mails()[0].find("(b@x.example)") != std::string::npos);
+  EXPECT_TRUE(error_mails()[0].find("(c@x.example)") == std::string::npos);
+
+  TestLink old(smtp_turn_session());
+  old.feed("220 there\r\n");
+  old.feed("500 what?\r\n");
+  EXPECT_EQ(old.take(), "EHLO here.example\r\nHELO here.example\r\n");
+  old.feed("250 hi\r\n");
+  EXPECT_EQ(old.take(), "QUIT\r\n");  // the first file is held by the other connection
 }
 
 // Only whole queue files go: the others move to oddments with their reason;
@@ -280,7 +313,7 @@ TEST_F(SmtpClientTest, TurnHandsTheQueueToAllowedPeersOnly) {
   TestLink link(svc::smtp, allowed);
   link.take();
   link.feed("HELO peer\r\nTURN\r\n220 peer ready\r\n");
-  EXPECT_EQ(link.take(), "250 Hello peer, how's life?\r\n250 OK\r\nHELO here.example\r\n");
+  EXPECT_EQ(link.take(), "250 Hello peer, how's life?\r\n250 OK\r\nEHLO here.example\r\n");
   link.feed("250 hi\r\n");
   EXPECT_EQ(link.take(), "MAIL FROM:<ann@site.example>\r\n");
   EXPECT_EQ(smtp_client_count(), 1);
