@@ -22,6 +22,7 @@ class SmtpClientTest : public QueueFixture {
  protected:
   void SetUp() override {
     QueueFixture::SetUp();
+    queue_outgoing_entries().clear();  // entries another test left held
     config.server_name = "here.example";
     smtp_client_reset();
     smtp_client_register();
