@@ -126,6 +126,18 @@ void end_route(const std::string& key, bool failed) {
 
 void connect_next(const std::string& key);
 
+// Every message of a route no connection holds goes back to its sender.
+void return_route(const std::string& key, const std::string& text) {
+  auto it = client().routes.find(key);
+  if (it == client().routes.end()) return;
+  const std::string name = it->second.name;
+  std::vector<std::string> paths;
+  for (const OutgoingEntry& e : queue_outgoing_entries())
+    if (e.holder < 0 && str_iequals(e.route, name)) paths.push_back(e.path);
+  end_route(key, false);
+  for (const std::string& p : paths) return_to_sender(p, text);
+}
+
 void mx_answered(const std::string& key, int id, MxAnswer answer) {
   Client& cl = client();
   auto it = cl.routes.find(key);
@@ -136,20 +148,19 @@ void mx_answered(const std::string& key, int id, MxAnswer answer) {
   switch (answer.result) {
     case MxResult::found:
       r.hosts = std::move(answer.hosts);
+      // A lone mail exchanger named "." says the domain takes no mail.
+      if (r.hosts.size() == 1 && (r.hosts[0].empty() || r.hosts[0] == ".")) {
+        return_route(key, "SMTP Mail delivery failed.\nThe domain " + r.name + " accepts no mail.\n");
+        return;
+      }
       break;
     case MxResult::none:
       r.hosts = {r.name};
       break;
-    case MxResult::no_such_domain: {
+    case MxResult::no_such_domain:
       log_message("SMTP client: no such domain: ", r.name, logfac::smtp);
-      std::vector<std::string> paths;
-      for (const OutgoingEntry& e : queue_outgoing_entries())
-        if (e.holder < 0 && str_iequals(e.route, r.name)) paths.push_back(e.path);
-      std::string text = "SMTP Mail delivery failed.\nThe domain " + r.name + " does not exist.\n";
-      end_route(key, false);
-      for (const std::string& p : paths) return_to_sender(p, text);
+      return_route(key, "SMTP Mail delivery failed.\nThe domain " + r.name + " does not exist.\n");
       return;
-    }
     case MxResult::failed:
       log_message("SMTP client: mail exchanger lookup failed: ", r.name, logfac::smtp);
       end_route(key, true);

@@ -256,7 +256,7 @@ TEST_F(SmtpClientTest, AnEntryTakenByOneConnectionIsNotSentByAnother) {
 // it has them; a domain that does not exist gets its mail back at once.
 TEST_F(SmtpClientTest, RunsGoToTheRelayOrTheMailExchangersOncePerRoute) {
   config.smtp_hosts = "relay.example";
-  config.smtp_direct = "direct.example, nxd.example, plain.example";
+  config.smtp_direct = "direct.example, nxd.example, plain.example, nomail.example";
   std::vector<std::string> asked, mx_asked;
   std::vector<std::function<void(MxAnswer)>> mx_pending;
   net_set_resolver({.start = [&](std::string_view name, std::function<void(std::uint32_t)> done) {
@@ -274,15 +274,19 @@ TEST_F(SmtpClientTest, RunsGoToTheRelayOrTheMailExchangersOncePerRoute) {
   queue("2", message("b@direct.example"));
   std::string gone = queue("3", message("c@nxd.example"));
   queue("4", message("d@plain.example"));
+  std::string refused = queue("5", message("e@nomail.example"));
   EXPECT_TRUE(hooks.smtpkick());
   EXPECT_FALSE(hooks.smtpkick());  // every route is being served
-  EXPECT_EQ(hooks.smtp_client_count(), 4);
-  EXPECT_EQ(mx_asked, (std::vector<std::string>{"direct.example", "nxd.example", "plain.example"}));
+  EXPECT_EQ(hooks.smtp_client_count(), 5);
+  EXPECT_EQ(mx_asked,
+            (std::vector<std::string>{"direct.example", "nxd.example", "plain.example", "nomail.example"}));
   mx_pending[0]({MxResult::found, {"mx1.direct.example", "mx2.direct.example"}});
   mx_pending[1]({MxResult::no_such_domain, {}});
   mx_pending[2]({MxResult::none, {}});
+  mx_pending[3]({MxResult::found, {""}});  // a null mail exchanger: no mail taken
   EXPECT_FALSE(exists(gone));
-  EXPECT_EQ(error_mails().size(), 1u);
+  EXPECT_FALSE(exists(refused));
+  EXPECT_EQ(error_mails().size(), 2u);
   for (int i = 0; i < 10 && hooks.smtp_client_count() > 0; ++i) net_pass(0);
   EXPECT_EQ(hooks.smtp_client_count(), 0);
   std::sort(asked.begin(), asked.end());
@@ -294,6 +298,19 @@ TEST_F(SmtpClientTest, RunsGoToTheRelayOrTheMailExchangersOncePerRoute) {
   smtp_client_poll();
   EXPECT_EQ(hooks.smtp_client_count(), 0);
   EXPECT_TRUE(hooks.smtpkick());
+  ASSERT_EQ(mx_pending.size(), 6u);
+  mx_pending[4]({MxResult::failed, {}});
+  mx_pending[5]({MxResult::failed, {}});
+  for (int i = 0; i < 10 && hooks.smtp_client_count() > 0; ++i) net_pass(0);
+  EXPECT_EQ(hooks.smtp_client_count(), 0);
+  // Every smtp.time minutes otherwise.
+  config.smtp_time = 2;
+  server_now += 119;
+  smtp_client_poll();
+  EXPECT_EQ(hooks.smtp_client_count(), 0);
+  server_now += 2;
+  smtp_client_poll();
+  EXPECT_EQ(hooks.smtp_client_count(), 3);
   link_up = 0;
   smtp_client_reset();
   EXPECT_FALSE(hooks.smtpkick());
