@@ -6,11 +6,12 @@
 # so its time is a ceiling; the suite reads, checks and deletes every file.
 # Prints both times and the ratio.
 #
-#   bench/smtp_client.sh            COUNT=2000 SIZE=4096 by default
+#   bench/smtp_client.sh            COUNT=2000 SIZE=4096 ROUNDS=3 by default (best of the rounds)
 set -eu
 
 COUNT=${COUNT:-2000}
 SIZE=${SIZE:-4096}
+ROUNDS=${ROUNDS:-3}
 HERE=$(cd "$(dirname "$0")/.." && pwd)
 BUILD=${BUILD:-$HERE/build-bench}
 SINK_ADDR=${SINK_ADDR:-127.53.251.25}
@@ -85,13 +86,21 @@ for line in lines:
 out += ['%%%s: %s' % kv for kv in keys.items()]
 with open(master, 'w') as f:
     f.write('\n'.join(out))
+PY
+# Fills the outgoing queue with COUNT messages of SIZE bytes.
+fill_queue() {
+  python3 - "$VROOT/mail/out" "$COUNT" "$SIZE" <<'PY'
+import os, sys
+outdir, count, size = sys.argv[1], int(sys.argv[2]), int(sys.argv[3])
 body = ('Subject: bench\r\n\r\n' + ('x' * 76 + '\r\n') * (size // 78)).encode()
-outdir = os.path.join(root, 'mail/out')
 os.makedirs(outdir, exist_ok=True)
 for i in range(count):
     with open(os.path.join(outdir, str(1000000 + i)), 'wb') as f:
         f.write(b'MAIL FROM:<bench@client.example>\r\nRCPT TO:<rcpt@remote.example>\r\nDATA\r\n' + body + b'.\r\n')
 PY
+}
+seconds() { python3 -c "import sys; print('%.3f' % (float(sys.argv[2]) - float(sys.argv[1])))" "$1" "$2"; }
+best() { printf '%s\n' "$@" | sort -n | head -1; }
 "$VELMOR" --root "$VROOT" --bind 127.0.0.1 >/dev/null 2>&1 &
 VPID=$!
 python3 - "$CTL" "$VROOT" <<'PY'
@@ -105,27 +114,39 @@ while time.time() < deadline:
 sys.exit("the suite did not see the link come up")
 PY
 
-start=$(date +%s.%N)
-"$CTL" --root "$VROOT" smtpkick >/dev/null
-python3 - "$VROOT/mail/out" <<'PY'
+# Each side runs ROUNDS times; the best time counts (a busy machine only
+# ever makes a run slower).
+SUITE_TIMES= SOURCE_TIMES=
+round=0
+while [ "$round" -lt "$ROUNDS" ]; do
+  round=$((round + 1))
+  fill_queue
+  "$CTL" --root "$VROOT" mailrescan >/dev/null
+  start=$(date +%s.%N)
+  "$CTL" --root "$VROOT" smtpkick >/dev/null
+  python3 - "$VROOT/mail/out" <<'PY'
 import os, sys, time
 deadline = time.time() + 600
 while os.listdir(sys.argv[1]):
     if time.time() > deadline:
         sys.exit("the queue did not empty")
-    time.sleep(0.01)
+    time.sleep(0.005)
 PY
-end=$(date +%s.%N)
-SUITE=$(python3 -c "import sys; print('%.3f' % (float(sys.argv[2]) - float(sys.argv[1])))" "$start" "$end")
+  end=$(date +%s.%N)
+  SUITE_TIMES="$SUITE_TIMES $(seconds "$start" "$end")"
 
-# ---- smtp-source, one session --------------------------------------------------------
-start=$(date +%s.%N)
-"$SOURCE" -s 1 -d -m "$COUNT" -l "$SIZE" -f bench@client.example -t rcpt@remote.example \
-  -M client.example "$SINK_ADDR:25" >/dev/null
-end=$(date +%s.%N)
-SOURCE_TIME=$(python3 -c "import sys; print('%.3f' % (float(sys.argv[2]) - float(sys.argv[1])))" "$start" "$end")
+  start=$(date +%s.%N)
+  "$SOURCE" -s 1 -d -m "$COUNT" -l "$SIZE" -f bench@client.example -t rcpt@remote.example \
+    -M client.example "$SINK_ADDR:25" >/dev/null
+  end=$(date +%s.%N)
+  SOURCE_TIMES="$SOURCE_TIMES $(seconds "$start" "$end")"
+done
+# shellcheck disable=SC2086
+SUITE=$(best $SUITE_TIMES)
+# shellcheck disable=SC2086
+SOURCE_TIME=$(best $SOURCE_TIMES)
 
-echo "$COUNT messages of $SIZE bytes into smtp-sink over one connection"
+echo "$COUNT messages of $SIZE bytes into smtp-sink over one connection, best of $ROUNDS"
 echo "velmor SMTP client (reads, checks and deletes each queue file): ${SUITE} s"
 echo "smtp-source (no queue; the ceiling):                          ${SOURCE_TIME} s"
 python3 -c "import sys; print('ratio velmor/smtp-source: %.2f' % (float(sys.argv[1]) / float(sys.argv[2])))" \
