@@ -765,4 +765,18 @@ Connection* connect_to(int service, std::string_view host, std::uint16_t port, s
 
 void net_set_resolver(NameResolver resolver) { net().resolver = std::move(resolver); }
 
+std::uint64_t net_lookup_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done) {
+  auto& n = net();
+  if (!n.resolver.mail_exchangers) {
+    done(MxAnswer{});
+    return 0;
+  }
+  return n.resolver.mail_exchangers(domain, std::move(done));
+}
+
+void net_cancel_lookup(std::uint64_t handle) {
+  auto& n = net();
+  if (handle && n.resolver.cancel) n.resolver.cancel(handle);
+}
+
 }  // namespace velmor

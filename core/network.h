@@ -167,10 +167,27 @@ Connection* connect_to(int service, std::string_view host, std::uint16_t port, s
 // `start` calls `done` once with the address (network order; 0 = failed),
 // possibly before it returns, and gives a handle (0 when it ended at once);
 // `cancel` drops a lookup still running.
+// `mail_exchangers` looks up a domain's mail hosts the same way.
+enum class MxResult {
+  found,           // `hosts` holds them, lowest preference first
+  none,            // the domain exists and has no mail exchanger
+  no_such_domain,  // the name does not exist
+  failed,          // no usable answer (time-out, link down, no resolver)
+};
+struct MxAnswer {
+  MxResult result = MxResult::failed;
+  std::vector<std::string> hosts{};
+};
 struct NameResolver {
   std::function<std::uint64_t(std::string_view name, std::function<void(std::uint32_t)> done)> start{};
   std::function<void(std::uint64_t handle)> cancel{};
+  std::function<std::uint64_t(std::string_view domain, std::function<void(MxAnswer)> done)> mail_exchangers{};
 };
 void net_set_resolver(NameResolver resolver);
+// A domain's mail exchangers through the resolver: `done` is called once,
+// possibly before this returns (then 0 is returned), else the handle of
+// the lookup, which net_cancel_lookup drops without calling `done`.
+std::uint64_t net_lookup_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done);
+void net_cancel_lookup(std::uint64_t handle);
 
 }  // namespace velmor

@@ -44,6 +44,7 @@
 #include "mail/pop_client.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
+#include "mail/smtp_client.h"
 #include "mail/smtp_server.h"
 #include "users/admin.h"
 
@@ -91,6 +92,7 @@ void register_services() {
   pop_register();
   smtp_register();
   pop_client_register();  // outward only: no listener
+  smtp_client_register();
 }
 
 // "SMTP 2525, POP3 1110": the built services with their default ports.

@@ -33,6 +33,7 @@
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
 #include "mail/recipient.h"
+#include "mail/smtp_client.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -659,6 +660,7 @@ void mail_poll() {
   // A slice per poll, bounded in time; while files wait, mail_background()
   // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
+  smtp_client_poll();
   mailbox_upkeep(Clock::now() + kUpkeepSlice);
   pop_client_poll();  // the timed fetch, while the link is up
 }

@@ -304,6 +304,13 @@ void queue_scan_outgoing() {
 
 const std::list<std::string>& queue_incoming() { return g_incoming; }
 const std::list<OutgoingEntry>& queue_outgoing() { return g_outgoing; }
+std::list<OutgoingEntry>& queue_outgoing_entries() { return g_outgoing; }
+
+void queue_drop_outgoing(const std::string& path) {
+  auto before = g_outgoing.size();
+  g_outgoing.remove_if([&](const OutgoingEntry& e) { return e.path == path; });
+  if (g_outgoing.size() != before) status_bits |= status::mail_queue_changed;
+}
 
 // A message half written when the suite stopped was never acknowledged;
 // the counters start from the clock.

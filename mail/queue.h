@@ -27,8 +27,9 @@ struct OutgoingEntry {
   std::string recipients;  // joined by ", "
   std::time_t mtime = 0;
   std::int64_t size = 0;
-  // Descriptor of the connection sending this file (-1 none): a rescan never
-  // drops an entry that a live connection holds.
+  // The SMTP client connection that has taken this file (-1 none), until
+  // that connection ends: no other connection sends it meanwhile, and a
+  // rescan never drops it.
   int holder = -1;
 };
 

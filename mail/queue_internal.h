@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <ctime>
 #include <functional>
+#include <list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -13,6 +14,7 @@
 
 #include "core/filecache.h"
 #include "mail/mailfile.h"
+#include "mail/queue.h"
 
 namespace velmor {
 
@@ -117,6 +119,11 @@ void queue_file_discard(CacheFile& file);
 
 // Text made safe as message lines: CR LF line ends, dot-stuffed.
 std::string mail_body_lines(std::string_view text);
+
+// The outgoing list for the SMTP client, which claims entries (`holder`)
+// and drops the entry of a file it has delivered or returned.
+std::list<OutgoingEntry>& queue_outgoing_entries();
+void queue_drop_outgoing(const std::string& path);
 
 // Start-up of the queue itself: name counters from `now`, unfinished
 // hidden files removed.

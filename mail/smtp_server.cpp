@@ -27,6 +27,7 @@
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
 #include "mail/recipient.h"
+#include "mail/smtp_client.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -35,6 +36,7 @@ namespace velmor {
 namespace {
 
 constexpr std::size_t kEchoMax = 200;  // of a client's text echoed in a reply
+constexpr std::size_t kMaxReplyLine = 2048;  // once the roles have swapped
 const char* const kLocalError = "451 Requested action aborted: local error in processing\r\n";
 const char* const kTooBig = "552 Message size exceeds fixed maximum message size\r\n";
 
@@ -60,7 +62,10 @@ class SmtpSession final : public Session {
 
   void on_open(Connection& c) override;
   void on_input(Connection& c) override;
-  void on_close(Connection& c, CloseReason) override;
+  void on_close(Connection& c, CloseReason reason) override;
+  void on_drained(Connection& c) override {
+    if (turned_) turned_->on_drained(c);
+  }
   // The group commit has run for this session's message.
   void committed(int error);
 
@@ -117,6 +122,7 @@ class SmtpSession final : public Session {
   bool oversize_ = false;         // the message outgrew the limit: its data is dropped
   MessageReceiver receiver_;
   std::string chunk_;
+  std::unique_ptr<Session> turned_;  // the client role, after TURN
 };
 
 void SmtpSession::on_open(Connection& c) {
@@ -132,8 +138,12 @@ void SmtpSession::on_open(Connection& c) {
 }
 
 void SmtpSession::on_input(Connection& c) {
+  if (turned_) {
+    turned_->on_input(c);
+    return;
+  }
   mail_note_traffic();
-  while (!c.closed()) {
+  while (!c.closed() && !turned_) {
     if (state_ == State::committing) return;
     if (state_ == State::data) {
       data_phase(c);
@@ -150,9 +160,12 @@ void SmtpSession::on_input(Connection& c) {
     }
     if (!line.empty()) command(c, line);
   }
+  // The peer's greeting may have come with the TURN.
+  if (turned_ && !c.closed()) turned_->on_input(c);
 }
 
-void SmtpSession::on_close(Connection&, CloseReason) {
+void SmtpSession::on_close(Connection& c, CloseReason reason) {
+  if (turned_) turned_->on_close(c, reason);
   // A message waiting for its commit is still committed (it was received
   // whole), but nobody waits for the answer.
   if (serial_) server().waiting.erase(serial_);
@@ -380,9 +393,20 @@ void SmtpSession::command(Connection& c, std::string_view line) {
   } else if (str_iequals(verb, "vrfy")) {
     vrfy(c, arg);
   } else if (str_iequals(verb, "turn")) {
-    // Reversing the connection needs the outgoing client role, which this
-    // server does not offer; no peer can take our queue this way.
-    c.send("502 TURN not available\r\n");
+    // Only a peer we relay for may take the queue: the roles swap, and from
+    // now on this connection is an SMTP client waiting for their greeting.
+    if (!address_list_match(config.smtp_allow, c.peer().ip)) {
+      c.send("502 TURN not available\r\n");
+      return;
+    }
+    discard();
+    c.send("250 OK\r\n");
+    log_write(strprintf("%llu - TURN: sending the queue to %s", static_cast<unsigned long long>(c.id()),
+                        c.peer().text.c_str()),
+              logchan::mail);
+    c.set_line_limit(kMaxReplyLine);
+    turned_ = smtp_turn_session();
+    turned_->on_open(c);
   } else {
     c.send("500 Unknown command:" + std::string(verb) + "\r\n");
   }
