@@ -37,6 +37,7 @@
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/imap_server.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
 #include "mail/smtp_server.h"
@@ -461,6 +462,7 @@ int start_and_run() {
   mail_init();
   complete_admin_email();
   // The services, in the order their listeners open.
+  imap_register();
   pop_register();
   smtp_register();
   log_message("Starting listening sockets");
