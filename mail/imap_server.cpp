@@ -371,11 +371,20 @@ void write_appended(Writer& w, ByteSource& raw, std::uint32_t flags, std::uint32
   for (std::uint64_t pos = 0; pos < raw.size();) {
     Line line = read_line(raw, pos, 64);
     if (line.length == 0) break;
-    std::uint64_t len = line.length;
+    // What is needed of the line's text is taken before the source is read
+    // again (a later view may replace the text).
+    const std::uint64_t len = line.length;
+    const char first = line.text.front();
+    const bool folded = first == ' ' || first == '\t';
+    const bool state = header && !folded && state_line(line.text, true);
+    std::string tail(len <= line.text.size() ? line.text.substr(line.text.size() - std::min<std::size_t>(line.text.size(), 2))
+                                             : raw.view(pos + len - 2, 2));
     std::uint64_t content = len;
-    std::string_view tail = raw.view(pos + len - std::min<std::uint64_t>(len, 2), 2);
-    if (tail.size() == 2 && tail[1] == '\n') content -= tail[0] == '\r' ? 2 : 1;
-    else if (!tail.empty() && tail.back() == '\n') content -= 1;
+    if (tail.size() == 2 && tail[1] == '\n') {
+      content -= tail[0] == '\r' ? 2 : 1;
+    } else if (!tail.empty() && tail.back() == '\n') {
+      content -= 1;
+    }
     if (header) {
       if (content == 0) {
         header = false;
@@ -383,14 +392,13 @@ void write_appended(Writer& w, ByteSource& raw, std::uint32_t flags, std::uint32
         pos += len;
         continue;
       }
-      bool folded = line.text.front() == ' ' || line.text.front() == '\t';
-      if (!folded) dropping = state_line(line.text, true);
+      if (!folded) dropping = state;
       if (dropping) {
         pos += len;
         continue;
       }
     }
-    if (line.text.front() == '.') w.put(".");
+    if (first == '.') w.put(".");
     w.copy(raw, pos, content);
     w.put("\r\n");
     pos += len;
@@ -1656,7 +1664,7 @@ void ImapSession::cmd_expunge(Connection& c, const std::string& tag, Args&, bool
     return;
   }
   sync(c, true);
-  c.send(tag + " OK EXPUNGE completed\r\n");
+  c.send(strprintf("* %zu EXISTS\r\n", view_.size()) + tag + " OK EXPUNGE completed\r\n");
 }
 
 void ImapSession::cmd_store(Connection& c, const std::string& tag, Args& a, bool uid) {
