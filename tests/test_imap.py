@@ -146,8 +146,7 @@ class RoundTrip(ImapSuite):
         validity = m.response('UIDVALIDITY')[1][0]
         m.store('1', '+FLAGS', '(\\Flagged \\Draft)')
         m.store('2', '+FLAGS', '(\\Answered \\Seen)')
-        m.logout()
-        self.suite.stop()
+        self.suite.stop()  # with the client still connected
         self.suite.start()
         m = self.imap()
         m.select('INBOX')
@@ -388,6 +387,9 @@ class BadInput(ImapSuite):
         s.setsockopt(socket.IPPROTO_TCP, socket.TCP_NODELAY, 1)
         for i in range(len(msg)):
             s.send(msg[i:i + 1])
+            if i == 40:
+                self.send(make_message('meanwhile'))  # a delivery in the middle of the literal
+                self.debatch(2)
         s.sendall(b'\r\n')
         self.assertEqual(f.readline(), b'b OK APPEND completed\r\n')
         before = open(self.inbox, 'rb').read()
@@ -397,11 +399,14 @@ class BadInput(ImapSuite):
         self.assertEqual(f2.readline(), b'l OK LOGIN completed\r\n')
         self.assertEqual(f2.readline(), b'+ Ready for message body\r\n')
         s2.sendall(b'Subject: half\r\n\r\n' + b'x' * 1000)
+        f2.close()
         s2.close()
         m = self.imap()
         m.select('INBOX')
-        self.assertEqual(m.search(None, 'ALL'), ('OK', [b'1 2']))
-        self.assertEqual(fetch_one(m, '2', 'BODY.PEEK[TEXT]'), split_message(msg)[1])
+        self.assertEqual(m.search(None, 'ALL'), ('OK', [b'1 2 3']))
+        self.assertIn(b'Subject: meanwhile', fetch_one(m, '2', 'BODY.PEEK[HEADER]'))
+        self.assertEqual(fetch_one(m, '3', 'BODY.PEEK[TEXT]'), split_message(msg)[1])
+        self.assertEqual(m.fetch('3', '(UID FLAGS)')[1], [b'3 (UID 3 FLAGS (\\Seen \\Recent))'])
         self.assertEqual(open(self.inbox, 'rb').read(), before)
 
     def test_huge_ranges_on_a_big_mailbox(self):
