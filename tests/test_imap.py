@@ -155,7 +155,7 @@ class RoundTrip(ImapSuite):
                          [b'1 (FLAGS (\\Flagged \\Draft))', b'2 (FLAGS (\\Seen \\Answered))'])
         # A change reaches the overview within a second, so a kill keeps it.
         m.store('3', '+FLAGS', '(\\Deleted)')
-        wait_for(lambda: b'#flags 3 ' in self.overview(), timeout=5)
+        self.assertTrue(wait_for(lambda: b'#flags 3 ' in self.overview(), timeout=5))
         self.suite.kill()
         os.unlink(self.suite.pid_file)  # what a kill leaves behind
         self.suite.start()
@@ -349,6 +349,53 @@ class OtherClients(ImapSuite):
         before = self.maildir(local)
         run()
         self.assertEqual(self.maildir(local), before)
+
+    def test_neomutt_reads_and_saves(self):
+        if not shutil.which('neomutt') or not shutil.which('tmux'):
+            self.skipTest('neomutt or tmux missing')
+        self.send(make_message('for neomutt'))
+        work = tempfile.mkdtemp(prefix='velmor-neomutt-')
+        self.addCleanup(shutil.rmtree, work, True)
+        rc = os.path.join(work, 'rc')
+        with open(rc, 'w') as f:
+            f.write("set folder='imap://alice@127.0.0.1:%d/'\nset spoolfile='+INBOX'\n"
+                    "set imap_pass='%s'\nset imap_authenticators='login'\nset ssl_starttls=no\n"
+                    "set ssl_force_tls=no\nset confirmcreate=no\nset confirmappend=no\nset wait_key=no\n"
+                    "set imap_check_subscribed=no\nset mail_check=1\nset record=''\nset move=no\n"
+                    % (self.suite.port('imap'), TRICKY))
+        session = 'velmor-neomutt-%d' % os.getpid()
+        env = dict(os.environ, HOME=work, TERM='xterm')
+        subprocess.run(['tmux', 'new-session', '-d', '-s', session, '-x', '160', '-y', '40',
+                        'neomutt -n -F ' + rc], env=env, check=True)
+        self.addCleanup(subprocess.run, ['tmux', 'kill-session', '-t', session], stderr=subprocess.DEVNULL)
+
+        def screen():
+            return subprocess.run(['tmux', 'capture-pane', '-p', '-t', session], stdout=subprocess.PIPE,
+                                  text=True).stdout
+
+        def keys(*k):
+            subprocess.run(['tmux', 'send-keys', '-t', session] + list(k), check=True)
+
+        self.assertTrue(wait_for(lambda: 'for neomutt' in screen(), timeout=20), screen())
+        keys('Enter')
+        self.assertTrue(wait_for(lambda: 'From here on the body goes on' in screen(), timeout=20))
+        keys('s')
+        self.assertTrue(wait_for(lambda: 'Save to mailbox' in screen(), timeout=20))
+        keys('C-u', '=mail/saved', 'Enter')
+        saved = os.path.join(self.home, 'mail', 'saved')
+
+        def stored():
+            try:
+                with open(saved, 'rb') as f:
+                    return b'Subject: for neomutt' in f.read()
+            except FileNotFoundError:
+                return False
+        self.assertTrue(wait_for(stored, timeout=20))
+        keys('q')
+        keys('q')
+        m = self.imap()
+        self.assertEqual(m.select('mail/saved'), ('OK', [b'1']))
+        self.assertEqual(m.fetch('1', '(FLAGS)')[1], [b'1 (FLAGS (\\Seen \\Recent))'])
 
 
 class BadInput(ImapSuite):
