@@ -7,19 +7,14 @@ a SINCE UID SEARCH. Prints both times and their ratio.
 Run through bench/imap.sh, which installs Dovecot when it is missing."""
 
 import os
-import shutil
 import socket
-import subprocess
 import sys
-import tempfile
 import time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, HERE)
-sys.path.insert(0, os.path.join(os.path.dirname(HERE), 'tests'))
-from harness import Suite, VELMOR_BIN, free_port  # noqa: E402
 import pop3_bench  # noqa: E402
-from pop3_bench import PASSWORD, dovecot_maildir, make_messages, velmor_mailbox  # noqa: E402
+from pop3_bench import PASSWORD, make_messages, run_dovecot, run_velmor  # noqa: E402
 
 MESSAGES = int(os.environ.get('IMAP_BENCH_MESSAGES', '5000'))
 ROUNDS = int(os.environ.get('IMAP_BENCH_ROUNDS', '3'))
@@ -125,93 +120,10 @@ def best_of(port, user, label):
     return min(times)
 
 
-def run_velmor(messages):
-    suite = Suite(config={'mail.domains': 'example.test', 'imap.sock.timeout': '300'})
-    try:
-        home = suite.path('home/bench')
-        Suite._run([VELMOR_BIN, '--root', suite.root, '--adduser', 'bench', '--password', PASSWORD,
-                    '--home', home])
-        os.makedirs(os.path.join(home, 'mail'), exist_ok=True)
-        with open(os.path.join(home, 'mail', 'inbox'), 'wb') as f:
-            f.write(velmor_mailbox(messages))
-        suite.start()
-        return best_of(suite.port('imap'), 'bench', 'velmor')
-    finally:
-        suite.stop()
-        suite.cleanup()
-
-
-def run_dovecot(messages):
-    dovecot = shutil.which('dovecot') or '/usr/sbin/dovecot'
-    work = tempfile.mkdtemp(prefix='velmor-bench-dovecot-')
-    os.chmod(work, 0o755)  # the mail processes run as nobody
-    proc = None
-    try:
-        home = os.path.join(work, 'home', 'bench')
-        dovecot_maildir(messages, os.path.join(home, 'Maildir'))
-        subprocess.run(['chown', '-R', 'nobody:nogroup', os.path.join(work, 'home')], check=True)
-        port = free_port()
-        conf = os.path.join(work, 'dovecot.conf')
-        with open(conf, 'w') as f:
-            f.write('''base_dir = {w}/run
-state_dir = {w}/state
-log_path = {w}/dovecot.log
-protocols = imap
-listen = 127.0.0.1
-ssl = no
-disable_plaintext_auth = no
-auth_mechanisms = plain
-mail_location = maildir:~/Maildir
-passdb {{
-  driver = static
-  args = password={p}
-}}
-userdb {{
-  driver = static
-  args = uid=nobody gid=nogroup home={w}/home/%u
-}}
-service imap-login {{
-  inet_listener imap {{
-    address = 127.0.0.1
-    port = {port}
-  }}
-  inet_listener imaps {{
-    port = 0
-  }}
-}}
-service pop3-login {{
-  inet_listener pop3 {{
-    port = 0
-  }}
-}}
-'''.format(w=work, p=PASSWORD, port=port))
-        os.makedirs(os.path.join(work, 'state'), exist_ok=True)
-        proc = subprocess.Popen([dovecot, '-F', '-c', conf], stdout=subprocess.DEVNULL, stderr=subprocess.STDOUT)
-        deadline = time.monotonic() + 20
-        while True:
-            try:
-                socket.create_connection(('127.0.0.1', port), timeout=1).close()
-                break
-            except OSError:
-                if time.monotonic() > deadline or proc.poll() is not None:
-                    raise RuntimeError('dovecot did not start; see ' + os.path.join(work, 'dovecot.log'))
-                time.sleep(0.1)
-        return best_of(port, 'bench', 'dovecot')
-    finally:
-        if proc is not None:
-            proc.terminate()
-            try:
-                proc.wait(timeout=20)
-            except subprocess.TimeoutExpired:
-                proc.kill()
-        if not os.environ.get('IMAP_BENCH_KEEP'):
-            shutil.rmtree(work, ignore_errors=True)
-
-
 def main():
     messages = with_parts(make_messages(MESSAGES))
-    ours = run_velmor(messages)
-    theirs = run_dovecot(messages)
+    ours = run_velmor(messages, 'imap', best_of, {'imap.sock.timeout': '300'})
+    theirs = run_dovecot(messages, 'imap', best_of)
     print('velmor %.3f s, dovecot %.3f s: velmor takes %.2fx the time of dovecot' % (ours, theirs, ours / theirs))
 
 

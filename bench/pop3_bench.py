@@ -138,8 +138,10 @@ def best_of(port, user, label):
     return min(times)
 
 
-def run_velmor(messages):
-    suite = Suite(config={'mail.domains': 'example.test'})
+def run_velmor(messages, service='pop', read=None, config=None):
+    """Velmor serving the messages as bench's inbox; `read(port, user,
+    label)` times it (best_of by default)."""
+    suite = Suite(config=dict({'mail.domains': 'example.test'}, **(config or {})))
     try:
         home = suite.path('home/bench')
         Suite._run([VELMOR_BIN, '--root', suite.root, '--adduser', 'bench', '--password', PASSWORD,
@@ -148,13 +150,16 @@ def run_velmor(messages):
         with open(os.path.join(home, 'mail', 'inbox'), 'wb') as f:
             f.write(velmor_mailbox(messages))
         suite.start()
-        return best_of(suite.port('pop'), 'bench', 'velmor')
+        return (read or best_of)(suite.port(service), 'bench', 'velmor')
     finally:
         suite.stop()
         suite.cleanup()
 
 
-def run_dovecot(messages):
+def run_dovecot(messages, protocol='pop3', read=None):
+    """A private Dovecot serving the messages over `protocol` ("pop3" or
+    "imap"), timed as run_velmor does."""
+    other = 'imap' if protocol == 'pop3' else 'pop3'
     dovecot = shutil.which('dovecot') or '/usr/sbin/dovecot'
     work = tempfile.mkdtemp(prefix='velmor-bench-dovecot-')
     os.chmod(work, 0o755)  # the mail processes run as nobody
@@ -169,7 +174,7 @@ def run_dovecot(messages):
             f.write('''base_dir = {w}/run
 state_dir = {w}/state
 log_path = {w}/dovecot.log
-protocols = pop3
+protocols = {proto}
 listen = 127.0.0.1
 ssl = no
 disable_plaintext_auth = no
@@ -184,18 +189,21 @@ userdb {{
   driver = static
   args = uid=nobody gid=nogroup home={w}/home/%u
 }}
-service pop3-login {{
-  inet_listener pop3 {{
+service {proto}-login {{
+  inet_listener {proto} {{
     address = 127.0.0.1
     port = {port}
   }}
-}}
-service imap-login {{
-  inet_listener imap {{
+  inet_listener {proto}s {{
     port = 0
   }}
 }}
-'''.format(w=work, p=PASSWORD, port=port))
+service {other}-login {{
+  inet_listener {other} {{
+    port = 0
+  }}
+}}
+'''.format(w=work, p=PASSWORD, port=port, proto=protocol, other=other))
         os.makedirs(os.path.join(work, 'state'), exist_ok=True)
         proc = subprocess.Popen([dovecot, '-F', '-c', conf], stdout=subprocess.DEVNULL, stderr=subprocess.STDOUT)
         deadline = time.monotonic() + 20
@@ -207,7 +215,7 @@ service imap-login {{
                 if time.monotonic() > deadline or proc.poll() is not None:
                     raise RuntimeError('dovecot did not start; see ' + os.path.join(work, 'dovecot.log'))
                 time.sleep(0.1)
-        return best_of(port, 'bench', 'dovecot')
+        return (read or best_of)(port, 'bench', 'dovecot')
     finally:
         if proc is not None:
             proc.terminate()

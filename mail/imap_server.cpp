@@ -504,6 +504,8 @@ class ImapSession final : public Session {
     return str_iequals(name, "INBOX") ? "mail/inbox" : std::string(name);
   }
   bool name_checked(Connection& c, const std::string& tag, std::string_view name, bool folder = false);
+  // The one argument of a command that takes a mailbox name; BAD otherwise.
+  static std::optional<std::string> one_name(Connection& c, const std::string& tag, Args& a);
   Mailbox* open_box(std::string_view name, bool create_inbox);
 
   // Commands.
@@ -1015,6 +1017,13 @@ bool ImapSession::name_checked(Connection& c, const std::string& tag, std::strin
   return false;
 }
 
+std::optional<std::string> ImapSession::one_name(Connection& c, const std::string& tag, Args& a) {
+  auto name = a.astring();
+  if (name && a.end()) return name;
+  c.send(tag + " BAD mailbox name expected\r\n");
+  return std::nullopt;
+}
+
 // The mailbox of a name (INBOX made when missing); nullptr when it is no
 // regular file below the home.
 Mailbox* ImapSession::open_box(std::string_view name, bool create_inbox) {
@@ -1093,11 +1102,8 @@ void ImapSession::cmd_login(Connection& c, const std::string& tag, Args& a, bool
 // ---- commands: mailboxes -------------------------------------------------------------
 
 void ImapSession::select_common(Connection& c, const std::string& tag, Args& a, bool read_only) {
-  auto name = a.astring();
-  if (!name || !a.end()) {
-    c.send(tag + " BAD mailbox name expected\r\n");
-    return;
-  }
+  auto name = one_name(c, tag, a);
+  if (!name) return;
   deselect(c);
   if (!name_checked(c, tag, *name)) return;
   Mailbox* box = open_box(*name, true);
@@ -1135,11 +1141,8 @@ void ImapSession::cmd_select(Connection& c, const std::string& tag, Args& a, boo
 void ImapSession::cmd_examine(Connection& c, const std::string& tag, Args& a, bool) { select_common(c, tag, a, true); }
 
 void ImapSession::cmd_create(Connection& c, const std::string& tag, Args& a, bool) {
-  auto name = a.astring();
-  if (!name || !a.end()) {
-    c.send(tag + " BAD mailbox name expected\r\n");
-    return;
-  }
+  auto name = one_name(c, tag, a);
+  if (!name) return;
   if (str_iequals(*name, "INBOX")) {
     c.send(tag + " NO can't create INBOX\r\n");
     return;
@@ -1172,11 +1175,8 @@ void ImapSession::cmd_create(Connection& c, const std::string& tag, Args& a, boo
 }
 
 void ImapSession::cmd_delete(Connection& c, const std::string& tag, Args& a, bool) {
-  auto name = a.astring();
-  if (!name || !a.end()) {
-    c.send(tag + " BAD mailbox name expected\r\n");
-    return;
-  }
+  auto name = one_name(c, tag, a);
+  if (!name) return;
   if (str_iequals(*name, "INBOX")) {
     c.send(tag + " NO can't delete INBOX\r\n");
     return;
@@ -1271,11 +1271,8 @@ void ImapSession::cmd_rename(Connection& c, const std::string& tag, Args& a, boo
 }
 
 void ImapSession::cmd_subscribe(Connection& c, const std::string& tag, Args& a, bool) {
-  auto name = a.astring();
-  if (!name || !a.end()) {
-    c.send(tag + " BAD mailbox name expected\r\n");
-    return;
-  }
+  auto name = one_name(c, tag, a);
+  if (!name) return;
   if (!name_checked(c, tag, *name)) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
   if (std::find(subscriptions_.begin(), subscriptions_.end(), n) == subscriptions_.end()) subscriptions_.push_back(n);
@@ -1283,11 +1280,8 @@ void ImapSession::cmd_subscribe(Connection& c, const std::string& tag, Args& a, 
 }
 
 void ImapSession::cmd_unsubscribe(Connection& c, const std::string& tag, Args& a, bool) {
-  auto name = a.astring();
-  if (!name || !a.end()) {
-    c.send(tag + " BAD mailbox name expected\r\n");
-    return;
-  }
+  auto name = one_name(c, tag, a);
+  if (!name) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
   auto it = std::find(subscriptions_.begin(), subscriptions_.end(), n);
   if (it == subscriptions_.end()) {

@@ -215,14 +215,23 @@ class OtherClients(ImapSuite):
         self.assertEqual(r.returncode, 0, r.stderr)
         self.assertIn(b'"INBOX"', r.stdout)
 
-    def maildir(self, root):
-        out = {}
+    @staticmethod
+    def maildir_files(root):
+        """(path, name, content) of every message in the Maildir's INBOX."""
         for sub in ('cur', 'new'):
             d = os.path.join(root, 'INBOX', sub)
             for name in os.listdir(d) if os.path.isdir(d) else []:
                 with open(os.path.join(d, name), 'rb') as f:
-                    out[name] = f.read()
-        return out
+                    yield os.path.join(d, name), name, f.read()
+
+    def maildir(self, root):
+        return {name: data for _, name, data in self.maildir_files(root)}
+
+    @staticmethod
+    def mark(root, path, flags):
+        """Gives a Maildir message the flags, as a mail program does."""
+        base = os.path.basename(path).split(':2,')[0]
+        os.rename(path, os.path.join(root, 'INBOX', 'cur', base + ':2,' + flags))
 
     def test_mbsync_both_ways_run_after_run(self):
         if not shutil.which('mbsync'):
@@ -260,13 +269,9 @@ class OtherClients(ImapSuite):
         self.assertEqual({re.sub(rb'X-TUID: .*\n', b'', v) for v in got.values()},
                          {v.replace(b'\r\n', b'\n') for v in server})
         # Flags from the Maildir to the server: mark "first" seen and flagged.
-        for sub in ('cur', 'new'):
-            d = os.path.join(local, 'INBOX', sub)
-            for name in os.listdir(d):
-                with open(os.path.join(d, name), 'rb') as f:
-                    if b'Subject: first' in f.read():
-                        base = name.split(':2,')[0]
-                        os.rename(os.path.join(d, name), os.path.join(local, 'INBOX', 'cur', base + ':2,FS'))
+        for path, _, data in list(self.maildir_files(local)):
+            if b'Subject: first' in data:
+                self.mark(local, path, 'FS')
         sync()
         imap = self.imap()
         imap.select('INBOX')
@@ -280,12 +285,9 @@ class OtherClients(ImapSuite):
         self.assertEqual(len(names), 3)
         [second_name] = [n for n, v in names.items() if b'Subject: second' in v]
         self.assertIn('R', second_name.split(':2,')[1])
-        for sub in ('cur', 'new'):
-            d = os.path.join(local, 'INBOX', sub)
-            for name in os.listdir(d):
-                with open(os.path.join(d, name), 'rb') as f:
-                    if b'Subject: third' in f.read():
-                        os.unlink(os.path.join(d, name))
+        for path, _, data in list(self.maildir_files(local)):
+            if b'Subject: third' in data:
+                os.unlink(path)
         sync()
         imap = self.imap()
         imap.select('INBOX', readonly=True)
@@ -334,11 +336,8 @@ class OtherClients(ImapSuite):
         self.assertEqual(sorted(lines(v) for v in got.values()),
                          sorted(lines(fetch_one(imap, n, 'BODY.PEEK[]')) for n in ('1', '2')))
         imap.logout()
-        for sub in ('cur', 'new'):
-            d = os.path.join(local, 'INBOX', sub)
-            for name in os.listdir(d):
-                base = name.split(':2,')[0]
-                os.rename(os.path.join(d, name), os.path.join(local, 'INBOX', 'cur', base + ':2,S'))
+        for path, _, _ in list(self.maildir_files(local)):
+            self.mark(local, path, 'S')
         self.send(make_message('off three'))
         run()
         self.assertEqual(len(self.maildir(local)), 3)
