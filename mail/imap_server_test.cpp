@@ -52,7 +52,9 @@ class ImapSessionTest : public QueueFixture {
     auto link = std::make_unique<TestLink>(svc::imap);
     EXPECT_TRUE(link->take().starts_with("* OK "));
     EXPECT_EQ(say(*link, "l LOGIN alice secret\r\n"), "l OK LOGIN completed\r\n");
-    if (!select.empty()) EXPECT_NE(say(*link, "s " + std::string(select) + "\r\n").find("s OK ["), std::string::npos);
+    if (!select.empty()) {
+      EXPECT_NE(say(*link, "s " + std::string(select) + "\r\n").find("s OK ["), std::string::npos);
+    }
     return link;
   }
   static std::string say(TestLink& link, std::string_view text, std::size_t piece = 0) {
