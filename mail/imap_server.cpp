@@ -497,6 +497,10 @@ class ImapSession final : public Session {
   // The view positions a set names, ascending; nullopt (BAD) when a message
   // number lies past the end.
   std::optional<std::vector<std::size_t>> resolve(std::string_view set, bool uid_mode);
+  // The same for a command's set, once the view has caught up (expunges
+  // held back); BAD when the set is no good.
+  std::optional<std::vector<std::size_t>> targets_of(Connection& c, const std::string& tag, std::string_view set,
+                                                     bool uid_mode);
 
   // Names.
   std::string path_of(std::string_view name) const { return mailbox_path_for_name(home_, name); }
@@ -1007,6 +1011,14 @@ std::optional<std::vector<std::size_t>> ImapSession::resolve(std::string_view te
     }
   }
   return out;
+}
+
+std::optional<std::vector<std::size_t>> ImapSession::targets_of(Connection& c, const std::string& tag,
+                                                                std::string_view set, bool uid_mode) {
+  sync(c, false);
+  auto targets = resolve(set, uid_mode);
+  if (!targets) c.send(tag + " BAD Invalid message set\r\n");
+  return targets;
 }
 
 // ---- names -------------------------------------------------------------------------
@@ -1580,12 +1592,8 @@ void ImapSession::cmd_copy(Connection& c, const std::string& tag, Args& a, bool 
     c.send(tag + " BAD COPY needs a message set and a mailbox\r\n");
     return;
   }
-  sync(c, false);
-  auto targets = resolve(set, uid);
-  if (!targets) {
-    c.send(tag + " BAD Invalid message set\r\n");
-    return;
-  }
+  auto targets = targets_of(c, tag, set, uid);
+  if (!targets) return;
   if (!name_checked(c, tag, *name)) return;
   copy_target_ = *name;
   copy_targets_ = std::move(*targets);
@@ -1693,12 +1701,8 @@ void ImapSession::cmd_store(Connection& c, const std::string& tag, Args& a, bool
     c.send(tag + " NO STORE failure: mailbox is read-only\r\n");
     return;
   }
-  sync(c, false);
-  auto targets = resolve(set, uid);
-  if (!targets) {
-    c.send(tag + " BAD Invalid message set\r\n");
-    return;
-  }
+  auto targets = targets_of(c, tag, set, uid);
+  if (!targets) return;
   std::string out;
   bool missing = false;
   for (std::size_t i : *targets) {
@@ -1736,12 +1740,8 @@ void ImapSession::cmd_fetch(Connection& c, const std::string& tag, Args& a, bool
     c.send(tag + " BAD FETCH arguments invalid\r\n");
     return;
   }
-  sync(c, false);
-  auto targets = resolve(set, uid);
-  if (!targets) {
-    c.send(tag + " BAD Invalid message set\r\n");
-    return;
-  }
+  auto targets = targets_of(c, tag, set, uid);
+  if (!targets) return;
   stream->tag = tag;
   stream->targets = std::move(*targets);
   stream->uid_mode = uid;
