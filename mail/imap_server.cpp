@@ -1288,7 +1288,7 @@ void ImapSession::cmd_subscribe(Connection& c, const std::string& tag, Args& a, 
   if (!name_checked(c, tag, *name)) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
   if (std::find(subscriptions_.begin(), subscriptions_.end(), n) == subscriptions_.end()) subscriptions_.push_back(n);
-  c.send(tag + " OK SUBSCRIBE completed\r\n");
+  c.send(tag + " OK SUBSCRIBE " + printable(n) + " completed\r\n");
 }
 
 void ImapSession::cmd_unsubscribe(Connection& c, const std::string& tag, Args& a, bool) {
@@ -1301,7 +1301,7 @@ void ImapSession::cmd_unsubscribe(Connection& c, const std::string& tag, Args& a
     return;
   }
   subscriptions_.erase(it);
-  c.send(tag + " OK UNSUBSCRIBE completed\r\n");
+  c.send(tag + " OK UNSUBSCRIBE " + printable(n) + " completed\r\n");
 }
 
 // Every name SELECT takes that matches `pattern`, and the folders on the
@@ -1418,7 +1418,7 @@ void ImapSession::cmd_find(Connection& c, const std::string& tag, Args& a, bool)
   list_names(*pattern, [&](const std::string& name, bool folder) {
     if (!folder) out += "* MAILBOX " + quoted(name) + "\r\n";
   });
-  c.send(out + tag + " OK FIND ALL.MAILBOXES completed\r\n");
+  c.send(out + tag + " OK FIND ALL.MAILBOXES " + printable(path_leaf(*pattern)) + " completed\r\n");
 }
 
 void ImapSession::cmd_status(Connection& c, const std::string& tag, Args& a, bool) {
@@ -1463,7 +1463,7 @@ void ImapSession::cmd_status(Connection& c, const std::string& tag, Args& a, boo
       return;
     }
   }
-  c.send(out + ")\r\n" + tag + " OK STATUS completed\r\n");
+  c.send(out + ")\r\n" + tag + " OK Status completed\r\n");
 }
 
 // ---- storing messages -------------------------------------------------------------

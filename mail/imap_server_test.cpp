@@ -124,6 +124,13 @@ TEST_F(ImapSessionTest, NamesStayInTheHome) {
   EXPECT_EQ(say(*link, "o DELETE mail/work\r\np DELETE mail/done\r\n"),
             "o NO delete failed: no such mailbox\r\np OK delete completed\r\n");
   EXPECT_FALSE(std::filesystem::exists(home + "/mail/overview/done"));
+  // Subscriptions live with the connection; FIND lists the mailboxes alone.
+  EXPECT_EQ(say(*link, "q SUBSCRIBE mail/play\r\nr LSUB \"\" *\r\ns UNSUBSCRIBE mail/play\r\nt UNSUBSCRIBE mail/play\r\n"
+                       "u FIND ALL.MAILBOXES mail/*\r\nv STATUS mail/play (MESSAGES UIDNEXT)\r\n"),
+            "q OK SUBSCRIBE mail/play completed\r\n* LSUB () \"/\" \"mail/play\"\r\nr OK LSUB completed\r\n"
+            "s OK UNSUBSCRIBE mail/play completed\r\nt NO Mailbox not in subscribe list\r\n"
+            "* MAILBOX \"mail/play\"\r\nu OK FIND ALL.MAILBOXES * completed\r\n"
+            "* STATUS \"mail/play\" (MESSAGES 0 UIDNEXT 1)\r\nv OK Status completed\r\n");
 }
 
 TEST_F(ImapSessionTest, FetchStoreAndSequenceSetsCostWhatTheyMatch) {
