@@ -157,6 +157,8 @@ TEST_F(ImapSessionTest, FetchStoreAndSequenceSetsCostWhatTheyMatch) {
   EXPECT_EQ(imap_check::find(items, "BODY[]")->text, plain2);
   EXPECT_NE(out.find("FLAGS (\\Seen)"), std::string::npos) << out;
   EXPECT_EQ(say(*link, "g FETCH 1 BODY[TEXT]\r\n"), "* 1 FETCH (BODY[TEXT] {11}\r\none\r\n.dot\r\n UID 1)\r\ng OK FETCH completed\r\n");
+  // A partial past the end is empty.
+  EXPECT_EQ(say(*link, "h FETCH 2 BODY.PEEK[]<1000.10>\r\n"), "* 2 FETCH (BODY[]<1000> {0}\r\n UID 2)\r\nh OK FETCH completed\r\n");
   // The flags reach the overview by the connection's end at the latest.
   link->finish();
   std::string overview = read_file(home + "/mail/overview/inbox");
