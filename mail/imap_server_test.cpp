@@ -272,15 +272,26 @@ TEST_F(ImapSessionTest, SearchAnswersTruly) {
   EXPECT_EQ(say(*link, "e SEARCH SINCE Feb-2026\r\n"), "e BAD SEARCH arguments invalid\r\n");
 }
 
-TEST_F(ImapSessionTest, UidValidityIsKeptAndNewOnlyForALostOverview) {
+TEST_F(ImapSessionTest, UidValidityIsKeptAndNewOnlyForALostOverviewAndFlagsOutliveARebuild) {
   inbox({message(1, "one\r\n")});
   Mailbox* box = mailbox_lookup(home + "/mail/inbox");
   ASSERT_TRUE(box);
   std::uint32_t validity = box->uid_validity;
   EXPECT_NE(validity, 0u);
+  box->messages.front().flags |= msgflag::flagged | msgflag::draft;
+  mailbox_flags_changed(*box, box->messages.front());
+  ASSERT_EQ(mailbox_overview_flush(*box), 0);
   mailbox_cache_clear();  // a restart
   write_file(home + "/mail/inbox", read_file(home + "/mail/inbox") + message(2, "two\r\n"));
   EXPECT_EQ(mailbox_lookup(home + "/mail/inbox")->uid_validity, validity);
+  // A mailbox changed behind the overview's back is parsed again: the
+  // messages keep their identifiers, flags and validity.
+  mailbox_cache_clear();
+  std::filesystem::last_write_time(home + "/mail/inbox",
+                                   std::filesystem::file_time_type::clock::now() + std::chrono::hours(1));
+  box = mailbox_lookup(home + "/mail/inbox");
+  EXPECT_EQ(box->uid_validity, validity);
+  EXPECT_EQ(box->messages.front().flags & (msgflag::flagged | msgflag::draft), msgflag::flagged | msgflag::draft);
   mailbox_cache_clear();
   std::filesystem::remove(home + "/mail/overview/inbox");
   EXPECT_NE(mailbox_lookup(home + "/mail/inbox")->uid_validity, validity);
