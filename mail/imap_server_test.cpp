@@ -213,6 +213,10 @@ TEST_F(ImapSessionTest, SessionsShareABoxEachInItsOwnViewAndExcludePop3) {
   c.take();
   EXPECT_EQ(say(c, "l LOGIN alice secret\r\ns SELECT INBOX\r\n"),
             "l OK LOGIN completed\r\ns NO [INUSE] mailbox in use by a POP3 session\r\n");
+  c.finish();  // an IMAP session that ends leaves POP3's mark alone
+  TestLink pop2(svc::pop);
+  pop2.take();
+  EXPECT_EQ(say(pop2, "USER alice\r\nPASS secret\r\n").substr(30, 4), "-ERR");
 }
 
 TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
