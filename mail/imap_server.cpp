@@ -56,7 +56,8 @@ constexpr std::chrono::milliseconds kStoreRetry{50};
 constexpr std::size_t kWriteChunk = 1024 * 1024;
 constexpr int kListDepth = 16;
 constexpr std::size_t kListEntries = 10000;
-constexpr std::uint32_t kKept = msgflag::seen | msgflag::answered | msgflag::flagged | msgflag::deleted | msgflag::draft;
+constexpr std::uint32_t kKept =
+    msgflag::seen | msgflag::answered | msgflag::flagged | msgflag::deleted | msgflag::draft;
 const char* const kPermanentFlags = "(\\Answered \\Flagged \\Deleted \\Seen \\Draft)";
 
 std::string short_text(const std::string& value) { return value.substr(0, 200); }
@@ -296,7 +297,9 @@ class ConnectionSink final : public ImapSink {
   ConnectionSink(Connection& c, std::shared_ptr<const UniqueFd> file) : c_(c), file_(std::move(file)) {}
   void text(std::string_view bytes) override { c_.send(bytes); }
   void file_range(std::uint64_t offset, std::uint64_t length, bool unstuff) override {
-    c_.send_file({.file = file_, .offset = offset, .length = length,
+    c_.send_file({.file = file_,
+                  .offset = offset,
+                  .length = length,
                   .transform = unstuff ? FileRange::Transform::dot_unstuff : FileRange::Transform::none,
                   .failure_text = "\r\n* BYE the mailbox could not be read\r\n"});
   }
@@ -358,8 +361,8 @@ std::string status_block(std::uint32_t flags, std::uint32_t uid) {
 // Header lines a copied or appended message loses: what carries mailbox state.
 bool state_line(std::string_view line, bool appended) {
   if (appended) return mailbox_header_dropped(line);
-  return str_istarts_with(line, "Status:") || str_istarts_with(line, "X-Status:") ||
-         str_istarts_with(line, "X-UID:") || str_istarts_with(line, "X-UIDL:");
+  return str_istarts_with(line, "Status:") || str_istarts_with(line, "X-Status:") || str_istarts_with(line, "X-UID:") ||
+         str_istarts_with(line, "X-UIDL:");
 }
 
 // A message as a client gave it (APPEND) in the form delivery stores: its
@@ -377,8 +380,9 @@ void write_appended(Writer& w, ByteSource& raw, std::uint32_t flags, std::uint32
     const char first = line.text.front();
     const bool folded = first == ' ' || first == '\t';
     const bool state = header && !folded && state_line(line.text, true);
-    std::string tail(len <= line.text.size() ? line.text.substr(line.text.size() - std::min<std::size_t>(line.text.size(), 2))
-                                             : raw.view(pos + len - 2, 2));
+    std::string tail(len <= line.text.size()
+                         ? line.text.substr(line.text.size() - std::min<std::size_t>(line.text.size(), 2))
+                         : raw.view(pos + len - 2, 2));
     std::uint64_t content = len;
     if (tail.size() == 2 && tail[1] == '\n') {
       content -= tail[0] == '\r' ? 2 : 1;
@@ -454,8 +458,8 @@ class ImapSession final : public Session {
   struct Entry {
     MessageRecord* rec = nullptr;  // nullptr: expunged by another, not yet reported
     std::uint32_t uid = 0;
-    std::uint64_t offset = 0;      // where it starts in the file the session reads
-    std::uint32_t shown = 0;       // the flags last shown (kKept bits)
+    std::uint64_t offset = 0;  // where it starts in the file the session reads
+    std::uint32_t shown = 0;   // the flags last shown (kKept bits)
     bool recent = false;
   };
 
@@ -493,7 +497,12 @@ class ImapSession final : public Session {
   void remerge();
   void sync(Connection& c, bool expunges);
   bool reopen();
-  std::uint32_t view_flags(const Entry& e) const { return (e.rec ? e.rec->flags & kKept : e.shown) | (e.recent ? msgflag::recent : 0); }
+  std::size_t recent_count() const {
+    return static_cast<std::size_t>(std::count_if(view_.begin(), view_.end(), [](const Entry& e) { return e.recent; }));
+  }
+  std::uint32_t view_flags(const Entry& e) const {
+    return (e.rec ? e.rec->flags & kKept : e.shown) | (e.recent ? msgflag::recent : 0);
+  }
   // The view positions a set names, ascending; nullopt (BAD) when a message
   // number lies past the end.
   std::optional<std::vector<std::size_t>> resolve(std::string_view set, bool uid_mode);
@@ -561,14 +570,14 @@ class ImapSession final : public Session {
   std::vector<std::string> subscriptions_;
 
   // The command being read.
-  std::string cmd_;               // in wire form, literals included
+  std::string cmd_;  // in wire form, literals included
   std::uint64_t literal_left_ = 0;
   std::uint64_t discard_left_ = 0;  // bytes of a refused literal the client sent anyway
-  bool to_file_ = false;          // the literal is an APPEND's message
-  UniqueFd append_file_;          // ... received here
+  bool to_file_ = false;            // the literal is an APPEND's message
+  UniqueFd append_file_;            // ... received here
   std::uint64_t append_size_ = 0;
-  std::string append_head_;       // the APPEND command up to its message
-  std::string append_rest_;       // and what followed it
+  std::string append_head_;  // the APPEND command up to its message
+  std::string append_rest_;  // and what followed it
   Wait wait_ = Wait::none;
   std::string wait_tag_;
 
@@ -888,7 +897,7 @@ void ImapSession::select_box(Connection& c, Mailbox* box, bool read_only) {
   if (!read_only && !box->messages.empty()) box->recent_uid = std::max(box->recent_uid, box->messages.back().uid);
   gone_ = 0;
   announced_ = view_.size();
-  announced_recent_ = static_cast<std::size_t>(std::count_if(view_.begin(), view_.end(), [](const Entry& e) { return e.recent; }));
+  announced_recent_ = recent_count();
 }
 
 void ImapSession::deselect(Connection& c) {
@@ -981,7 +990,7 @@ void ImapSession::sync(Connection& c, bool expunges) {
     announced_ = view_.size();
     strappendf(out, "* %zu EXISTS\r\n", announced_);
   }
-  std::size_t recent = static_cast<std::size_t>(std::count_if(view_.begin(), view_.end(), [](const Entry& e) { return e.recent; }));
+  std::size_t recent = recent_count();
   if (recent != announced_recent_) {
     announced_recent_ = recent;
     strappendf(out, "* %zu RECENT\r\n", recent);
@@ -1005,7 +1014,8 @@ std::optional<std::vector<std::size_t>> ImapSession::resolve(std::string_view te
   auto set = parse_set(text, highest ? highest : 0xffffffffu);
   if (!set) return std::nullopt;
   for (const Range& r : *set) {
-    auto from = std::lower_bound(view_.begin(), view_.end(), r.low, [](const Entry& e, std::uint32_t u) { return e.uid < u; });
+    auto from =
+        std::lower_bound(view_.begin(), view_.end(), r.low, [](const Entry& e, std::uint32_t u) { return e.uid < u; });
     for (auto it = from; it != view_.end() && it->uid <= r.high; ++it) {
       out.push_back(static_cast<std::size_t>(it - view_.begin()));
     }
@@ -1084,8 +1094,7 @@ void ImapSession::cmd_login(Connection& c, const std::string& tag, Args& a, bool
   }
   const UserRecord* user = name->size() <= 64 ? user_find(*name) : nullptr;
   if (!user || password->size() > 256 || user_check_password(user->login, *password) != 0) {
-    log_write("IMAP: Login failed for: " + printable(*name) + " from " + c.peer().text, logchan::main,
-              kLogUnbuffered);
+    log_write("IMAP: Login failed for: " + printable(*name) + " from " + c.peer().text, logchan::main, kLogUnbuffered);
     ++failed_logins_;
     wait_ = Wait::login;
     wait_tag_ = tag;
@@ -1315,7 +1324,7 @@ void ImapSession::list_names(std::string_view pattern, const std::function<void(
   std::size_t pattern_depth = static_cast<std::size_t>(std::count(pattern.begin(), pattern.end(), '/'));
   bool deep = pattern.find('*') != std::string_view::npos;
   std::function<void(const SafeDir&, const std::string&, int)> walk = [&](const SafeDir& dir, const std::string& prefix,
-                                                                         int depth) {
+                                                                          int depth) {
     int fd = ::dup(dir.fd());
     if (fd < 0) return;
     DIR* d = ::fdopendir(fd);
@@ -1449,8 +1458,9 @@ void ImapSession::cmd_status(Connection& c, const std::string& tag, Args& a, boo
     if (str_iequals(item, "MESSAGES")) {
       strappendf(out, "MESSAGES %d", box->count);
     } else if (str_iequals(item, "RECENT")) {
-      std::size_t recent = static_cast<std::size_t>(std::count_if(
-          box->messages.begin(), box->messages.end(), [box](const MessageRecord& m) { return m.uid > box->recent_uid; }));
+      std::size_t recent =
+          static_cast<std::size_t>(std::count_if(box->messages.begin(), box->messages.end(),
+                                                 [box](const MessageRecord& m) { return m.uid > box->recent_uid; }));
       strappendf(out, "RECENT %zu", recent);
     } else if (str_iequals(item, "UIDNEXT")) {
       strappendf(out, "UIDNEXT %u", box->next_uid);
@@ -1478,7 +1488,7 @@ int ImapSession::store_messages(std::string_view name, std::size_t count,
   if (!r.ok()) return r.status == SafeStatus::missing ? ENOENT : r.error;
   Mailbox* box = mailbox_lookup(path_of(name), home_);
   if (!box) return ENOENT;
-  if (box->appending) return EAGAIN;  // delivery is writing a message into it
+  if (box->appending) return EAGAIN;                    // delivery is writing a message into it
   if (int rc = mailbox_commit_staged(*box)) return rc;  // what delivery staged counts first
   for (std::size_t i = 0; i < count; ++i) {
     AppendSlot slot;
@@ -1565,13 +1575,11 @@ void ImapSession::finish_append(Connection& c) {
   if (raw.size() != append_size_) return done(tag + " NO [SERVERBUG] the message could not be kept\r\n");
   std::string separator =
       mailbox_separator("<" + user_ + "@" + text_of(config.server_name) + ">", when ? *when : std::time(nullptr));
-  int rc = store_messages(
-      *name, 1,
-      [&](Writer& w, std::uint32_t uid, std::size_t) {
-        w.put(separator);
-        write_appended(w, raw, flags, uid);
-        return flags;
-      });
+  int rc = store_messages(*name, 1, [&](Writer& w, std::uint32_t uid, std::size_t) {
+    w.put(separator);
+    write_appended(w, raw, flags, uid);
+    return flags;
+  });
   if (rc == EAGAIN) {
     // delivery is writing into the mailbox: a moment later
     wait_ = Wait::store;
@@ -1615,14 +1623,12 @@ void ImapSession::finish_copy(Connection& c) {
     // same mailbox, growing as the copies are written).
     auto file = file_;
     FileSource in(file ? file->get() : -1);
-    rc = !file ? EIO : store_messages(
-        copy_target_, live.size(),
-        [&](Writer& w, std::uint32_t uid, std::size_t k) {
-          const Entry& e = view_[live[k]];
-          std::uint32_t flags = e.rec->flags & kKept;
-          write_copied(w, in, *e.rec, e.offset, flags, uid);
-          return flags;
-        });
+    rc = !file ? EIO : store_messages(copy_target_, live.size(), [&](Writer& w, std::uint32_t uid, std::size_t k) {
+      const Entry& e = view_[live[k]];
+      std::uint32_t flags = e.rec->flags & kKept;
+      write_copied(w, in, *e.rec, e.offset, flags, uid);
+      return flags;
+    });
   } else {
     SafeDir root;
     UniqueFd fd;
@@ -1788,9 +1794,30 @@ void ImapSession::stream_more(Connection& c) {
 
 struct ImapSession::SearchKey {
   enum class Kind {
-    all, set, uid, flag_on, flag_off, recent, new_, old, keyword, unkeyword,
-    before, on, since, sent_before, sent_on, sent_since, larger, smaller,
-    header, body, text, not_, or_, group
+    all,
+    set,
+    uid,
+    flag_on,
+    flag_off,
+    recent,
+    new_,
+    old,
+    keyword,
+    unkeyword,
+    before,
+    on,
+    since,
+    sent_before,
+    sent_on,
+    sent_since,
+    larger,
+    smaller,
+    header,
+    body,
+    text,
+    not_,
+    or_,
+    group
   } kind = Kind::all;
   std::uint32_t flag = 0;
   std::vector<Range> set;
@@ -1925,27 +1952,44 @@ bool ImapSession::matches(const SearchKey& k, std::size_t i) {
   Entry& e = view_[i];
   MessageRecord& m = *e.rec;
   switch (k.kind) {
-    case K::all: return true;
-    case K::set: return in_set(k.set, static_cast<std::uint32_t>(i + 1));
-    case K::uid: return in_set(k.set, e.uid);
-    case K::flag_on: return (m.flags & k.flag) != 0;
-    case K::flag_off: return (m.flags & k.flag) == 0;
-    case K::recent: return e.recent;
-    case K::new_: return e.recent && !(m.flags & msgflag::seen);
-    case K::old: return !e.recent;
-    case K::keyword: return false;
-    case K::unkeyword: return true;
-    case K::before: return day_of(m.internal_date) < k.number;
-    case K::on: return day_of(m.internal_date) == k.number;
-    case K::since: return day_of(m.internal_date) >= k.number;
-    case K::sent_before: return m.sent_date && day_of(m.sent_date) < k.number;
-    case K::sent_on: return m.sent_date && day_of(m.sent_date) == k.number;
-    case K::sent_since: return m.sent_date && day_of(m.sent_date) >= k.number;
+    case K::all:
+      return true;
+    case K::set:
+      return in_set(k.set, static_cast<std::uint32_t>(i + 1));
+    case K::uid:
+      return in_set(k.set, e.uid);
+    case K::flag_on:
+      return (m.flags & k.flag) != 0;
+    case K::flag_off:
+      return (m.flags & k.flag) == 0;
+    case K::recent:
+      return e.recent;
+    case K::new_:
+      return e.recent && !(m.flags & msgflag::seen);
+    case K::old:
+      return !e.recent;
+    case K::keyword:
+      return false;
+    case K::unkeyword:
+      return true;
+    case K::before:
+      return day_of(m.internal_date) < k.number;
+    case K::on:
+      return day_of(m.internal_date) == k.number;
+    case K::since:
+      return day_of(m.internal_date) >= k.number;
+    case K::sent_before:
+      return m.sent_date && day_of(m.sent_date) < k.number;
+    case K::sent_on:
+      return m.sent_date && day_of(m.sent_date) == k.number;
+    case K::sent_since:
+      return m.sent_date && day_of(m.sent_date) >= k.number;
     case K::larger:
     case K::smaller: {
       auto size = imap_message_size(*source_, m, e.offset);
       if (!size) return false;
-      return k.kind == K::larger ? *size > static_cast<std::uint64_t>(k.number) : *size < static_cast<std::uint64_t>(k.number);
+      return k.kind == K::larger ? *size > static_cast<std::uint64_t>(k.number)
+                                 : *size < static_cast<std::uint64_t>(k.number);
     }
     case K::header: {
       // The overview's first line of From, To and Subject answers most searches.
@@ -1956,10 +2000,14 @@ bool ImapSession::matches(const SearchKey& k, std::size_t i) {
       if (known && !k.value.empty() && str_casestr(*known, k.value)) return true;
       return imap_header_contains(*source_, m, e.offset, k.field, k.value);
     }
-    case K::body: return imap_text_contains(*source_, m, e.offset, k.value, TextScope::body);
-    case K::text: return imap_text_contains(*source_, m, e.offset, k.value, TextScope::whole);
-    case K::not_: return !matches(k.sub[0], i);
-    case K::or_: return matches(k.sub[0], i) || matches(k.sub[1], i);
+    case K::body:
+      return imap_text_contains(*source_, m, e.offset, k.value, TextScope::body);
+    case K::text:
+      return imap_text_contains(*source_, m, e.offset, k.value, TextScope::whole);
+    case K::not_:
+      return !matches(k.sub[0], i);
+    case K::or_:
+      return matches(k.sub[0], i) || matches(k.sub[1], i);
     case K::group:
       return std::all_of(k.sub.begin(), k.sub.end(), [&](const SearchKey& s) { return matches(s, i); });
   }

@@ -5,8 +5,8 @@
 #include <filesystem>
 
 #include "core/network.h"
-#include "core/util.h"
 #include "core/test_link.h"
+#include "core/util.h"
 #include "mail/imap_check.h"
 #include "mail/mailbox.h"
 #include "mail/pop_server.h"
@@ -21,8 +21,8 @@ constexpr const char* kSecretHash = "$1$7d1ZKX5F$d2aGUoNjVu30rj26rho90/";  // "s
 
 std::string message(int n, std::string_view body, std::string_view extra = {}) {
   return mailbox_separator("MAIL FROM:<bob@far.example>", 1700000000 + n * 86400) +
-         "From: bob@far.example\r\nSubject: m" + std::to_string(n) + "\r\n" + std::string(extra) + "X-UID: " +
-         std::to_string(n) + "\r\n\r\n" + std::string(body) + ".\r\n";
+         "From: bob@far.example\r\nSubject: m" + std::to_string(n) + "\r\n" + std::string(extra) +
+         "X-UID: " + std::to_string(n) + "\r\n\r\n" + std::string(body) + ".\r\n";
 }
 
 class ImapSessionTest : public QueueFixture {
@@ -95,8 +95,11 @@ TEST_F(ImapSessionTest, CommandsAreReadWholeAnsweredInTurnAndGuardedBeforeLogin)
 
 TEST_F(ImapSessionTest, NamesStayInTheHome) {
   auto link = login("");
-  for (const char* name : {"../x", "/etc/passwd", "~root/x", "mail/.forward", ".forward", "mail//x", "mail/overview/inbox",
-                           "mail/inbox~", "a\x01" "b", "mail/../../x"}) {
+  for (const char* name :
+       {"../x", "/etc/passwd", "~root/x", "mail/.forward", ".forward", "mail//x", "mail/overview/inbox", "mail/inbox~",
+        "a\x01"
+        "b",
+        "mail/../../x"}) {
     std::string quoted = "\"" + std::string(name) + "\"";
     EXPECT_EQ(say(*link, "a SELECT " + quoted + "\r\n"), "a NO Invalid mailbox name\r\n") << name;
     EXPECT_EQ(say(*link, "b CREATE " + quoted + "\r\n"), "b NO Invalid mailbox name\r\n") << name;
@@ -113,7 +116,8 @@ TEST_F(ImapSessionTest, NamesStayInTheHome) {
   EXPECT_EQ(say(*link, "i LIST \"\" *\r\n"),
             "* LIST () \"/\" \"INBOX\"\r\n* LIST (\\Noselect) \"/\" \"mail\"\r\n* LIST () \"/\" \"mail/work\"\r\n"
             "i OK LIST completed\r\n");
-  EXPECT_EQ(say(*link, "j LIST \"\" %\r\n"), "* LIST () \"/\" \"INBOX\"\r\n* LIST (\\Noselect) \"/\" \"mail\"\r\nj OK LIST completed\r\n");
+  EXPECT_EQ(say(*link, "j LIST \"\" %\r\n"),
+            "* LIST () \"/\" \"INBOX\"\r\n* LIST (\\Noselect) \"/\" \"mail\"\r\nj OK LIST completed\r\n");
   // RENAME takes the overview along, refuses an existing target; DELETE of a
   // missing box is NO.
   EXPECT_TRUE(say(*link, "k STATUS mail/work (UIDVALIDITY)\r\n").starts_with("* STATUS \"mail/work\" (UIDVALIDITY "));
@@ -125,8 +129,9 @@ TEST_F(ImapSessionTest, NamesStayInTheHome) {
             "o NO delete failed: no such mailbox\r\np OK delete completed\r\n");
   EXPECT_FALSE(std::filesystem::exists(home + "/mail/overview/done"));
   // Subscriptions live with the connection; FIND lists the mailboxes alone.
-  EXPECT_EQ(say(*link, "q SUBSCRIBE mail/play\r\nr LSUB \"\" *\r\ns UNSUBSCRIBE mail/play\r\nt UNSUBSCRIBE mail/play\r\n"
-                       "u FIND ALL.MAILBOXES mail/*\r\nv STATUS mail/play (MESSAGES UIDNEXT)\r\n"),
+  EXPECT_EQ(say(*link,
+                "q SUBSCRIBE mail/play\r\nr LSUB \"\" *\r\ns UNSUBSCRIBE mail/play\r\nt UNSUBSCRIBE mail/play\r\n"
+                "u FIND ALL.MAILBOXES mail/*\r\nv STATUS mail/play (MESSAGES UIDNEXT)\r\n"),
             "q OK SUBSCRIBE mail/play completed\r\n* LSUB () \"/\" \"mail/play\"\r\nr OK LSUB completed\r\n"
             "s OK UNSUBSCRIBE mail/play completed\r\nt NO Mailbox not in subscribe list\r\n"
             "* MAILBOX \"mail/play\"\r\nu OK FIND ALL.MAILBOXES * completed\r\n"
@@ -156,9 +161,11 @@ TEST_F(ImapSessionTest, FetchStoreAndSequenceSetsCostWhatTheyMatch) {
   ASSERT_EQ(imap_check::Reader(out.substr(0, out.find("f OK"))).fetch(seq, items), "") << out;
   EXPECT_EQ(imap_check::find(items, "BODY[]")->text, plain2);
   EXPECT_NE(out.find("FLAGS (\\Seen)"), std::string::npos) << out;
-  EXPECT_EQ(say(*link, "g FETCH 1 BODY[TEXT]\r\n"), "* 1 FETCH (BODY[TEXT] {11}\r\none\r\n.dot\r\n UID 1)\r\ng OK FETCH completed\r\n");
+  EXPECT_EQ(say(*link, "g FETCH 1 BODY[TEXT]\r\n"),
+            "* 1 FETCH (BODY[TEXT] {11}\r\none\r\n.dot\r\n UID 1)\r\ng OK FETCH completed\r\n");
   // A partial past the end is empty.
-  EXPECT_EQ(say(*link, "h FETCH 2 BODY.PEEK[]<1000.10>\r\n"), "* 2 FETCH (BODY[]<1000> {0}\r\n UID 2)\r\nh OK FETCH completed\r\n");
+  EXPECT_EQ(say(*link, "h FETCH 2 BODY.PEEK[]<1000.10>\r\n"),
+            "* 2 FETCH (BODY[]<1000> {0}\r\n UID 2)\r\nh OK FETCH completed\r\n");
   // The flags reach the overview by the connection's end at the latest.
   link->finish();
   std::string overview = read_file(home + "/mail/overview/inbox");
@@ -239,7 +246,8 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
   EXPECT_EQ(read_file(home + "/mail/inbox"), before);
   // Sent a byte at a time: stored as delivery stores, with the next UID and
   // the flags asked for.
-  std::string cmd = "e APPEND INBOX (\\Seen \\Flagged) \"01-Feb-2026 10:00:00 +0000\" {" + std::to_string(body.size()) + "}\r\n";
+  std::string cmd =
+      "e APPEND INBOX (\\Seen \\Flagged) \"01-Feb-2026 10:00:00 +0000\" {" + std::to_string(body.size()) + "}\r\n";
   EXPECT_EQ(say(*link, cmd + body + "\r\n", 1),
             "+ Ready for message body\r\n* 2 EXISTS\r\n* 1 RECENT\r\ne OK APPEND completed\r\n");
   std::string box = read_file(home + "/mail/inbox");
@@ -270,9 +278,11 @@ TEST_F(ImapSessionTest, SearchAnswersTruly) {
   auto link = login();
   std::string since = say(*link, "a SEARCH SINCE 1-Jan-2024\r\n");
   EXPECT_EQ(since, "* SEARCH 3\r\na OK SEARCH completed\r\n");
-  EXPECT_EQ(say(*link, "b SEARCH OR BODY apple CC carol NOT SUBJECT m80\r\n"), "* SEARCH 1\r\nb OK SEARCH completed\r\n");
+  EXPECT_EQ(say(*link, "b SEARCH OR BODY apple CC carol NOT SUBJECT m80\r\n"),
+            "* SEARCH 1\r\nb OK SEARCH completed\r\n");
   EXPECT_EQ(say(*link, "c UID SEARCH TEXT plum\r\n"), "* SEARCH 80\r\nc OK SEARCH completed\r\n");
-  EXPECT_EQ(say(*link, "d SEARCH BEFORE 1-Jan-2024 (SUBJECT m1 UID 1:*)\r\n"), "* SEARCH 1\r\nd OK SEARCH completed\r\n");
+  EXPECT_EQ(say(*link, "d SEARCH BEFORE 1-Jan-2024 (SUBJECT m1 UID 1:*)\r\n"),
+            "* SEARCH 1\r\nd OK SEARCH completed\r\n");
   EXPECT_EQ(say(*link, "e SEARCH SINCE Feb-2026\r\n"), "e BAD SEARCH arguments invalid\r\n");
 }
 
