@@ -786,7 +786,7 @@ bool ImapSession::literal_announced(Connection& c, std::string_view line) {
     if (auth_ != Auth::authenticated) {
       c.send(tag + " BAD Not in correct auth state\r\n");
     } else if (n == 0) {
-      c.send(tag + " NO empty message\r\n");
+      c.send(tag + " BAD Invalid size argument\r\n");
     } else if (n > limit) {
       c.send(strprintf("%s NO [TOOBIG] message larger than %llu bytes\r\n", tag.c_str(),
                        static_cast<unsigned long long>(limit)));
@@ -1643,7 +1643,7 @@ void ImapSession::finish_copy(Connection& c) {
   std::string tag = wait_tag_;
   copy_targets_.clear();
   if (rc == ENOENT) {
-    c.send(tag + " NO [TRYCREATE] Mailbox does not exist\r\n");
+    c.send(tag + " NO [TRYCREATE] Invalid mailbox: can't copy messages\r\n");
   } else if (rc) {
     c.send(tag + " NO COPY failed: " + error_text(rc) + "\r\n");
   } else if (missing) {

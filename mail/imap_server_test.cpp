@@ -231,7 +231,7 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
   auto link = login();
   const std::string body = "Subject: hi\r\nStatus: RO\r\nX-UID: 77\r\n\r\n.dot\r\nlast";
   // Sizes: digits, within the group's limit (100 KB here), not empty.
-  EXPECT_EQ(say(*link, "a APPEND INBOX {0}\r\n"), "a NO empty message\r\n");
+  EXPECT_EQ(say(*link, "a APPEND INBOX {0}\r\n"), "a BAD Invalid size argument\r\n");
   EXPECT_EQ(say(*link, "b APPEND INBOX {-1}\r\n"), "b BAD Invalid size argument\r\n");
   EXPECT_EQ(say(*link, "c APPEND INBOX {99999999999}\r\n"), "c NO [TOOBIG] message larger than 102400 bytes\r\n");
   EXPECT_EQ(say(*link, "d APPEND nowhere {5}\r\nhello\r\n"), "d NO [TRYCREATE] Mailbox does not exist\r\n");
@@ -259,8 +259,9 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
             "f OK FETCH completed\r\n");
   EXPECT_EQ(mailbox_lookup(home + "/mail/inbox")->messages.back().internal_date, 1769940000);  // 1 Feb 2026 10:00 UTC
   // COPY gives the target's next UIDs and carries the flags.
-  EXPECT_EQ(say(*link, "g COPY 1:2 nowhere\r\nh CREATE work\r\ni COPY 1:2 work\r\n"),
-            "g NO [TRYCREATE] Mailbox does not exist\r\nh OK create completed\r\ni OK COPY completed\r\n");
+  EXPECT_EQ(
+      say(*link, "g COPY 1:2 nowhere\r\nh CREATE work\r\ni COPY 1:2 work\r\n"),
+      "g NO [TRYCREATE] Invalid mailbox: can't copy messages\r\nh OK create completed\r\ni OK COPY completed\r\n");
   std::string work = read_file(home + "/work");
   EXPECT_NE(work.find("X-UID: 1\r\n\r\none"), std::string::npos);
   EXPECT_NE(work.find("X-UID: 2\r\n\r\n..dot"), std::string::npos);

@@ -422,7 +422,7 @@ class BadInput(ImapSuite):
         self.assertEqual(f.readline(), b'+ Ready for literal data\r\n')
         s.sendall(TRICKY.encode() + b'\r\n')
         self.assertEqual(f.readline(), b'l OK LOGIN completed\r\n')
-        for size, reply in ((b'0', b'a NO empty message\r\n'), (b'-1', b'a BAD Invalid size argument\r\n'),
+        for size, reply in ((b'0', b'a BAD Invalid size argument\r\n'), (b'-1', b'a BAD Invalid size argument\r\n'),
                             (b'99999999999', b'a NO [TOOBIG]')):
             s.sendall(b'a APPEND INBOX {' + size + b'}\r\n')
             self.assertTrue(f.readline().startswith(reply))
