@@ -722,7 +722,7 @@ void ImapSession::read_commands(Connection& c) {
       std::string_view b = c.buffered();
       tag = printable(b.substr(0, b.find_first_of(" \r\n")));
     } else {
-      tag = cmd_.substr(0, cmd_.find(' '));
+      tag = printable(cmd_.substr(0, cmd_.find(' ')));
     }
     std::string_view line;
     LineResult r = c.read_line(line);
@@ -740,7 +740,7 @@ void ImapSession::read_commands(Connection& c) {
 void ImapSession::line_complete(Connection& c, std::string_view line) {
   if (cmd_.empty() && line.empty()) return;  // an empty line between commands
   if (cmd_.size() + line.size() > kCommandLimit) {
-    c.send(cmd_.empty() ? std::string("*") : cmd_.substr(0, cmd_.find(' ')));
+    c.send(cmd_.empty() ? std::string("*") : printable(cmd_.substr(0, cmd_.find(' '))));
     c.send(" BAD command too long\r\n");
     reset_command();
     return;
@@ -762,7 +762,7 @@ bool ImapSession::literal_announced(Connection& c, std::string_view line) {
   if (open == std::string_view::npos) open = line.size() - 1;
   std::string_view count = line.substr(open + 1, line.size() - open - 2);
   if (!count.empty() && count.back() == '+') count.remove_suffix(1);  // a non-synchronizing literal
-  std::string tag = cmd_.substr(0, cmd_.find(' '));
+  std::string tag = printable(cmd_.substr(0, cmd_.find(' ')));
   std::uint64_t n = 0;
   auto r = std::from_chars(count.data(), count.data() + count.size(), n);
   bool digits = !count.empty() && r.ec == std::errc() && r.ptr == count.data() + count.size() && count.size() <= 12;

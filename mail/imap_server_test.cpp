@@ -85,6 +85,8 @@ TEST_F(ImapSessionTest, CommandsAreReadWholeAnsweredInTurnAndGuardedBeforeLogin)
   // An over-long line gets its own tagged BAD; the next command is served.
   EXPECT_EQ(say(other, "i NOOP " + std::string(20000, 'x') + "\r\nj NOOP\r\n"),
             "i BAD command line too long\r\nj OK NOOP completed\r\n");
+  // A tag is echoed without its control characters.
+  EXPECT_EQ(say(other, "k\rl APPEND INBOX {x}\r\n"), "k?l BAD Invalid size argument\r\n");
   // A wrong password is answered a second late; what follows waits its turn.
   TestLink third(svc::imap);
   third.take();
