@@ -79,7 +79,8 @@ void check_responses(const std::string& out) {
       auto r = std::from_chars(line.data() + open + 1, line.data() + line.size() - 1, n);
       check(r.ec == std::errc() && n <= out.size() - i);
       i += n;
-      check(i < out.size() && (out[i] == ' ' || out[i] == ')'));  // the response goes on
+      // the response goes on, or ends with a literal (a listed name)
+      check(i < out.size() && (out[i] == ' ' || out[i] == ')' || out[i] == '\r'));
     }
   }
 }
