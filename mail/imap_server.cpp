@@ -1615,9 +1615,10 @@ void ImapSession::finish_copy(Connection& c) {
   for (std::size_t i : copy_targets_) {
     if (box_ && i < view_.size() && view_[i].rec) live.push_back(i);
   }
+  // A message another session expunged meanwhile: nothing is copied.
   bool missing = live.size() != copy_targets_.size();
   int rc = 0;
-  if (!live.empty()) {
+  if (!live.empty() && !missing) {
     if (str_iequals(copy_target_, "INBOX")) open_box(copy_target_, true);
     // The source is read through a reader of its own (the target may be the
     // same mailbox, growing as the copies are written).

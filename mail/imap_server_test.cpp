@@ -209,6 +209,10 @@ TEST_F(ImapSessionTest, SessionsShareABoxEachInItsOwnViewAndExcludePop3) {
   EXPECT_EQ(say(*b, "b1 FETCH 3 (UID FLAGS)\r\nb2 SEARCH ALL\r\n"),
             "* 3 FETCH (UID 3 FLAGS ())\r\nb1 OK FETCH completed\r\n* SEARCH 1 3\r\nb2 OK SEARCH completed\r\n");
   EXPECT_EQ(say(*b, "b3 FETCH 2 (FLAGS)\r\n"), "b3 NO Some of the requested messages no longer exist\r\n");
+  // A COPY that names it copies nothing.
+  EXPECT_EQ(say(*b, "b3 CREATE saved\r\nb3 COPY 1:3 saved\r\n"),
+            "b3 OK create completed\r\nb3 NO Some of the requested messages no longer exist\r\n");
+  EXPECT_EQ(read_file(home + "/saved"), "");
   EXPECT_EQ(say(*b, "b4 NOOP\r\n"), "* 2 EXPUNGE\r\nb4 OK NOOP completed\r\n");
   // New mail shows at the next command.
   write_file(home + "/mail/inbox", read_file(home + "/mail/inbox") + message(9, "nine\r\n"));
