@@ -50,6 +50,7 @@ struct Config {
   std::int32_t imap_sock_port = 143;  // imap.sock.port
   std::int32_t imap_sock_timeout = 120;  // imap.sock.timeout
   std::int32_t imap_sock_max = 20;  // imap.sock.max
+  std::int32_t imap_idle_timeout = 1740;  // imap.idle.timeout
   bool pop_sock_enabled = true;  // pop.sock.enabled
   std::int32_t pop_sock_port = 110;  // pop.sock.port
   std::int32_t pop_sock_timeout = 120;  // pop.sock.timeout

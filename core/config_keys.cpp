@@ -1,4 +1,4 @@
-// The table of the 233 master-configuration keys: name, kind, storage and
+// The table of the 234 master-configuration keys: name, kind, storage and
 // multiplier. The defaults are the initial values of the fields in config.h.
 #include "core/config.h"
 
@@ -18,6 +18,7 @@ const std::vector<ConfigKeyInfo>& config_keys() {
       {"imap.sock.port", ConfigKind::integer, &config.imap_sock_port, 1},
       {"imap.sock.timeout", ConfigKind::integer, &config.imap_sock_timeout, 1},
       {"imap.sock.max", ConfigKind::integer, &config.imap_sock_max, 1},
+      {"imap.idle.timeout", ConfigKind::integer, &config.imap_idle_timeout, 1},
       {"pop.sock.enabled", ConfigKind::boolean, &config.pop_sock_enabled, 1},
       {"pop.sock.port", ConfigKind::integer, &config.pop_sock_port, 1},
       {"pop.sock.timeout", ConfigKind::integer, &config.pop_sock_timeout, 1},
@@ -263,7 +264,12 @@ std::string_view config_key_reader(std::string_view key) {
       {"smtp.block", "the SMTP server's accept rule: peers refused (\"all\" refuses everyone not allowed)"},
       {"pop.allow", "the POP3 server's accept rule: peers accepted without further test"},
       {"pop.block", "the POP3 server's accept rule: peers refused"},
-      {"imap.", "the IMAP server (still to come)"},
+      {"imap.sock.", "the IMAP server's listener: read at start-up (enabled, port), and by every connection "
+                     "(idle seconds between commands, connections at once)"},
+      {"imap.idle.timeout", "the IMAP server: seconds a connection waiting in IDLE may stay silent, read when "
+                            "IDLE starts"},
+      {"imap.allow", "the IMAP server's accept rule: peers accepted without further test"},
+      {"imap.block", "the IMAP server's accept rule: peers refused"},
       {"nntp.", "the news server (still to come)"},
       {"web.", "the web server (still to come)"},
       {"proxy.cache.dir", "start-up makes the folder; the proxy cache (still to come)"},

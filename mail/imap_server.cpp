@@ -25,6 +25,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <utility>
 #include <string>
 #include <vector>
 
@@ -56,8 +57,13 @@ constexpr std::chrono::milliseconds kStoreRetry{50};
 constexpr std::size_t kWriteChunk = 1024 * 1024;
 constexpr int kListDepth = 16;
 constexpr std::size_t kListEntries = 10000;
+// Where a user's subscriptions are kept, below the home (a dot file, so
+// never taken for a mailbox), and the most of it that is read.
+constexpr std::string_view kSubscriptionFile = "mail/.subscriptions";
+constexpr std::size_t kSubscriptionBytes = 1024 * 1024;
 constexpr std::uint32_t kKept =
     msgflag::seen | msgflag::answered | msgflag::flagged | msgflag::deleted | msgflag::draft;
+const char* const kCapabilities = "IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE";
 const char* const kPermanentFlags = "(\\Answered \\Flagged \\Deleted \\Seen \\Draft)";
 
 std::string short_text(const std::string& value) { return value.substr(0, 200); }
@@ -194,6 +200,20 @@ bool in_set(const std::vector<Range>& set, std::uint32_t n) {
   return it != set.begin() && std::prev(it)->high >= n;
 }
 
+// Identifiers as a set, in the order given: runs of consecutive ones as
+// "low:high" (COPYUID pairs the source's with the target's by position).
+std::string uid_text(const std::vector<std::uint32_t>& uids) {
+  std::string out;
+  for (std::size_t i = 0; i < uids.size();) {
+    std::size_t j = i;
+    while (j + 1 < uids.size() && uids[j + 1] == uids[j] + 1) ++j;
+    if (!out.empty()) out += ',';
+    out += j == i ? std::to_string(uids[i]) : strprintf("%u:%u", uids[i], uids[j]);
+    i = j + 1;
+  }
+  return out;
+}
+
 // ---- dates ----------------------------------------------------------------------------
 
 // Days from 1 Jan 1970 to a calendar date (month from 0).
@@ -286,6 +306,14 @@ bool list_match(std::string_view name, std::string_view pattern) {
   if (name == "INBOX" && pattern.size() >= 5 && str_istarts_with(pattern, "INBOX"))
     return wild_match(name, "INBOX" + std::string(pattern.substr(5)));
   return wild_match(name, pattern);
+}
+
+// The attribute that tells clients what a box is for, by its name.
+std::string special_use(std::string_view name) {
+  for (const char* use : {"Sent", "Drafts", "Trash", "Junk"}) {
+    if (name == use) return std::string("\\") + use;
+  }
+  return {};
 }
 
 // ---- output ----------------------------------------------------------------------------
@@ -520,6 +548,12 @@ class ImapSession final : public Session {
   // The one argument of a command that takes a mailbox name; BAD otherwise.
   static std::optional<std::string> one_name(Connection& c, const std::string& tag, Args& a);
   Mailbox* open_box(std::string_view name, bool create_inbox);
+  // The names subscribed to, kept in the home's mail folder (one a line),
+  // read afresh each time so every session of the user sees the same.
+  std::vector<std::string> subscriptions() const;
+  int save_subscriptions(const std::vector<std::string>& names) const;
+  // A mailbox (or folder) renamed or deleted takes its subscriptions along.
+  void resubscribe(std::string_view from, std::optional<std::string_view> to) const;
 
   // Commands.
   void cmd_capability(Connection&, const std::string&, Args&, bool);
@@ -545,6 +579,10 @@ class ImapSession final : public Session {
   void cmd_fetch(Connection&, const std::string&, Args&, bool);
   void cmd_store(Connection&, const std::string&, Args&, bool);
   void cmd_copy(Connection&, const std::string&, Args&, bool);
+  void cmd_move(Connection&, const std::string&, Args&, bool);
+  void cmd_idle(Connection&, const std::string&, Args&, bool);
+  void cmd_namespace(Connection&, const std::string&, Args&, bool);
+  void idle_line(Connection& c, std::string_view line);
 
   void select_common(Connection& c, const std::string& tag, Args& a, bool read_only);
   void stream_more(Connection& c);
@@ -567,7 +605,6 @@ class ImapSession final : public Session {
   Auth auth_ = Auth::none;
   std::string user_, home_;
   int failed_logins_ = 0;
-  std::vector<std::string> subscriptions_;
 
   // The command being read.
   std::string cmd_;  // in wire form, literals included
@@ -595,9 +632,16 @@ class ImapSession final : public Session {
   std::size_t announced_recent_ = 0;  // ... and of recent messages
   std::unique_ptr<Stream> stream_;
 
-  // COPY waiting for delivery to finish writing.
+  // COPY (or MOVE) waiting for delivery to finish writing.
   std::string copy_target_;
   std::vector<std::size_t> copy_targets_;
+  bool moving_ = false;
+
+  // IDLE: changes to the selected mailbox are sent as they happen (the
+  // mailbox's note wakes the connection) until the client says DONE.
+  Connection* conn_ = nullptr;
+  bool idling_ = false;
+  std::string idle_tag_;
 };
 
 const ImapSession::Command ImapSession::kCommands[] = {
@@ -619,14 +663,18 @@ const ImapSession::Command ImapSession::kCommands[] = {
     {"APPEND", &ImapSession::cmd_append, Command::authenticated, false},
     {"CHECK", &ImapSession::cmd_check, Command::selected, false},
     {"CLOSE", &ImapSession::cmd_close, Command::selected, false},
-    {"EXPUNGE", &ImapSession::cmd_expunge, Command::selected, false},
+    {"EXPUNGE", &ImapSession::cmd_expunge, Command::selected, true},
     {"SEARCH", &ImapSession::cmd_search, Command::selected, true},
     {"FETCH", &ImapSession::cmd_fetch, Command::selected, true},
     {"STORE", &ImapSession::cmd_store, Command::selected, true},
     {"COPY", &ImapSession::cmd_copy, Command::selected, true},
+    {"MOVE", &ImapSession::cmd_move, Command::selected, true},
+    {"IDLE", &ImapSession::cmd_idle, Command::authenticated, false},
+    {"NAMESPACE", &ImapSession::cmd_namespace, Command::authenticated, false},
 };
 
 void ImapSession::on_open(Connection& c) {
+  conn_ = &c;
   c.send(strprintf("* OK %s Velmor Server Suite IMAP4 Server (v%s %s) ready at %s - Report problems to %s\r\n",
                    short_text(text_of(config.server_name)).c_str(), kVersion, kPlatform,
                    time_text(server_now ? server_now : std::time(nullptr)).c_str(),
@@ -649,6 +697,10 @@ void ImapSession::on_drained(Connection& c) {
 }
 
 void ImapSession::on_timer(Connection& c) {
+  if (idling_) {
+    sync(c, true);  // the mailbox changed under an idle client: it hears now
+    return;
+  }
   Wait w = wait_;
   wait_ = Wait::none;
   c.resume_input();
@@ -739,6 +791,7 @@ void ImapSession::read_commands(Connection& c) {
 // A line of a command: it ends the command, or announces a literal.
 void ImapSession::line_complete(Connection& c, std::string_view line) {
   if (cmd_.empty() && line.empty()) return;  // an empty line between commands
+  if (idling_) return idle_line(c, line);
   if (cmd_.size() + line.size() > kCommandLimit) {
     c.send(cmd_.empty() ? std::string("*") : printable(cmd_.substr(0, cmd_.find(' '))));
     c.send(" BAD command too long\r\n");
@@ -884,7 +937,10 @@ void ImapSession::select_box(Connection& c, Mailbox* box, bool read_only) {
   box_ = box;
   read_only_ = read_only;
   stale_ = false;
-  mailbox_share(*box, c.id(), [this] { stale_ = true; });
+  mailbox_share(*box, c.id(), [this] {
+    stale_ = true;
+    if (idling_) conn_->wake_after(std::chrono::milliseconds(1));
+  });
   reopen();
   view_.clear();
   view_.reserve(box->messages.size());
@@ -1058,15 +1114,98 @@ Mailbox* ImapSession::open_box(std::string_view name, bool create_inbox) {
   return mailbox_lookup(path_of(name), home_);
 }
 
+std::vector<std::string> ImapSession::subscriptions() const {
+  std::vector<std::string> names;
+  SafeDir root;
+  UniqueFd fd;
+  if (!SafeDir::open_root(home_, root).ok() || !root.open_file(kSubscriptionFile, O_RDONLY, fd).ok()) return names;
+  std::string text;
+  char buf[4096];
+  for (;;) {
+    ssize_t n = ::read(fd.get(), buf, sizeof buf);
+    if (n <= 0 || text.size() > kSubscriptionBytes) break;
+    text.append(buf, static_cast<std::size_t>(n));
+  }
+  for (std::size_t from = 0; from < text.size();) {
+    std::size_t nl = text.find('\n', from);
+    if (nl == std::string::npos) break;  // a cut last line is not a name
+    std::string name = text.substr(from, nl - from);
+    if ((name == "INBOX" || imap_name_allowed(name, false)) &&
+        std::find(names.begin(), names.end(), name) == names.end())
+      names.push_back(std::move(name));
+    from = nl + 1;
+  }
+  return names;
+}
+
+int ImapSession::save_subscriptions(const std::vector<std::string>& names) const {
+  std::string text;
+  for (const std::string& n : names) text += n + "\n";
+  SafeDir root, mail;
+  SafeResult r = SafeDir::open_root(home_, root);
+  if (r.ok()) r = root.open_dir(path_dir(kSubscriptionFile), true, mail);
+  if (!r.ok()) return r.error ? r.error : EACCES;
+  return mail.replace_file(path_leaf(kSubscriptionFile), text);
+}
+
+void ImapSession::resubscribe(std::string_view from, std::optional<std::string_view> to) const {
+  std::vector<std::string> names = subscriptions(), kept;
+  bool changed = false;
+  for (std::string& n : names) {
+    bool under = n.size() > from.size() && n.starts_with(from) && n[from.size()] == '/';
+    if (n != from && !under) {
+      kept.push_back(std::move(n));
+      continue;
+    }
+    changed = true;
+    if (to) kept.push_back(std::string(*to) + n.substr(from.size()));
+  }
+  if (changed) save_subscriptions(kept);
+}
+
 // ---- commands: any state --------------------------------------------------------------
 
 void ImapSession::cmd_capability(Connection& c, const std::string& tag, Args&, bool) {
-  c.send("* CAPABILITY IMAP4rev1\r\n" + tag + " OK CAPABILITY completed\r\n");
+  c.send("* CAPABILITY " + std::string(kCapabilities) + "\r\n" + tag + " OK CAPABILITY completed\r\n");
 }
 
 void ImapSession::cmd_noop(Connection& c, const std::string& tag, Args&, bool) {
   sync(c, true);
   c.send(tag + " OK NOOP completed\r\n");
+}
+
+void ImapSession::cmd_idle(Connection& c, const std::string& tag, Args& a, bool) {
+  if (!a.end()) {
+    c.send(tag + " BAD IDLE takes no arguments\r\n");
+    return;
+  }
+  idling_ = true;
+  idle_tag_ = tag;
+  c.send("+ idling\r\n");
+  sync(c, true);
+  // Waiting is what an idle client is for: it has a time-out of its own.
+  c.set_idle_timeout(config.imap_idle_timeout);
+}
+
+// A line while idle: DONE ends the wait; anything else ends it as an error.
+void ImapSession::idle_line(Connection& c, std::string_view line) {
+  idling_ = false;
+  c.set_idle_timeout(config.imap_sock_timeout);
+  c.wake_after(std::chrono::milliseconds(0));
+  if (!str_iequals(line, "DONE")) {
+    c.send(idle_tag_ + " BAD IDLE ended without DONE\r\n");
+    return;
+  }
+  sync(c, true);
+  c.send(idle_tag_ + " OK IDLE terminated\r\n");
+}
+
+void ImapSession::cmd_namespace(Connection& c, const std::string& tag, Args& a, bool) {
+  if (!a.end()) {
+    c.send(tag + " BAD NAMESPACE takes no arguments\r\n");
+    return;
+  }
+  c.send("* NAMESPACE ((\"\" \"/\")) NIL NIL\r\n" + tag + " OK NAMESPACE completed\r\n");
 }
 
 void ImapSession::cmd_check(Connection& c, const std::string& tag, Args&, bool) {
@@ -1230,6 +1369,7 @@ void ImapSession::cmd_delete(Connection& c, const std::string& tag, Args& a, boo
     if (dir.open_dir("overview", false, overviews).ok()) overviews.remove(leaf);
   }
   dir.sync();
+  resubscribe(*name, std::nullopt);
   c.send(tag + " OK delete completed\r\n");
 }
 
@@ -1288,6 +1428,7 @@ void ImapSession::cmd_rename(Connection& c, const std::string& tag, Args& a, boo
   }
   old_dir.sync();
   new_dir.sync();
+  if (!str_iequals(*from, "INBOX")) resubscribe(*from, *to);  // INBOX stays, empty
   c.send(tag + " OK rename completed\r\n");
 }
 
@@ -1296,7 +1437,14 @@ void ImapSession::cmd_subscribe(Connection& c, const std::string& tag, Args& a, 
   if (!name) return;
   if (!name_checked(c, tag, *name)) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
-  if (std::find(subscriptions_.begin(), subscriptions_.end(), n) == subscriptions_.end()) subscriptions_.push_back(n);
+  std::vector<std::string> names = subscriptions();
+  if (std::find(names.begin(), names.end(), n) == names.end()) {
+    names.push_back(n);
+    if (int rc = save_subscriptions(names)) {
+      c.send(tag + " NO SUBSCRIBE failed: " + error_text(rc) + "\r\n");
+      return;
+    }
+  }
   c.send(tag + " OK SUBSCRIBE " + printable(n) + " completed\r\n");
 }
 
@@ -1304,12 +1452,17 @@ void ImapSession::cmd_unsubscribe(Connection& c, const std::string& tag, Args& a
   auto name = one_name(c, tag, a);
   if (!name) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
-  auto it = std::find(subscriptions_.begin(), subscriptions_.end(), n);
-  if (it == subscriptions_.end()) {
+  std::vector<std::string> names = subscriptions();
+  auto it = std::find(names.begin(), names.end(), n);
+  if (it == names.end()) {
     c.send(tag + " NO Mailbox not in subscribe list\r\n");
     return;
   }
-  subscriptions_.erase(it);
+  names.erase(it);
+  if (int rc = save_subscriptions(names)) {
+    c.send(tag + " NO UNSUBSCRIBE failed: " + error_text(rc) + "\r\n");
+    return;
+  }
   c.send(tag + " OK UNSUBSCRIBE " + printable(n) + " completed\r\n");
 }
 
@@ -1387,7 +1540,7 @@ void ImapSession::cmd_list(Connection& c, const std::string& tag, Args& a, bool)
   }
   std::string out;
   list_names(full, [&](const std::string& name, bool folder) {
-    out += folder ? "* LIST (\\Noselect) \"/\" " : "* LIST () \"/\" ";
+    out += folder ? "* LIST (\\Noselect) \"/\" " : "* LIST (" + special_use(name) + ") \"/\" ";
     imap_append_string(out, name);
     out += "\r\n";
   });
@@ -1403,7 +1556,7 @@ void ImapSession::cmd_lsub(Connection& c, const std::string& tag, Args& a, bool)
     return;
   }
   std::string out;
-  for (const std::string& n : subscriptions_) {
+  for (const std::string& n : subscriptions()) {
     if (!list_match(n, *reference + *pattern)) continue;
     out += "* LSUB () \"/\" ";
     imap_append_string(out, n);
@@ -1575,7 +1728,9 @@ void ImapSession::finish_append(Connection& c) {
   if (raw.size() != append_size_) return done(tag + " NO [SERVERBUG] the message could not be kept\r\n");
   std::string separator =
       mailbox_separator("<" + user_ + "@" + text_of(config.server_name) + ">", when ? *when : std::time(nullptr));
+  std::uint32_t stored_uid = 0;
   int rc = store_messages(*name, 1, [&](Writer& w, std::uint32_t uid, std::size_t) {
+    stored_uid = uid;
     w.put(separator);
     write_appended(w, raw, flags, uid);
     return flags;
@@ -1590,14 +1745,27 @@ void ImapSession::finish_append(Connection& c) {
   if (rc == ENOENT) return done(tag + " NO [TRYCREATE] Mailbox does not exist\r\n");
   if (rc) return done(tag + " NO APPEND failed: " + error_text(rc) + "\r\n");
   sync(c, true);
-  done(tag + " OK APPEND completed\r\n");
+  const Mailbox* target = mailbox_lookup(path_of(*name), home_);
+  if (!target) return done(tag + " OK APPEND completed\r\n");
+  done(strprintf("%s OK [APPENDUID %u %u] APPEND completed\r\n", tag.c_str(), target->uid_validity, stored_uid));
+}
+
+void ImapSession::cmd_move(Connection& c, const std::string& tag, Args& a, bool uid) {
+  if (read_only_) {
+    c.send(tag + " NO MOVE failed: mailbox is read-only\r\n");
+    return;
+  }
+  moving_ = true;
+  cmd_copy(c, tag, a, uid);
 }
 
 void ImapSession::cmd_copy(Connection& c, const std::string& tag, Args& a, bool uid) {
+  const bool moving = std::exchange(moving_, false);
   std::string_view set = a.atom();
   auto name = a.space() ? a.astring() : std::nullopt;
   if (set.empty() || !name || !a.end()) {
-    c.send(tag + " BAD COPY needs a message set and a mailbox\r\n");
+    c.send(tag + (moving ? " BAD MOVE needs a message set and a mailbox\r\n"
+                         : " BAD COPY needs a message set and a mailbox\r\n"));
     return;
   }
   auto targets = targets_of(c, tag, set, uid);
@@ -1605,6 +1773,7 @@ void ImapSession::cmd_copy(Connection& c, const std::string& tag, Args& a, bool 
   if (!name_checked(c, tag, *name)) return;
   copy_target_ = *name;
   copy_targets_ = std::move(*targets);
+  moving_ = moving;
   wait_tag_ = tag;
   finish_copy(c);
 }
@@ -1618,6 +1787,7 @@ void ImapSession::finish_copy(Connection& c) {
   // A message another session expunged meanwhile: nothing is copied.
   bool missing = live.size() != copy_targets_.size();
   int rc = 0;
+  std::vector<std::uint32_t> from_uids, to_uids;
   if (!live.empty() && !missing) {
     if (str_iequals(copy_target_, "INBOX")) open_box(copy_target_, true);
     // The source is read through a reader of its own (the target may be the
@@ -1627,6 +1797,8 @@ void ImapSession::finish_copy(Connection& c) {
     rc = !file ? EIO : store_messages(copy_target_, live.size(), [&](Writer& w, std::uint32_t uid, std::size_t k) {
       const Entry& e = view_[live[k]];
       std::uint32_t flags = e.rec->flags & kKept;
+      from_uids.push_back(e.uid);
+      to_uids.push_back(uid);
       write_copied(w, in, *e.rec, e.offset, flags, uid);
       return flags;
     });
@@ -1642,16 +1814,50 @@ void ImapSession::finish_copy(Connection& c) {
     return;
   }
   std::string tag = wait_tag_;
+  const bool moving = std::exchange(moving_, false);
+  const char* verb = moving ? "MOVE" : "COPY";
   copy_targets_.clear();
   if (rc == ENOENT) {
     c.send(tag + " NO [TRYCREATE] Invalid mailbox: can't copy messages\r\n");
-  } else if (rc) {
-    c.send(tag + " NO COPY failed: " + error_text(rc) + "\r\n");
-  } else if (missing) {
-    c.send(tag + " NO Some of the requested messages no longer exist\r\n");
-  } else {
-    c.send(tag + " OK COPY completed\r\n");
+    return;
   }
+  if (rc) {
+    c.send(tag + " NO " + verb + " failed: " + error_text(rc) + "\r\n");
+    return;
+  }
+  if (missing) {
+    c.send(tag + " NO Some of the requested messages no longer exist\r\n");
+    return;
+  }
+  std::string code;
+  if (const Mailbox* target = to_uids.empty() ? nullptr : mailbox_lookup(path_of(copy_target_), home_))
+    code = strprintf("[COPYUID %u %s %s] ", target->uid_validity, uid_text(from_uids).c_str(),
+                     uid_text(to_uids).c_str());
+  if (!moving) {
+    c.send(tag + " OK " + code + "COPY completed\r\n");
+    return;
+  }
+  // The copies are safely in: the originals go, and only they (other
+  // deleted messages stay until an EXPUNGE).
+  c.send("* OK " + code + "Moved\r\n");
+  if (box_ && !from_uids.empty()) {
+    std::vector<std::uint32_t> moved = from_uids;
+    std::sort(moved.begin(), moved.end());
+    auto is_moved = [&moved](const MessageRecord& m) { return std::binary_search(moved.begin(), moved.end(), m.uid); };
+    for (MessageRecord& m : box_->messages) {
+      if (is_moved(m) && !(m.flags & msgflag::deleted)) {
+        m.flags |= msgflag::deleted;
+        mailbox_flags_changed(*box_, m);
+      }
+    }
+    rc = mailbox_expunge(*box_, is_moved);
+  }
+  sync(c, true);
+  if (rc) {
+    c.send(tag + " NO MOVE copied but could not remove the originals: " + error_text(rc) + "\r\n");
+    return;
+  }
+  c.send(tag + " OK MOVE completed\r\n");
 }
 
 // ---- commands: the selected mailbox --------------------------------------------------
@@ -1662,12 +1868,27 @@ void ImapSession::cmd_close(Connection& c, const std::string& tag, Args&, bool) 
   c.send(tag + " OK CLOSE completed\r\n");
 }
 
-void ImapSession::cmd_expunge(Connection& c, const std::string& tag, Args&, bool) {
+void ImapSession::cmd_expunge(Connection& c, const std::string& tag, Args& a, bool uid) {
+  // UID EXPUNGE removes only the deleted messages of its set.
+  std::optional<std::vector<Range>> only;
+  if (uid) {
+    only = parse_set(a.atom(), view_.empty() ? 0xffffffffu : view_.back().uid);
+    if (!only) {
+      c.send(tag + " BAD Invalid message set\r\n");
+      return;
+    }
+  }
+  if (!a.end()) {
+    c.send(tag + " BAD EXPUNGE arguments invalid\r\n");
+    return;
+  }
   if (read_only_) {
     c.send(tag + " NO Expunge failure: mailbox is read-only\r\n");
     return;
   }
-  if (int rc = mailbox_expunge(*box_)) {
+  std::function<bool(const MessageRecord&)> filter;
+  if (only) filter = [&only](const MessageRecord& m) { return in_set(*only, m.uid); };
+  if (int rc = mailbox_expunge(*box_, filter)) {
     sync(c, true);
     c.send(tag + " NO Expunge failure: " + error_text(rc) + "\r\n");
     return;

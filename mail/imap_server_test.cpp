@@ -71,7 +71,7 @@ TEST_F(ImapSessionTest, CommandsAreReadWholeAnsweredInTurnAndGuardedBeforeLogin)
   // Before LOGIN only CAPABILITY, NOOP, LOGOUT and LOGIN run; pipelined
   // commands are each answered, in order.
   EXPECT_EQ(say(link, "a CAPABILITY\r\nb SELECT INBOX\r\nc DELETE etc/passwd\r\nd NOOP\r\ne uid\r\nf FOO\r\n"),
-            "* CAPABILITY IMAP4rev1\r\na OK CAPABILITY completed\r\nb BAD Not in correct auth state\r\n"
+            "* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE\r\na OK CAPABILITY completed\r\nb BAD Not in correct auth state\r\n"
             "c BAD Not in correct auth state\r\nd OK NOOP completed\r\ne BAD Unknown command\r\n"
             "f BAD Unknown command `FOO'\r\n");
   // A password with '"' and '\' quoted, then as literals a byte at a time.
@@ -254,8 +254,9 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
   // the flags asked for.
   std::string cmd =
       "e APPEND INBOX (\\Seen \\Flagged) \"01-Feb-2026 10:00:00 +0000\" {" + std::to_string(body.size()) + "}\r\n";
-  EXPECT_EQ(say(*link, cmd + body + "\r\n", 1),
-            "+ Ready for message body\r\n* 2 EXISTS\r\n* 1 RECENT\r\ne OK APPEND completed\r\n");
+  const std::uint32_t validity = mailbox_lookup(home + "/mail/inbox")->uid_validity;
+  EXPECT_EQ(say(*link, cmd + body + "\r\n", 1), "+ Ready for message body\r\n* 2 EXISTS\r\n* 1 RECENT\r\ne OK [APPENDUID " +
+                                                    std::to_string(validity) + " 2] APPEND completed\r\n");
   std::string box = read_file(home + "/mail/inbox");
   EXPECT_EQ(box.substr(before.size()).find("Status: RO"), std::string::npos);
   EXPECT_NE(box.find("\r\nSubject: hi\r\nStatus:     R\r\nX-Status:      \r\nX-UID: 2\r\n\r\n..dot\r\nlast\r\n.\r\n"),
@@ -265,9 +266,10 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
             "f OK FETCH completed\r\n");
   EXPECT_EQ(mailbox_lookup(home + "/mail/inbox")->messages.back().internal_date, 1769940000);  // 1 Feb 2026 10:00 UTC
   // COPY gives the target's next UIDs and carries the flags.
-  EXPECT_EQ(
-      say(*link, "g COPY 1:2 nowhere\r\nh CREATE work\r\ni COPY 1:2 work\r\n"),
-      "g NO [TRYCREATE] Invalid mailbox: can't copy messages\r\nh OK create completed\r\ni OK COPY completed\r\n");
+  EXPECT_EQ(say(*link, "g COPY 1:2 nowhere\r\nh CREATE work\r\n"),
+            "g NO [TRYCREATE] Invalid mailbox: can't copy messages\r\nh OK create completed\r\n");
+  EXPECT_EQ(say(*link, "i COPY 2,1 work\r\n"), "i OK [COPYUID " + std::to_string(mailbox_lookup(home + "/work", home)->uid_validity) +
+                                                  " 1:2 1:2] COPY completed\r\n");
   std::string work = read_file(home + "/work");
   EXPECT_NE(work.find("X-UID: 1\r\n\r\none"), std::string::npos);
   EXPECT_NE(work.find("X-UID: 2\r\n\r\n..dot"), std::string::npos);
@@ -316,6 +318,76 @@ TEST_F(ImapSessionTest, UidValidityIsKeptAndNewOnlyForALostOverviewAndFlagsOutli
   mailbox_cache_clear();
   std::filesystem::remove(home + "/mail/overview/inbox");
   EXPECT_NE(mailbox_lookup(home + "/mail/inbox")->uid_validity, validity);
+}
+
+TEST_F(ImapSessionTest, IdleHearsOtherSessionsAndDeliveryAtOnceAndEndsWithDone) {
+  inbox({message(1, "one\r\n"), message(2, "two\r\n")});
+  auto b = login();
+  auto a = login();
+  EXPECT_EQ(say(*a, "n NAMESPACE\r\n"), "* NAMESPACE ((\"\" \"/\")) NIL NIL\r\nn OK NAMESPACE completed\r\n");
+  EXPECT_EQ(say(*a, "i IDLE\r\n"), "+ idling\r\n");
+  EXPECT_EQ(a->connection().idle_timeout(), 1740);  // not the command time-out
+  // Another session's STORE and EXPUNGE, and new mail, reach the idle
+  // client as they happen, with no command from it.
+  say(*b, "b1 STORE 1 +FLAGS.SILENT (\\Flagged)\r\n");
+  a->advance(std::chrono::milliseconds(1));
+  EXPECT_EQ(a->take(), "* 1 FETCH (UID 1 FLAGS (\\Flagged))\r\n");
+  say(*b, "b2 STORE 2 +FLAGS.SILENT (\\Deleted)\r\nb3 EXPUNGE\r\n");
+  a->advance(std::chrono::milliseconds(1));
+  EXPECT_EQ(a->take(), "* 2 EXPUNGE\r\n");
+  write_file(home + "/mail/inbox", read_file(home + "/mail/inbox") + message(9, "nine\r\n"));
+  mailbox_lookup(home + "/mail/inbox");
+  a->advance(std::chrono::milliseconds(1));
+  EXPECT_EQ(a->take(), "* 2 EXISTS\r\n* 1 RECENT\r\n");
+  EXPECT_EQ(say(*a, "DONE\r\nx NOOP\r\n"), "i OK IDLE terminated\r\nx OK NOOP completed\r\n");
+  EXPECT_EQ(a->connection().idle_timeout(), 120);
+  EXPECT_EQ(say(*a, "j IDLE\r\nnonsense\r\n"), "+ idling\r\nj BAD IDLE ended without DONE\r\n");
+}
+
+TEST_F(ImapSessionTest, UidExpungeAndMoveRemoveOnlyTheirOwnMessages) {
+  inbox({message(1, "one\r\n"), message(2, "two\r\n"), message(3, "three\r\n"), message(4, "four\r\n")});
+  auto link = login();
+  // 1 and 3 are deleted; UID EXPUNGE 2:4 takes 3 only (2 and 4 are not deleted).
+  EXPECT_EQ(say(*link, "a STORE 1,3 +FLAGS.SILENT (\\Deleted)\r\nb UID EXPUNGE 2:4\r\n"),
+            "a OK STORE completed\r\n* 3 EXPUNGE\r\n* 3 EXISTS\r\nb OK EXPUNGE completed\r\n");
+  EXPECT_EQ(say(*link, "c UID EXPUNGE 7\r\nd UID EXPUNGE x\r\n"),
+            "* 3 EXISTS\r\nc OK EXPUNGE completed\r\nd BAD Invalid message set\r\n");
+  // MOVE copies, then expunges just the moved messages: 1 stays deleted.
+  say(*link, "e CREATE Trash\r\n");
+  const std::string validity = std::to_string(mailbox_lookup(home + "/Trash", home)->uid_validity);
+  EXPECT_EQ(say(*link, "f UID MOVE 4,2 Trash\r\n"),
+            "* OK [COPYUID " + validity + " 2,4 1:2] Moved\r\n* 2 EXPUNGE\r\n* 2 EXPUNGE\r\nf OK MOVE completed\r\n");
+  EXPECT_EQ(say(*link, "g UID FETCH 1:* (FLAGS)\r\n"), "* 1 FETCH (FLAGS (\\Deleted) UID 1)\r\ng OK FETCH completed\r\n");
+  EXPECT_EQ(say(*link, "h MOVE 1 nowhere\r\n"), "h NO [TRYCREATE] Invalid mailbox: can't copy messages\r\n");
+  Mailbox* trash = mailbox_lookup(home + "/Trash", home);
+  ASSERT_EQ(trash->messages.size(), 2u);
+  EXPECT_EQ(trash->messages.front().flags & msgflag::deleted, 0u);
+  // Read-only: nothing moves.
+  EXPECT_EQ(say(*link, "i EXAMINE INBOX\r\n").find("i OK [READ-ONLY]") != std::string::npos, true);
+  EXPECT_EQ(say(*link, "j MOVE 1 Trash\r\n"), "j NO MOVE failed: mailbox is read-only\r\n");
+}
+
+TEST_F(ImapSessionTest, SubscriptionsAreKeptInTheHomeAndFollowRenameAndDelete) {
+  auto link = login("");
+  EXPECT_EQ(say(*link, "a SUBSCRIBE inbox\r\nb CREATE work\r\nc SUBSCRIBE work\r\nd CREATE Sent\r\n"),
+            "a OK SUBSCRIBE INBOX completed\r\nb OK create completed\r\nc OK SUBSCRIBE work completed\r\n"
+            "d OK create completed\r\n");
+  EXPECT_EQ(say(*link, "e RENAME work play\r\n"), "e OK rename completed\r\n");
+  EXPECT_EQ(read_file(home + "/mail/.subscriptions"), "INBOX\nplay\n");
+  // Another session (or a restart) reads them from the file.
+  auto other = login("");
+  EXPECT_EQ(say(*other, "f LSUB \"\" *\r\n"),
+            "* LSUB () \"/\" \"INBOX\"\r\n* LSUB () \"/\" \"play\"\r\nf OK LSUB completed\r\n");
+  EXPECT_EQ(say(*other, "g DELETE play\r\nh LSUB \"\" *\r\n"),
+            "g OK delete completed\r\n* LSUB () \"/\" \"INBOX\"\r\nh OK LSUB completed\r\n");
+  EXPECT_EQ(say(*other, "i LIST \"\" %\r\n"),
+            "* LIST () \"/\" \"INBOX\"\r\n* LIST (\\Sent) \"/\" \"Sent\"\r\n* LIST (\\Noselect) \"/\" \"mail\"\r\n"
+            "i OK LIST completed\r\n");
+  // A planted link is not followed.
+  write_file(root + "/elsewhere", "secret\n");
+  std::filesystem::remove(home + "/mail/.subscriptions");
+  std::filesystem::create_symlink(root + "/elsewhere", home + "/mail/.subscriptions");
+  EXPECT_EQ(say(*other, "j LSUB \"\" *\r\n"), "j OK LSUB completed\r\n");
 }
 
 }  // namespace

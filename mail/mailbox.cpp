@@ -1404,9 +1404,9 @@ bool mailbox_forget(const std::string& path) {
 
 // ---- expunge ----------------------------------------------------------------
 
-int mailbox_expunge(Mailbox& box) {
-  bool any = std::any_of(box.messages.begin(), box.messages.end(),
-                         [](const MessageRecord& m) { return m.flags & msgflag::deleted; });
+int mailbox_expunge(Mailbox& box, const std::function<bool(const MessageRecord&)>& only) {
+  auto going = [&only](const MessageRecord& m) { return (m.flags & msgflag::deleted) && (!only || only(m)); };
+  bool any = std::any_of(box.messages.begin(), box.messages.end(), going);
   if (!any) return 0;
   // Messages written but not yet committed are committed first, so that
   // the new mailbox keeps them.
@@ -1436,7 +1436,7 @@ int mailbox_expunge(Mailbox& box) {
   int rc = 0;
   std::uint64_t offset = 0, run_start = 0, run_length = 0;
   for (const auto& m : box.messages) {
-    if (m.flags & msgflag::deleted) {
+    if (going(m)) {
       if (run_length && !rc) rc = copy_range(old.get(), run_start, run_length, out.get());
       run_start = offset + m.total_length;
       run_length = 0;
@@ -1469,9 +1469,9 @@ int mailbox_expunge(Mailbox& box) {
   // messages); it is compacted later, in the background.
   std::string text;
   std::uint64_t gone_live = 0;
-  std::erase_if(box.flags_pending, [](const MessageRecord* m) { return (m->flags & msgflag::deleted) != 0; });
+  std::erase_if(box.flags_pending, [&going](const MessageRecord* m) { return going(*m); });
   for (auto it = box.messages.begin(); it != box.messages.end();) {
-    if (!(it->flags & msgflag::deleted)) {
+    if (!going(*it)) {
       ++it;
       continue;
     }

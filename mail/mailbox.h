@@ -172,8 +172,8 @@ bool mailbox_forget(const std::string& path);
 // Removes the deleted messages, rewriting the mailbox through a temporary
 // file (made O_EXCL beside it, synced, given the old owner through its
 // descriptor) and a rename. 0 or an errno value (the old mailbox is then
-// intact).
-int mailbox_expunge(Mailbox& box);
+// intact). With `only`, just the deleted messages it accepts go.
+int mailbox_expunge(Mailbox& box, const std::function<bool(const MessageRecord&)>& only = {});
 int mailbox_overview_write(Mailbox& box);
 int mailbox_overview_read(Mailbox& box);
 // Marks a message seen by `user` (the message starts at `offset` of the

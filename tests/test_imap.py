@@ -198,6 +198,55 @@ class SharedBox(ImapSuite):
         p.quit()
 
 
+class Extensions(ImapSuite):
+    def test_idle_hears_delivery_and_lets_pop3_in_afterwards(self):
+        m = self.imap()
+        m.select('INBOX')
+        m.send(b'i IDLE\r\n')
+        self.assertEqual(m.readline(), b'+ idling\r\n')
+        self.send(make_message('while idle'))
+        m.sock.settimeout(10)  # the update comes without a command
+        self.assertEqual(m.readline(), b'* 1 EXISTS\r\n')
+        m.send(b'DONE\r\n')
+        while True:
+            line = m.readline()
+            self.assertTrue(line, 'connection closed')
+            if line.startswith(b'i '):
+                break
+        self.assertEqual(line, b'i OK IDLE terminated\r\n')
+        self.assertEqual(m.noop()[0], 'OK')
+        m.logout()
+        self.assertEqual(self.pop3().stat()[0], 1)
+
+    def test_uid_expunge_takes_only_its_deleted_and_curl_moves(self):
+        self.send(*(make_message(s) for s in ('one', 'two', 'three', 'four')))
+        m = self.imap()
+        m.select('INBOX')
+        m.store('1,3', '+FLAGS', '(\\Deleted)')
+        typ, _ = m.uid('EXPUNGE', '2:4')
+        self.assertEqual(typ, 'OK')
+        self.assertEqual(m.response('EXPUNGE')[1], [b'3'])
+        self.assertEqual(m.search(None, 'ALL'), ('OK', [b'1 2 3']))
+        self.assertEqual(m.search(None, 'DELETED'), ('OK', [b'1']))
+        self.assertEqual(m.create('Trash')[0], 'OK')
+        typ, data = m.append('Trash', None, None, make_message('kept'))
+        self.assertRegex(data[0], rb'^\[APPENDUID \d+ 1\] ')
+        if shutil.which('curl'):
+            r = subprocess.run(['curl', '-sS', '--max-time', '20', '-u', 'alice:' + TRICKY,
+                                'imap://127.0.0.1:%d/INBOX' % self.suite.port('imap'), '-X', 'UID MOVE 2 Trash'],
+                               stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=30)
+            self.assertEqual(r.returncode, 0, r.stderr)
+        else:
+            self.assertEqual(m.uid('MOVE', '2', 'Trash')[0], 'OK')
+        m.noop()
+        self.assertEqual(m.search(None, 'ALL'), ('OK', [b'1 2']))
+        self.assertIn(b'Subject: four', fetch_one(m, '2', 'BODY.PEEK[HEADER]'))
+        m.select('Trash')
+        self.assertIn(b'Subject: two', fetch_one(m, '2', 'BODY.PEEK[HEADER]'))
+        self.assertEqual(m.namespace(), ('OK', [b'(("" "/")) NIL NIL']))
+        self.assertIn(b'(\\Trash) "/" "Trash"', b' '.join(m.list('', '%')[1]))
+
+
 class OtherClients(ImapSuite):
     def test_curl(self):
         if not shutil.which('curl'):
@@ -405,7 +454,7 @@ class BadInput(ImapSuite):
         s.sendall(b'a SELECT INBOX\r\nb DELETE etc/passwd\r\nc CAPABILITY\r\n')
         self.assertEqual([f.readline() for _ in range(4)],
                          [b'a BAD Not in correct auth state\r\n', b'b BAD Not in correct auth state\r\n',
-                          b'* CAPABILITY IMAP4rev1\r\n', b'c OK CAPABILITY completed\r\n'])
+                          b'* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE\r\n', b'c OK CAPABILITY completed\r\n'])
         m = self.imap()
         before = os.listdir(os.path.dirname(self.home))
         before_home = sorted(os.listdir(self.home))

@@ -200,7 +200,7 @@ class Init(unittest.TestCase):
         for d in ('logs', 'tmp', 'run', 'mail/in', 'mail/out', 'mail/odd', 'home'):
             self.assertTrue(os.path.isdir(os.path.join(self.root, d)), d)
         keys = self.master()
-        self.assertEqual(len(keys), 233)
+        self.assertEqual(len(keys), 234)
         self.assertEqual([keys[k] for k in ('smtp.sock.port', 'pop.sock.port', 'imap.sock.port', 'nntp.sock.port',
                                             'web.sock.port', 'proxy.http.sock.port')],
                          ['2525', '1110', '1143', '1119', '8000', '8080'])
@@ -209,7 +209,7 @@ class Init(unittest.TestCase):
         self.assertEqual(keys['mail.domains'], keys['server.name'] + ', localhost')
         self.assertEqual(keys['sock.buffer'], '16384')
         with open(os.path.join(self.root, 'config/templates/master')) as f:
-            self.assertEqual(f.read().count('\n%'), 233)
+            self.assertEqual(f.read().count('\n%'), 234)
         # Switched on, and named, are exactly the services this build runs;
         # --help names the same with their ports.
         named = re.search(r'(?m)^Services: (.*)$', r.stdout).group(1).split(', ')
