@@ -71,9 +71,9 @@ TEST_F(ImapSessionTest, CommandsAreReadWholeAnsweredInTurnAndGuardedBeforeLogin)
   // Before LOGIN only CAPABILITY, NOOP, LOGOUT and LOGIN run; pipelined
   // commands are each answered, in order.
   EXPECT_EQ(say(link, "a CAPABILITY\r\nb SELECT INBOX\r\nc DELETE etc/passwd\r\nd NOOP\r\ne uid\r\nf FOO\r\n"),
-            "* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE\r\na OK CAPABILITY completed\r\nb BAD Not in correct auth state\r\n"
-            "c BAD Not in correct auth state\r\nd OK NOOP completed\r\ne BAD Unknown command\r\n"
-            "f BAD Unknown command `FOO'\r\n");
+            "* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE\r\na OK CAPABILITY completed\r\n"
+            "b BAD Not in correct auth state\r\nc BAD Not in correct auth state\r\nd OK NOOP completed\r\n"
+            "e BAD Unknown command\r\nf BAD Unknown command `FOO'\r\n");
   // A password with '"' and '\' quoted, then as literals a byte at a time.
   write_file(root + "/users", "alice," + md5_crypt("p\"w\\d", "$1$abcde$") + ",A," + home + ",0\n");
   ASSERT_EQ(user_load(root + "/users"), 0);
@@ -255,8 +255,9 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
   std::string cmd =
       "e APPEND INBOX (\\Seen \\Flagged) \"01-Feb-2026 10:00:00 +0000\" {" + std::to_string(body.size()) + "}\r\n";
   const std::uint32_t validity = mailbox_lookup(home + "/mail/inbox")->uid_validity;
-  EXPECT_EQ(say(*link, cmd + body + "\r\n", 1), "+ Ready for message body\r\n* 2 EXISTS\r\n* 1 RECENT\r\ne OK [APPENDUID " +
-                                                    std::to_string(validity) + " 2] APPEND completed\r\n");
+  EXPECT_EQ(say(*link, cmd + body + "\r\n", 1),
+            "+ Ready for message body\r\n* 2 EXISTS\r\n* 1 RECENT\r\ne OK [APPENDUID " + std::to_string(validity) +
+                " 2] APPEND completed\r\n");
   std::string box = read_file(home + "/mail/inbox");
   EXPECT_EQ(box.substr(before.size()).find("Status: RO"), std::string::npos);
   EXPECT_NE(box.find("\r\nSubject: hi\r\nStatus:     R\r\nX-Status:      \r\nX-UID: 2\r\n\r\n..dot\r\nlast\r\n.\r\n"),
@@ -268,8 +269,8 @@ TEST_F(ImapSessionTest, AppendAndCopyStoreWholeMessagesOrNothing) {
   // COPY gives the target's next UIDs and carries the flags.
   EXPECT_EQ(say(*link, "g COPY 1:2 nowhere\r\nh CREATE work\r\n"),
             "g NO [TRYCREATE] Invalid mailbox: can't copy messages\r\nh OK create completed\r\n");
-  EXPECT_EQ(say(*link, "i COPY 2,1 work\r\n"), "i OK [COPYUID " + std::to_string(mailbox_lookup(home + "/work", home)->uid_validity) +
-                                                  " 1:2 1:2] COPY completed\r\n");
+  const std::string work_validity = std::to_string(mailbox_lookup(home + "/work", home)->uid_validity);
+  EXPECT_EQ(say(*link, "i COPY 2,1 work\r\n"), "i OK [COPYUID " + work_validity + " 1:2 1:2] COPY completed\r\n");
   std::string work = read_file(home + "/work");
   EXPECT_NE(work.find("X-UID: 1\r\n\r\none"), std::string::npos);
   EXPECT_NE(work.find("X-UID: 2\r\n\r\n..dot"), std::string::npos);
@@ -357,7 +358,8 @@ TEST_F(ImapSessionTest, UidExpungeAndMoveRemoveOnlyTheirOwnMessages) {
   const std::string validity = std::to_string(mailbox_lookup(home + "/Trash", home)->uid_validity);
   EXPECT_EQ(say(*link, "f UID MOVE 4,2 Trash\r\n"),
             "* OK [COPYUID " + validity + " 2,4 1:2] Moved\r\n* 2 EXPUNGE\r\n* 2 EXPUNGE\r\nf OK MOVE completed\r\n");
-  EXPECT_EQ(say(*link, "g UID FETCH 1:* (FLAGS)\r\n"), "* 1 FETCH (FLAGS (\\Deleted) UID 1)\r\ng OK FETCH completed\r\n");
+  EXPECT_EQ(say(*link, "g UID FETCH 1:* (FLAGS)\r\n"),
+            "* 1 FETCH (FLAGS (\\Deleted) UID 1)\r\ng OK FETCH completed\r\n");
   EXPECT_EQ(say(*link, "h MOVE 1 nowhere\r\n"), "h NO [TRYCREATE] Invalid mailbox: can't copy messages\r\n");
   Mailbox* trash = mailbox_lookup(home + "/Trash", home);
   ASSERT_EQ(trash->messages.size(), 2u);

@@ -244,7 +244,7 @@ class Extensions(ImapSuite):
         m.select('Trash')
         self.assertIn(b'Subject: two', fetch_one(m, '2', 'BODY.PEEK[HEADER]'))
         self.assertEqual(m.namespace(), ('OK', [b'(("" "/")) NIL NIL']))
-        self.assertIn(b'(\\Trash) "/" "Trash"', b' '.join(m.list('', '%')[1]))
+        self.assertIn(b'(\\Trash) "/" "Trash"', b' '.join(m.list('""', '%')[1]))
 
 
 class OtherClients(ImapSuite):
