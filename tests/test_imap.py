@@ -486,7 +486,7 @@ class BadInput(ImapSuite):
                 self.send(make_message('meanwhile'))  # a delivery in the middle of the literal
                 self.debatch(2)
         s.sendall(b'\r\n')
-        self.assertEqual(f.readline(), b'b OK APPEND completed\r\n')
+        self.assertRegex(f.readline(), rb'^b OK \[APPENDUID \d+ 3\] APPEND completed\r\n$')
         before = open(self.inbox, 'rb').read()
         # A client gone in the middle of its literal leaves nothing behind.
         s2, f2 = self.raw()
