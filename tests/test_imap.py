@@ -352,6 +352,21 @@ class OtherClients(ImapSuite):
         self.assertEqual(self.maildir(local), before, out)
         with open(self.inbox, 'rb') as f:
             self.assertEqual(f.read(), stored)
+        # New mail and a move on the server: the next run changes just those.
+        imap = self.imap()
+        imap.create('Archive')
+        imap.select('INBOX')
+        uid = imap.uid('SEARCH', 'SUBJECT', 'first')[1][0]
+        self.assertEqual(imap.uid('MOVE', uid, 'Archive')[0], 'OK')
+        imap.logout()
+        self.send(make_message('fourth'))
+        self.debatch(2)
+        kept = {n for n, v in before.items() if b'Subject: second' in v}
+        sync()
+        after = self.maildir(local)
+        self.assertEqual({n for n, v in after.items() if b'Subject: second' in v}, kept)
+        self.assertEqual(sorted(re.search(rb'Subject: (\w+)', v).group(1) for v in after.values()),
+                         [b'fourth', b'second'])
 
     def test_offlineimap(self):
         exe = shutil.which('offlineimap') or shutil.which('offlineimap3')
