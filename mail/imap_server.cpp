@@ -1126,21 +1126,11 @@ std::vector<std::string> ImapSession::subscriptions() const {
     if (n <= 0 || text.size() > kSubscriptionBytes) break;
     text.append(buf, static_cast<std::size_t>(n));
   }
-  for (std::size_t from = 0; from < text.size();) {
-    std::size_t nl = text.find('\n', from);
-    if (nl == std::string::npos) break;  // a cut last line is not a name
-    std::string name = text.substr(from, nl - from);
-    if ((name == "INBOX" || imap_name_allowed(name, false)) &&
-        std::find(names.begin(), names.end(), name) == names.end())
-      names.push_back(std::move(name));
-    from = nl + 1;
-  }
-  return names;
+  return imap_subscriptions_parse(text);
 }
 
 int ImapSession::save_subscriptions(const std::vector<std::string>& names) const {
-  std::string text;
-  for (const std::string& n : names) text += n + "\n";
+  std::string text = imap_subscriptions_text(names);
   SafeDir root, mail;
   SafeResult r = SafeDir::open_root(home_, root);
   if (r.ok()) r = root.open_dir(path_dir(kSubscriptionFile), true, mail);
@@ -2284,6 +2274,25 @@ bool imap_name_allowed(std::string_view name, bool pattern, bool folder) {
     if (slash == std::string_view::npos) return part.back() != '~';
     from = slash + 1;
   }
+}
+
+std::vector<std::string> imap_subscriptions_parse(std::string_view text) {
+  std::vector<std::string> names;
+  for (std::size_t from = 0; from < text.size();) {
+    std::size_t nl = text.find('\n', from);
+    if (nl == std::string_view::npos) break;  // a cut last line is not a name
+    std::string name(text.substr(from, nl - from));
+    if ((name == "INBOX" || imap_name_allowed(name)) && std::find(names.begin(), names.end(), name) == names.end())
+      names.push_back(std::move(name));
+    from = nl + 1;
+  }
+  return names;
+}
+
+std::string imap_subscriptions_text(const std::vector<std::string>& names) {
+  std::string text;
+  for (const std::string& n : names) text += n + "\n";
+  return text;
 }
 
 void imap_register() {
