@@ -27,7 +27,7 @@ def available():
 
 
 class Dovecot:
-    def __init__(self, password='dove-pass', protocol='pop3'):
+    def __init__(self, password='dove-pass', protocol='pop3', extra=''):
         other = 'imap' if protocol == 'pop3' else 'pop3'
         self.password = password
         self.work = tempfile.mkdtemp(prefix='velmor-dovecot-')
@@ -71,7 +71,7 @@ service {other}-login {{
     port = 0
   }}
 }}
-'''.format(w=self.work, p=password, port=self.port, proto=protocol, other=other))
+'''.format(w=self.work, p=password, port=self.port, proto=protocol, other=other) + extra)
         os.makedirs(os.path.join(self.work, 'state'), exist_ok=True)
         os.makedirs(os.path.join(self.work, 'home'), exist_ok=True)
         self.proc = subprocess.Popen([DOVECOT, '-F', '-c', conf], stdout=subprocess.DEVNULL,
