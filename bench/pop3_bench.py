@@ -127,8 +127,10 @@ def best_of(port, user, label):
     return min(times)
 
 
-def run_velmor(messages):
-    suite = Suite(config={'mail.domains': 'example.test'})
+def run_velmor(messages, service='pop', read=None, config=None):
+    """Velmor serving the messages as bench's inbox; `read(port, user,
+    label)` times it (best_of by default)."""
+    suite = Suite(config=dict({'mail.domains': 'example.test'}, **(config or {})))
     try:
         home = suite.path('home/bench')
         Suite._run([VELMOR_BIN, '--root', suite.root, '--adduser', 'bench', '--password', PASSWORD,
@@ -137,17 +139,19 @@ def run_velmor(messages):
         with open(os.path.join(home, 'mail', 'inbox'), 'wb') as f:
             f.write(velmor_mailbox(messages))
         suite.start()
-        return best_of(suite.port('pop'), 'bench', 'velmor')
+        return (read or best_of)(suite.port(service), 'bench', 'velmor')
     finally:
         suite.stop()
         suite.cleanup()
 
 
-def run_dovecot(messages):
-    server = dovecot.Dovecot(password=PASSWORD)
+def run_dovecot(messages, protocol='pop3', read=None):
+    """A private Dovecot serving the messages over `protocol` ("pop3" or
+    "imap"), timed as run_velmor does."""
+    server = dovecot.Dovecot(password=PASSWORD, protocol=protocol)
     try:
         server.fill('bench', [('\n'.join(lines) + '\n').encode() for lines in messages])
-        return best_of(server.port, 'bench', 'dovecot')
+        return (read or best_of)(server.port, 'bench', 'dovecot')
     finally:
         server.close()
 

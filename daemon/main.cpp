@@ -41,6 +41,7 @@
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/imap_server.h"
 #include "mail/pop_client.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
@@ -89,6 +90,7 @@ std::string service_title(std::string_view name) {
 // service adds its register call here; --help, --init and the start-up
 // lines then name it.
 void register_services() {
+  imap_register();
   pop_register();
   smtp_register();
   pop_client_register();  // outward only: no listener

@@ -332,23 +332,6 @@ void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std
 // How much of a message one piece writes or parses.
 constexpr std::uint64_t kPieceBytes = 1024 * 1024;
 
-// A source seen only up to `limit` (the message just written, not what
-// may follow it).
-class LimitedSource final : public ByteSource {
- public:
-  LimitedSource(ByteSource& in, std::uint64_t limit) : in_(in), limit_(limit) {}
-  std::uint64_t size() const override { return std::min(in_.size(), limit_); }
-  std::string_view view(std::uint64_t offset, std::size_t want) override {
-    if (offset >= size()) return {};
-    std::string_view v = in_.view(offset, want);
-    return v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), size() - offset)));
-  }
-  bool failed() const override { return in_.failed(); }
-
- private:
-  ByteSource& in_;
-  std::uint64_t limit_;
-};
 
 std::unordered_map<std::string, std::pair<std::time_t, int>> g_new_boxes;  // login -> day, boxes made
 

@@ -27,7 +27,8 @@ def available():
 
 
 class Dovecot:
-    def __init__(self, password='dove-pass'):
+    def __init__(self, password='dove-pass', protocol='pop3'):
+        other = 'imap' if protocol == 'pop3' else 'pop3'
         self.password = password
         self.work = tempfile.mkdtemp(prefix='velmor-dovecot-')
         os.chmod(self.work, 0o755)  # the mail processes run as nobody
@@ -38,7 +39,7 @@ class Dovecot:
             f.write('''base_dir = {w}/run
 state_dir = {w}/state
 log_path = {w}/dovecot.log
-protocols = pop3
+protocols = {proto}
 listen = 127.0.0.1
 ssl = no
 disable_plaintext_auth = no
@@ -53,18 +54,24 @@ userdb {{
   driver = static
   args = uid=nobody gid=nogroup home={w}/home/%u
 }}
-service pop3-login {{
-  inet_listener pop3 {{
+service {proto}-login {{
+  inet_listener {proto} {{
     address = 127.0.0.1
     port = {port}
   }}
-}}
-service imap-login {{
-  inet_listener imap {{
+  inet_listener {proto}s {{
     port = 0
   }}
 }}
-'''.format(w=self.work, p=password, port=self.port))
+service {other}-login {{
+  inet_listener {other} {{
+    port = 0
+  }}
+  inet_listener {other}s {{
+    port = 0
+  }}
+}}
+'''.format(w=self.work, p=password, port=self.port, proto=protocol, other=other))
         os.makedirs(os.path.join(self.work, 'state'), exist_ok=True)
         os.makedirs(os.path.join(self.work, 'home'), exist_ok=True)
         self.proc = subprocess.Popen([DOVECOT, '-F', '-c', conf], stdout=subprocess.DEVNULL,
