@@ -136,7 +136,7 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   EXPECT_EQ(mail_transfer_state, 0);
 
   // Without the mail clients nothing can start: no grace.
-  hooks.smtpkick = nullptr;
+  hooks.popkick = hooks.smtpkick = nullptr;
   mail_transfer_state = 5;
   mail_transfer_poll();
   mail_transfer_poll();

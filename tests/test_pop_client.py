@@ -160,7 +160,7 @@ class FetchCase(unittest.TestCase):
         self.assertTrue(wait_for(lambda: self.status() & 0x10000), self.suite.log('main'))
 
     def status(self):
-        rc, out = self.suite.ctl('status')
+        rc, out = self.suite.ctl('status', raw=True)
         return int(out.split('\n')[0][3:]) if rc == 0 else 0
 
     def fetch(self):

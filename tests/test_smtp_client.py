@@ -130,7 +130,7 @@ class SmtpClientTest(unittest.TestCase):
         self.suite.ctl('mailrescan')
 
     def status(self):
-        rc, out = self.suite.ctl('status')
+        rc, out = self.suite.ctl('status', raw=True)
         return int(out.split('\n')[0][3:]) if rc == 0 else 0
 
     def sink(self, address, *options):
