@@ -8,12 +8,7 @@
 # IMAP_BENCH_MESSAGES and IMAP_BENCH_ROUNDS change the size and the rounds.
 set -e
 cd "$(dirname "$0")/.."
-if [ -n "$1" ]; then
-  export VELMOR_BIN="$1"
-  export VELMORCTL_BIN="$(dirname "$1")/velmorctl"
-fi
 . bench/quiet_install.sh
-if ! command -v dovecot >/dev/null 2>&1 || [ ! -x /usr/lib/dovecot/imap ]; then
-  quiet_install dovecot-imapd
-fi
+use_velmor "$1"
+need_dovecot imap
 exec python3 bench/imap_bench.py

@@ -10,12 +10,8 @@
 # the rounds (best of 3 by default).
 set -e
 cd "$(dirname "$0")/.."
-if [ -n "$1" ]; then
-  export VELMOR_BIN="$1"
-  export VELMORCTL_BIN="$(dirname "$1")/velmorctl"
-fi
 . bench/quiet_install.sh
-if ! command -v dovecot >/dev/null 2>&1 || [ ! -x /usr/lib/dovecot/pop3 ] || ! command -v fetchmail >/dev/null 2>&1; then
-  quiet_install dovecot-pop3d fetchmail
-fi
+use_velmor "$1"
+need_dovecot pop3
+command -v fetchmail >/dev/null 2>&1 || quiet_install fetchmail
 exec python3 bench/pop_client_bench.py
