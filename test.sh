@@ -12,4 +12,9 @@ CXX=clang++ cmake -S . -B build -G Ninja -DVELMOR_SANITIZE=ON -DVELMOR_FUZZ=ON \
   -DCMAKE_BUILD_TYPE=RelWithDebInfo
 ninja -C build -j"$jobs"
 cd build
-ctest --output-on-failure -j"$jobs"
+status=0
+ctest --output-on-failure -j"$jobs" --output-junit ctest-results.xml || status=$?
+# One line per area (unit tests of a folder, end-to-end tests of a file, the
+# fuzz targets), so the end of the output says what failed.
+python3 ../scripts/test_summary.py ctest-results.xml || true
+exit "$status"

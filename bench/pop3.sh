@@ -6,12 +6,7 @@
 # POP3_BENCH_MESSAGES and POP3_BENCH_ROUNDS change the size and the rounds.
 set -e
 cd "$(dirname "$0")/.."
-if [ -n "$1" ]; then
-  export VELMOR_BIN="$1"
-  export VELMORCTL_BIN="$(dirname "$1")/velmorctl"
-fi
 . bench/quiet_install.sh
-if ! command -v dovecot >/dev/null 2>&1 || [ ! -x /usr/lib/dovecot/pop3 ]; then
-  quiet_install dovecot-pop3d
-fi
+use_velmor "$1"
+need_dovecot pop3
 exec python3 bench/pop3_bench.py

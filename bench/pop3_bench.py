@@ -6,16 +6,14 @@ Run through bench/pop3.sh, which installs Dovecot when it is missing."""
 
 import os
 import random
-import shutil
 import socket
-import subprocess
 import sys
-import tempfile
 import time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 sys.path.insert(0, os.path.join(os.path.dirname(HERE), 'tests'))
-from harness import Suite, VELMOR_BIN, free_port  # noqa: E402
+import dovecot  # noqa: E402
+from harness import Suite, VELMOR_BIN  # noqa: E402
 
 MESSAGES = int(os.environ.get('POP3_BENCH_MESSAGES', '5000'))
 ROUNDS = int(os.environ.get('POP3_BENCH_ROUNDS', '3'))
@@ -55,15 +53,6 @@ def velmor_mailbox(messages):
         parts.extend(('.' + l if l.startswith('.') else l) + '\r\n' for l in body)
         parts.append('.\r\n')
     return ''.join(parts).encode()
-
-
-def dovecot_maildir(messages, maildir):
-    for d in ('cur', 'new', 'tmp'):
-        os.makedirs(os.path.join(maildir, d), exist_ok=True)
-    for n, lines in enumerate(messages, 1):
-        name = '%d.M%dP1.bench:2,' % (1700000000 + n, n)
-        with open(os.path.join(maildir, 'cur', name), 'w') as f:
-            f.write('\n'.join(lines) + '\n')
 
 
 class Client:
@@ -138,8 +127,10 @@ def best_of(port, user, label):
     return min(times)
 
 
-def run_velmor(messages):
-    suite = Suite(config={'mail.domains': 'example.test'})
+def run_velmor(messages, service='pop', read=None, config=None):
+    """Velmor serving the messages as bench's inbox; `read(port, user,
+    label)` times it (best_of by default)."""
+    suite = Suite(config=dict({'mail.domains': 'example.test'}, **(config or {})))
     try:
         home = suite.path('home/bench')
         Suite._run([VELMOR_BIN, '--root', suite.root, '--adduser', 'bench', '--password', PASSWORD,
@@ -148,74 +139,21 @@ def run_velmor(messages):
         with open(os.path.join(home, 'mail', 'inbox'), 'wb') as f:
             f.write(velmor_mailbox(messages))
         suite.start()
-        return best_of(suite.port('pop'), 'bench', 'velmor')
+        return (read or best_of)(suite.port(service), 'bench', 'velmor')
     finally:
         suite.stop()
         suite.cleanup()
 
 
-def run_dovecot(messages):
-    dovecot = shutil.which('dovecot') or '/usr/sbin/dovecot'
-    work = tempfile.mkdtemp(prefix='velmor-bench-dovecot-')
-    os.chmod(work, 0o755)  # the mail processes run as nobody
-    proc = None
+def run_dovecot(messages, protocol='pop3', read=None):
+    """A private Dovecot serving the messages over `protocol` ("pop3" or
+    "imap"), timed as run_velmor does."""
+    server = dovecot.Dovecot(password=PASSWORD, protocol=protocol)
     try:
-        home = os.path.join(work, 'home', 'bench')
-        dovecot_maildir(messages, os.path.join(home, 'Maildir'))
-        subprocess.run(['chown', '-R', 'nobody:nogroup', os.path.join(work, 'home')], check=True)
-        port = free_port()
-        conf = os.path.join(work, 'dovecot.conf')
-        with open(conf, 'w') as f:
-            f.write('''base_dir = {w}/run
-state_dir = {w}/state
-log_path = {w}/dovecot.log
-protocols = pop3
-listen = 127.0.0.1
-ssl = no
-disable_plaintext_auth = no
-auth_mechanisms = plain
-mail_location = maildir:~/Maildir
-pop3_uidl_format = %08Xu%08Xv
-passdb {{
-  driver = static
-  args = password={p}
-}}
-userdb {{
-  driver = static
-  args = uid=nobody gid=nogroup home={w}/home/%u
-}}
-service pop3-login {{
-  inet_listener pop3 {{
-    address = 127.0.0.1
-    port = {port}
-  }}
-}}
-service imap-login {{
-  inet_listener imap {{
-    port = 0
-  }}
-}}
-'''.format(w=work, p=PASSWORD, port=port))
-        os.makedirs(os.path.join(work, 'state'), exist_ok=True)
-        proc = subprocess.Popen([dovecot, '-F', '-c', conf], stdout=subprocess.DEVNULL, stderr=subprocess.STDOUT)
-        deadline = time.monotonic() + 20
-        while True:
-            try:
-                socket.create_connection(('127.0.0.1', port), timeout=1).close()
-                break
-            except OSError:
-                if time.monotonic() > deadline or proc.poll() is not None:
-                    raise RuntimeError('dovecot did not start; see ' + os.path.join(work, 'dovecot.log'))
-                time.sleep(0.1)
-        return best_of(port, 'bench', 'dovecot')
+        server.fill('bench', [('\n'.join(lines) + '\n').encode() for lines in messages])
+        return (read or best_of)(server.port, 'bench', 'dovecot')
     finally:
-        if proc is not None:
-            proc.terminate()
-            try:
-                proc.wait(timeout=20)
-            except subprocess.TimeoutExpired:
-                proc.kill()
-        if not os.environ.get("POP3_BENCH_KEEP"): shutil.rmtree(work, ignore_errors=True)
+        server.close()
 
 
 def main():

@@ -21,8 +21,14 @@ class CommandsTest : public ::testing::Test {
     auto note = [this](const char* what) { return [this, what] { calls.push_back(what); }; };
     hooks.dial = note("dial");
     hooks.disconnect = note("disconnect");
-    hooks.popkick = note("popkick");
-    hooks.smtpkick = note("smtpkick");
+    hooks.popkick = [this] {
+      calls.push_back("popkick");
+      return started;
+    };
+    hooks.smtpkick = [this] {
+      calls.push_back("smtpkick");
+      return started;
+    };
     hooks.newskick = note("newskick");
     hooks.mailrescan = note("mailrescan");
     hooks.maildebatch = note("maildebatch");
@@ -36,6 +42,7 @@ class CommandsTest : public ::testing::Test {
     link_up = 0;
   }
   std::vector<std::string> calls;
+  bool started = true;  // what the kicks report
   int pop_clients = 0;
   int smtp_clients = 0;
 };
@@ -93,6 +100,17 @@ TEST_F(CommandsTest, DialUpTransferRunsToTheEnd) {
 }
 
 TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
+  // Kicks that started nothing: nothing to wait for.
+  started = false;
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, (std::vector<std::string>{"popkick", "smtpkick", "disconnect"}));
+
+  // A kick that reported a connection which never shows up: the grace.
+  started = true;
   mail_transfer_state = 5;
   mail_transfer_poll();
   server_now += 59;
@@ -104,6 +122,19 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   EXPECT_EQ(mail_transfer_state, 0);
   EXPECT_EQ(calls.back(), "disconnect");
 
+  // A connection counted from its kick on and over before the next poll
+  // (a fast server): no grace either.
+  hooks.popkick = [this] {
+    pop_clients = 1;
+    return true;
+  };
+  mail_transfer_state = 5;
+  mail_transfer_poll();
+  pop_clients = 0;
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+
   // Without the mail clients nothing can start: no grace.
   hooks.popkick = hooks.smtpkick = nullptr;
   mail_transfer_state = 5;
@@ -111,6 +142,36 @@ TEST_F(CommandsTest, TransferWithNothingToDoHangsUp) {
   mail_transfer_poll();
   mail_transfer_poll();
   EXPECT_EQ(mail_transfer_state, 0);
+}
+
+TEST_F(CommandsTest, TransferWaitingForTheLinkGivesUp) {
+  bool dialling = true;
+  hooks.dialler_busy = [&dialling] { return dialling; };
+  internal_command("mailtransfer");
+  mail_transfer_poll();
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 1);
+  dialling = false;  // the dial failed
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, std::vector<std::string>{"dial"});
+
+  // Dialling for ever: ten minutes, then idle and hung up.
+  dialling = true;
+  calls.clear();
+  internal_command("mailtransfer");
+  mail_transfer_poll();
+  server_now += 599;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 1);
+  server_now += 1;
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 0);
+  EXPECT_EQ(calls, (std::vector<std::string>{"dial", "disconnect"}));
+  // A later request dials again.
+  internal_command("mailtransfer");
+  mail_transfer_poll();
+  EXPECT_EQ(mail_transfer_state, 1);
 }
 
 }  // namespace

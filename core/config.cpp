@@ -206,6 +206,22 @@ int yes_no_word(std::string_view text) {
 
 int socket_buffer_size() { return std::max(config.sock_buffer, 1024); }
 
+std::string primary_mail_domain() {
+  std::string_view d = text_of(config.mail_domains);
+  d.remove_prefix(std::min(d.find_first_not_of(" \t,"), d.size()));
+  d = d.substr(0, d.find_first_of(" \t,\r\n"));
+  if (d.empty()) return text_of(config.server_name);
+  return std::string(d.substr(0, 120));
+}
+
+std::string admin_address() {
+  std::string address = text_of(config.admin_email);
+  if (address.empty() || address.find('@') != std::string::npos) return address;
+  std::string domain = primary_mail_domain();
+  if (!domain.empty()) address += "@" + domain;
+  return address;
+}
+
 void config_reset() { config = Config{}; }
 
 int config_key(std::string_view key, std::string_view value) {

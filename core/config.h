@@ -50,6 +50,7 @@ struct Config {
   std::int32_t imap_sock_port = 143;  // imap.sock.port
   std::int32_t imap_sock_timeout = 120;  // imap.sock.timeout
   std::int32_t imap_sock_max = 20;  // imap.sock.max
+  std::int32_t imap_idle_timeout = 1740;  // imap.idle.timeout
   bool pop_sock_enabled = true;  // pop.sock.enabled
   std::int32_t pop_sock_port = 110;  // pop.sock.port
   std::int32_t pop_sock_timeout = 120;  // pop.sock.timeout
@@ -307,6 +308,8 @@ struct ConfigKeyInfo {
   int multiplier;  // 1, or 1024 for the two keys given in kilobytes
 };
 const std::vector<ConfigKeyInfo>& config_keys();
+// What reads a key (a line of the manual page); "" for a key without an entry.
+std::string_view config_key_reader(std::string_view key);
 
 // Reads the master file (paths.master()) and applies every key in it. Keys
 // missing from the file keep their current value. 0 = loaded; 1 = the file
@@ -344,5 +347,14 @@ int yes_no_word(std::string_view text);
 
 // The socket buffer size actually used: sock.buffer, never below 1024.
 int socket_buffer_size();
+
+// The site's primary mail domain: the first entry of mail.domains (at most
+// 120 characters), or server.name when mail.domains is unset or empty.
+std::string primary_mail_domain();
+// The administrator's address as greetings and error mails name it:
+// admin.email, completed with the mail domain (the first of mail.domains,
+// else server.name) when it has no "@". Worked out at every use, so a
+// reload of the configuration never loses the domain.
+std::string admin_address();
 
 }  // namespace velmor

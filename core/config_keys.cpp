@@ -1,6 +1,8 @@
-// The table of the 233 master-configuration keys: name, kind, storage and
+// The table of the 234 master-configuration keys: name, kind, storage and
 // multiplier. The defaults are the initial values of the fields in config.h.
 #include "core/config.h"
+
+#include <utility>
 
 namespace velmor {
 
@@ -16,6 +18,7 @@ const std::vector<ConfigKeyInfo>& config_keys() {
       {"imap.sock.port", ConfigKind::integer, &config.imap_sock_port, 1},
       {"imap.sock.timeout", ConfigKind::integer, &config.imap_sock_timeout, 1},
       {"imap.sock.max", ConfigKind::integer, &config.imap_sock_max, 1},
+      {"imap.idle.timeout", ConfigKind::integer, &config.imap_idle_timeout, 1},
       {"pop.sock.enabled", ConfigKind::boolean, &config.pop_sock_enabled, 1},
       {"pop.sock.port", ConfigKind::integer, &config.pop_sock_port, 1},
       {"pop.sock.timeout", ConfigKind::integer, &config.pop_sock_timeout, 1},
@@ -262,6 +265,115 @@ const std::vector<ConfigKeyInfo>& config_keys() {
       {"wimp.lock", ConfigKind::boolean, &config.wimp_lock, 1},
   };
   return keys;
+}
+
+std::string_view config_key_reader(std::string_view key) {
+  // What reads each key, for the manual page made from this table (the
+  // build stops when a key has no entry). The first rule that matches wins:
+  // a rule ending in "." or "_" covers every key it begins, any other names
+  // one key. "Still to come" marks a part of the suite not built yet: its
+  // keys are kept and written back, and nothing acts on them.
+  static constexpr std::pair<std::string_view, std::string_view> kReaders[] = {
+      {"smtp.sock.", "the SMTP server's listener: read at start-up (enabled, port), and by every connection "
+                     "(idle seconds, connections at once)"},
+      {"pop.sock.", "the POP3 server's listener: read at start-up (enabled, port), and by every connection "
+                    "(idle seconds, connections at once)"},
+      {"smtps.sock.", "SMTP with TLS from the first byte: its listener, read as the SMTP server's are; it takes "
+                      "the SMTP server's accept rule"},
+      {"submission.sock.", "the submission listener (STARTTLS before a password): read as the SMTP server's "
+                           "are; it takes the SMTP server's accept rule"},
+      {"pops.sock.", "POP3 with TLS from the first byte: its listener, read as the POP3 server's are; it takes "
+                     "the POP3 server's accept rule"},
+      {"imaps.sock.", "IMAP with TLS from the first byte: its listener, read as the IMAP server's are; it takes "
+                      "the IMAP server's accept rule"},
+      {"tls.cert", "TLS: the server's certificate and its chain, loaded at start-up and by \"reload config\" "
+                   "for new connections"},
+      {"tls.key", "TLS: the certificate's private key, loaded with tls.cert"},
+      {"tls.plain.login", "the POP3 and IMAP servers: whether a peer outside loopback and the private networks "
+                          "may send its password without TLS, read at each login"},
+      {"smtp.allow", "the SMTP server's accept rule: peers accepted without further test"},
+      {"smtp.auth", "the SMTP server's accept rule: peers that must identify themselves"},
+      {"smtp.block", "the SMTP server's accept rule: peers refused (\"all\" refuses everyone not allowed)"},
+      {"pop.allow", "the POP3 server's accept rule: peers accepted without further test"},
+      {"pop.block", "the POP3 server's accept rule: peers refused"},
+      {"imap.sock.", "the IMAP server's listener: read at start-up (enabled, port), and by every connection "
+                     "(idle seconds between commands, connections at once)"},
+      {"imap.idle.timeout", "the IMAP server: seconds a connection waiting in IDLE may stay silent, read when "
+                            "IDLE starts"},
+      {"imap.allow", "the IMAP server's accept rule: peers accepted without further test"},
+      {"imap.block", "the IMAP server's accept rule: peers refused"},
+      {"nntp.", "the news server (still to come)"},
+      {"web.", "the web server (still to come)"},
+      {"proxy.cache.dir", "start-up makes the folder; the proxy cache (still to come)"},
+      {"proxy.raudio.", "the streaming-audio relay (still to come)"},
+      {"proxy.ftp.", "the FTP proxy (still to come)"},
+      {"proxy.socks.", "the SOCKS proxy (still to come)"},
+      {"proxy.telnet.", "the telnet proxy (still to come)"},
+      {"proxy.telnet_", "the telnet proxy's messages (still to come)"},
+      {"proxy.multiport.", "the multi-port relays (still to come)"},
+      {"proxy.multiport_", "the multi-port relays' messages (still to come)"},
+      {"proxy.", "the web proxy and its cache (still to come)"},
+      {"dns.allow", "nothing (kept and written back)"},
+      {"dns.block", "nothing (kept and written back)"},
+      {"dns.file.", "nothing (kept and written back)"},
+      {"dns.", "the resolver and the link monitor, at each lookup (reload config applies it)"},
+      {"util.", "nothing (kept and written back)"},
+      {"file.user.dbase", "the user database: loaded at start-up and by \"reload users\"; written by every change "
+                          "(--adduser, --passwd, --deluser, \"change pass\")"},
+      {"file.user.groups", "the group option sets: loaded at start-up and by \"reload groups\""},
+      {"file.user.changes", "the user database: every change appends a record to this file"},
+      {"file.user.exec", "the user database: the command run after each change record"},
+      {"file.log.master", "the logger: the log routing file, read at start-up"},
+      {"file.mimetypes", "the MIME map, read at start-up"},
+      {"file.schedule", "the scheduler's task file, read at start-up"},
+      {"mail.file.alias", "mail debatch: aliases and mailing lists, read at start-up"},
+      {"mail.file.smtpreject", "the SMTP server: senders refused, read at start-up"},
+      {"mail.dir.incoming", "the mail queue: incoming messages (made at start-up)"},
+      {"mail.dir.outgoing", "the mail queue: messages waiting to be sent (made at start-up)"},
+      {"mail.dir.oddments", "the mail queue: messages moved aside with their reason"},
+      {"mail.domains", "mail: the site's own domains (their recipients are local); the first is the primary "
+                       "domain"},
+      {"mail.debatch.time", "mail debatch: quiet seconds before the incoming queue is delivered (0 = only on "
+                            "\"maildebatch\")"},
+      {"mail.auto.send", "the mail queue: outgoing messages that start a mail transfer (0 = never)"},
+      {"mail.from.force", "mail debatch: the sender written into every outgoing file"},
+      {"pop.headers", "mail debatch: header lines that name the recipient of fetched mail"},
+      {"pop.hosts", "the POP3 client: the accounts it collects from, read at each collection"},
+      {"pop.time", "the POP3 client: minutes between collections while the link is up"},
+      {"smtp.direct", "mail debatch: domains whose recipients get an outgoing file each"},
+      {"smtp.hosts", "the SMTP client: the relay host outgoing mail goes to, read at each transfer"},
+      {"smtp.time", "the SMTP client: minutes between transfers while the link is up (-1: as soon as there is mail)"},
+      {"news.dir.", "start-up makes the folder; news (still to come)"},
+      {"news.", "news (still to come)"},
+      {"dialin.file", "the dialler: dial-in entries, read at start-up"},
+      {"dialin.addr", "nothing (kept and written back)"},
+      {"dialler.provider", "nothing (kept and written back)"},
+      {"dialler.", "the dialler: the modem, its script and the link's timings"},
+      {"admin.email", "greetings, error mails and loop reports (completed with the primary domain when it has "
+                      "no \"@\")"},
+      {"server.name", "greetings and Received lines; the primary domain when mail.domains is empty"},
+      {"server.user", "start-up as root: the user the suite runs as once its listeners are bound; also "
+                      "--adduser, --passwd and --deluser"},
+      {"sock.buffer", "every connection: the size of its input and of its output buffer (1024 at least)"},
+      {"sock.session.max", "every connection: the seconds it may last in all (0 = no limit)"},
+      {"cache.big", "the file cache: the largest window of one file"},
+      {"cache.max", "the file cache: its memory"},
+      {"store.state", "the logger: the facilities the main log records at start-up (velmorctl log/nolog "
+                      "switches them)"},
+      {"log.format", "access-log lines of the web server and the proxy (still to come)"},
+      {"poll.time", "nothing (kept for older installations)"},
+      {"low.", "nothing (kept for older installations)"},
+      {"con.", "nothing (kept for older installations)"},
+      {"log.state", "nothing (kept for older installations)"},
+      {"log.buffer", "nothing (kept for older installations)"},
+      {"fetch.buffer", "nothing (kept for older installations)"},
+      {"wimp.lock", "nothing (kept for older installations)"},
+  };
+  for (const auto& [rule, reader] : kReaders) {
+    bool family = rule.back() == '.' || rule.back() == '_';
+    if (family ? key.starts_with(rule) : key == rule) return reader;
+  }
+  return {};
 }
 
 }  // namespace velmor

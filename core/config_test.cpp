@@ -63,6 +63,17 @@ TEST_F(ConfigTest, FileSyntax) {
   EXPECT_EQ(config.imap_sock_port, 143);
 }
 
+TEST_F(ConfigTest, TheAdministratorsAddressKeepsItsDomainAcrossReloads) {
+  const char* master = "%admin.email: postmaster\n%server.name: host.example\n%mail.domains: , site.example, b.example\n";
+  ASSERT_EQ(load(master), 0);
+  EXPECT_EQ(admin_address(), "postmaster@site.example");
+  EXPECT_EQ(config_key("admin.email"), "postmaster");  // saved as written
+  ASSERT_EQ(load("%mail.domains:\n"), 0);
+  EXPECT_EQ(admin_address(), "postmaster@host.example");
+  ASSERT_EQ(load("%admin.email: ops@far.example\n"), 0);
+  EXPECT_EQ(admin_address(), "ops@far.example");
+}
+
 TEST_F(ConfigTest, MissingFileIsReported) {
   ::testing::internal::CaptureStdout();
   EXPECT_EQ(config_load_file(dir_ + "/absent"), 1);

@@ -458,7 +458,10 @@ void Connection::flush() {
       }
       parts[count++] = std::string_view(item.stage).substr(item.done);
       total += item.stage.size() - item.done;
-      break;  // one stage per write
+      // One stage per write; what follows a file's last stage goes in the
+      // same write, so a reply's closing line never trails in a segment of
+      // its own (which the peer's delayed acknowledgement would hold up).
+      if (item.file.length > 0) break;
     }
     std::size_t put = 0;
     Transport::Io io = total ? transport_->write(std::span(parts, count), put) : Transport::Io::ok;

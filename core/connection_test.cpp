@@ -186,6 +186,24 @@ TEST_F(OutputQueue, FileRangesLargerThanTheBufferWithTheirTransforms) {
   }
 }
 
+TEST_F(OutputQueue, AReplyAroundAShortFileGoesInOneWrite) {
+  testing_files::ScratchDir dir;
+  const std::string path = (dir.path() / "small").string();
+  testing_files::write_file(path, "body\r\n");
+  auto file = std::make_shared<const UniqueFd>(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  open();
+  lines->on_line = [&](Connection& c, std::string_view) {
+    c.send("* 1 FETCH (BODY[] {6}\r\n");
+    c.send_file({.file = file, .offset = 0, .length = 6});
+    c.send(")\r\n");
+  };
+  link->take();
+  const int before = link->writes();
+  link->feed("a\n");
+  EXPECT_EQ(link->take(), "* 1 FETCH (BODY[] {6}\r\nbody\r\n)\r\nok\r\n");
+  EXPECT_EQ(link->writes() - before, 1);  // no closing line trailing in a segment of its own
+}
+
 TEST_F(OutputQueue, AFileThatCannotBeReadEndsTheConnectionWithItsText) {
   testing_files::ScratchDir dir;
   const std::string path = (dir.path() / "short").string();

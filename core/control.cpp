@@ -1,6 +1,8 @@
 // The control channel: a local datagram socket. Each request is one datagram
 // of command text; replies go back to the sender's own bound address. Replies
-// never wait: a client that stops reading loses its replies, not the suite.
+// never hold the loop up: a short reply that finds the reader's queue full is
+// lost, and a queue listing, longer than any reader's queue, goes out from a
+// socket of its own as fast as the reader takes it.
 #include "core/control.h"
 
 #include <sys/socket.h>
@@ -10,6 +12,8 @@
 
 #include <cerrno>
 #include <cstring>
+#include <deque>
+#include <list>
 #include <vector>
 
 #include "core/commands.h"
@@ -80,6 +84,87 @@ void send_reply(int fd, const sockaddr_un& to, socklen_t to_len, std::string_vie
     last_send_failure_log = server_now;
     log_message(failure_text, std::strerror(errno));
   }
+}
+
+// ---- listings ------------------------------------------------------------------
+
+// A queue listing on its way: a socket connected to the reader, so that the
+// loop can wait until the reader's queue has room (an unconnected socket
+// cannot be told that), and the datagrams still to send.
+struct Listing {
+  UniqueFd fd;
+  std::deque<std::string> datagrams;
+  std::time_t progress = 0;  // when the reader last took one
+};
+// A reader that takes nothing for this long has gone: its listing is dropped.
+constexpr std::time_t kListingStall = 30;
+// Listings at once; a new one beyond this drops the oldest.
+constexpr std::size_t kMaxListings = 32;
+std::list<Listing>& listings() {
+  static std::list<Listing> l;
+  return l;
+}
+
+void end_listing(std::list<Listing>::iterator it) {
+  unwatch(it->fd.get());
+  listings().erase(it);
+}
+
+// Sends what the reader can take now; waits for room for the rest.
+void send_listing(std::list<Listing>::iterator it) {
+  Listing& l = *it;
+  while (!l.datagrams.empty()) {
+    const std::string& d = l.datagrams.front();
+    if (::send(l.fd.get(), d.data(), d.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) {
+      if (errno == EINTR) continue;
+      if (errno != EAGAIN && errno != EWOULDBLOCK) break;  // the reader has gone
+      int fd = l.fd.get();
+      if (watch_writable(fd, [fd] {
+            auto& all = listings();
+            for (auto i = all.begin(); i != all.end(); ++i)
+              if (i->fd.get() == fd) return send_listing(i);
+          }))
+        return;
+      break;
+    }
+    l.datagrams.pop_front();
+    l.progress = server_now;
+  }
+  end_listing(it);
+}
+
+// Starts sending a listing to the reader at `to`; false when no socket of
+// its own can reach the reader (the caller then sends what it can at once).
+bool start_listing(const sockaddr_un& to, socklen_t to_len, std::vector<std::string> datagrams) {
+  UniqueFd fd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+  if (!fd || ::connect(fd.get(), reinterpret_cast<const sockaddr*>(&to), to_len) != 0) return false;
+  auto& all = listings();
+  if (all.size() >= kMaxListings) end_listing(all.begin());
+  all.push_back(Listing{std::move(fd), {}, server_now});
+  for (std::string& d : datagrams) all.back().datagrams.push_back(std::move(d));
+  send_listing(std::prev(all.end()));
+  return true;
+}
+
+// Every tick: a listing whose reader took nothing for too long is dropped;
+// the others are offered their next datagrams again, so that a wake-up
+// missed for any reason costs a tick, not the rest of the listing.
+void tend_listings() {
+  auto& all = listings();
+  for (auto it = all.begin(); it != all.end();) {
+    auto next = std::next(it);
+    if (server_now - it->progress > kListingStall) {
+      end_listing(it);
+    } else {
+      send_listing(it);
+    }
+    it = next;
+  }
+}
+
+bool is_listing(std::string_view text) {
+  while (!text.empty() && (text.back() == '\r' || text.back() == '\n')) text.remove_suffix(1);
+  return str_iequals(text, "listmq") || str_iequals(text, "listnq");
 }
 
 // "log WORD" / "nolog WORD": switches one facility of the main log.
@@ -161,6 +246,13 @@ void control_read() {
     // sender's address along and the socket open at that time.
     const char* failure = str_istarts_with(text, "change pass") ? "domain send failed (change pass) "
                                                                  : "domain send failed";
+    if (is_listing(text) && from_len > sizeof(sa_family_t)) {
+      std::vector<std::string> datagrams;
+      control_command(text, [&datagrams](std::string_view reply) { datagrams.emplace_back(reply); });
+      if (start_listing(from, from_len, datagrams)) continue;
+      for (const std::string& d : datagrams) send_reply(control().fd, from, from_len, d, failure);
+      continue;
+    }
     control_command(text, [from, from_len, failure](std::string_view reply) {
       send_reply(control().fd, from, from_len, reply, failure);
     });
@@ -222,6 +314,9 @@ void control_command(std::string_view text, const std::function<void(std::string
     list_queue(hooks.list_news_queue, "end nq\n", reply);
   } else if (str_iequals(text, "status")) {
     reply(status_text());
+  } else if (str_iequals(text, "incoming")) {
+    auto [waiting, retry] = hooks.incoming_mail_count ? hooks.incoming_mail_count() : std::pair<std::size_t, std::size_t>{};
+    reply(strprintf("iq:%zu\nretry:%zu\n", waiting, retry));
   } else if (str_iequals(text, "test")) {
     reply(strprintf("test:%ld\n", static_cast<long>(server_now)));
   } else {
@@ -277,6 +372,7 @@ int control_open() {
     c.made = true;
   }
   c.fd = fd;
+  every_tick(tend_listings);
   if (!watch_readable(fd, control_read)) {
     control_remove();
     return 1;
@@ -286,6 +382,7 @@ int control_open() {
 
 void control_remove() {
   auto& c = control();
+  while (!listings().empty()) end_listing(listings().begin());
   if (c.fd >= 0) {
     unwatch(c.fd);
     ::close(c.fd);

@@ -9,6 +9,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 
 namespace velmor {
 
@@ -18,8 +19,10 @@ struct SuiteHooks {
   // Internal command words (control channel, scheduler, administration).
   std::function<void()> dial;          // "connect"
   std::function<void()> disconnect;    // "disconnect"
-  std::function<void()> popkick;       // POP3 client fetch check now
-  std::function<void()> smtpkick;      // SMTP client on the outgoing queue now
+  // The mail clients' kicks: true when the kick started a connection (with
+  // nothing to fetch or send, a mail transfer need not wait for one).
+  std::function<bool()> popkick;       // POP3 client fetch check now
+  std::function<bool()> smtpkick;      // SMTP client on the outgoing queue now
   std::function<void()> newskick;      // news fetch for all servers
   std::function<void()> mailrescan;    // rescan incoming, then outgoing
   std::function<void()> maildebatch;   // debatch one incoming file now
@@ -42,6 +45,9 @@ struct SuiteHooks {
   std::function<void(const std::function<void(std::string_view)>& send)> list_mail_queue;
   std::function<void(const std::function<void(std::string_view)>& send)> list_news_queue;
   std::function<std::size_t()> outgoing_mail_count;
+  // Messages of the incoming queue not yet delivered, and how many of them
+  // wait for a later try after a temporary failure.
+  std::function<std::pair<std::size_t, std::size_t>()> incoming_mail_count;
   // "lookup NAME": resolves an address and calls `done` once, when the
   // lookup ends, with the dotted address or an empty text when it failed.
   std::function<void(std::string_view name, std::function<void(std::string_view address)> done)> lookup;
@@ -59,6 +65,9 @@ struct SuiteHooks {
   // while on line. The link monitor runs it on its polls and when a response
   // first proves the link (before setting link_up).
   std::function<void()> link_watch;
+  // Filled by the dialler: true while it dials, runs its script or is on
+  // line; false once a dial has failed or the line was hung up.
+  std::function<bool()> dialler_busy;
   // Filled by the link monitor. The dialler's script has ended: forget when
   // the link was declared broken, so probing starts at once.
   std::function<void()> link_probe_restart;

@@ -227,7 +227,7 @@ void log_flush_all() {
   for (auto& f : files) flush(*f);
 }
 
-void log_header_summary(int number, std::string_view header_text) {
+void log_header_summary(std::string_view tag, std::string_view header_text) {
   std::string_view rest = header_text;
   while (!rest.empty()) {
     std::size_t end = rest.find('\n');
@@ -237,7 +237,8 @@ void log_header_summary(int number, std::string_view header_text) {
     if (line.empty()) break;  // the end of the header block
     if (str_istarts_with(line, "From:") || str_istarts_with(line, "To:") ||
         str_istarts_with(line, "Message-ID:") || line.substr(0, 8) == "Subject:") {
-      std::string out = strprintf("%d - ", number);
+      std::string out(tag);
+      out += " - ";
       out += line;
       if (out.size() > 254) out.resize(254);
       log_write(out, logchan::mail);

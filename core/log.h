@@ -69,8 +69,13 @@ int log_write(std::string_view text, int channel, int flags = 0);
 void log_poll();       // timed flushes, once per main-loop iteration
 void log_flush_all();  // every buffer, at shutdown
 
-// One line per From/To/Message-ID/Subject header of a header block, channel 8.
-void log_header_summary(int number, std::string_view header_text);
+// One line per From/To/Message-ID/Subject header of a header block, channel
+// 8, each "<tag> - <line>" (the tag names the connection and its client).
+void log_header_summary(std::string_view tag, std::string_view header_text);
+// The same with a message or transfer number as the tag.
+inline void log_header_summary(int number, std::string_view header_text) {
+  log_header_summary(std::to_string(number), header_text);
+}
 
 // The path routed to channel 1, for the crash handler (which may only use
 // async-signal-safe calls): a NUL-terminated copy kept at log_init time.

@@ -149,19 +149,19 @@ TEST_F(LogTest, RotationWithoutGenerationsDeletes) {
 
 TEST_F(LogTest, HeaderSummary) {
   ASSERT_EQ(init("8 logs/mail\n"), 0);
-  log_header_summary(42,
+  log_header_summary("42 192.0.2.9",
                      "Received: from x\r\nfrom: a@b\r\nTO: c@d\r\nSubject: hi\r\nsubject: lower\r\n"
                      "Message-Id: <1@b>\r\nX-Long: y\r\nTo: " +
                          std::string(400, 'z') + "\r\n\r\nFrom: body line\r\n");
   log_flush_all();
   std::string text = log("logs/mail");
-  EXPECT_NE(text.find("42 - from: a@b\n"), std::string::npos);
-  EXPECT_NE(text.find("42 - TO: c@d\n"), std::string::npos);
-  EXPECT_NE(text.find("42 - Subject: hi\n"), std::string::npos);
-  EXPECT_NE(text.find("42 - Message-Id: <1@b>\n"), std::string::npos);
+  EXPECT_NE(text.find("42 192.0.2.9 - from: a@b\n"), std::string::npos);
+  EXPECT_NE(text.find("42 192.0.2.9 - TO: c@d\n"), std::string::npos);
+  EXPECT_NE(text.find("42 192.0.2.9 - Subject: hi\n"), std::string::npos);
+  EXPECT_NE(text.find("42 192.0.2.9 - Message-Id: <1@b>\n"), std::string::npos);
   EXPECT_EQ(text.find("lower"), std::string::npos);
   EXPECT_EQ(text.find("body line"), std::string::npos);
-  EXPECT_NE(text.find("42 - To: " + std::string(254 - 9, 'z') + "\n"), std::string::npos);
+  EXPECT_NE(text.find("42 192.0.2.9 - To: " + std::string(254 - 19, 'z') + "\n"), std::string::npos);
 }
 
 TEST_F(LogTest, MissingConfiguration) {

@@ -69,6 +69,7 @@ struct Slot {
   std::uint32_t generation = 0;  // tells a reused descriptor from its predecessor
   std::uint64_t connection = 0;  // the connection on it, or 0 ...
   std::function<void()> ready;   // ... a raw descriptor's callback
+  std::function<void()> writable;  // and its one writable wait
   bool watched = false;
   std::uint32_t events = 0;
 };
@@ -124,6 +125,13 @@ class Network final : public ConnectionHost {
     return s;
   }
   bool set_events(int fd, Slot& s, std::uint32_t ev);
+  // Forgets a raw descriptor's slot (out of the epoll set too).
+  void drop_raw(int fd) {
+    Slot* s = slot(fd);
+    if (!s || s->connection) return;
+    if (s->watched) epoll_ctl(epoll_fd, EPOLL_CTL_DEL, fd, nullptr);
+    *s = Slot{};
+  }
   void sync(Connection& c);
   Connection& add(std::unique_ptr<Connection> c, int fd, bool counted);
   const ServiceDescriptor* service(int number) const {
@@ -406,6 +414,12 @@ void service_register(ServiceDescriptor service) {
 
 const ServiceDescriptor* service_find(int number) { return net().service(number); }
 
+std::vector<const ServiceDescriptor*> service_list() {
+  std::vector<const ServiceDescriptor*> out;
+  for (const auto& s : net().services) out.push_back(&s);
+  return out;
+}
+
 Admission service_admit(const ServiceDescriptor& service, std::uint32_t peer_nbo) {
   progress_code = 140500;
   if (service.allow && address_list_match(*service.allow, peer_nbo)) return Admission::accepted;
@@ -443,15 +457,20 @@ void start_accepted(Connection& c, const ServiceDescriptor& service) {
 
 // ---- start-up and shutdown -----------------------------------------------------------
 
-int net_listen(int service, int port) {
+int net_listen(int service, int port, std::string* error) {
   auto& n = net();
-  if (!n.ensure_epoll()) return -1;
+  auto why = [&](std::string text) {
+    if (error) *error = std::move(text);
+    return -1;
+  };
+  if (!n.ensure_epoll()) return why("no event poll");
   int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (fd < 0) {
-    std::string msg = strprintf("TCP Socket create for port:%d failed: %s", port, sys_error().c_str());
+    std::string reason = sys_error();
+    std::string msg = strprintf("TCP Socket create for port:%d failed: %s", port, reason.c_str());
     serious(msg);
     log_message(msg);
-    return -1;
+    return why(reason);
   }
   int one = 1;
   setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
@@ -459,21 +478,27 @@ int net_listen(int service, int port) {
   a.sin_family = AF_INET;
   a.sin_port = htons(static_cast<std::uint16_t>(port));
   a.sin_addr.s_addr = htonl(INADDR_ANY);
-  auto fail = [&](const std::string& msg) {
+  auto fail = [&](const std::string& msg, std::string reason) {
     serious(msg, kLogUnbuffered);
     log_message(msg);
     ::close(fd);
-    return -1;
+    return why(std::move(reason));
   };
   if (!paths.bind_address.empty() && inet_pton(AF_INET, paths.bind_address.c_str(), &a.sin_addr) != 1)
-    return fail("Bind address not understood: " + paths.bind_address);
+    return fail("Bind address not understood: " + paths.bind_address, "the address is not understood");
   int bound;
   {
     BindingPrivileges root;  // the only step that may need root
     bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a);
   }
-  if (bound != 0) return fail(strprintf("Bind Failed - is another server running on this port: %d", port));
-  if (::listen(fd, 128) != 0) return fail(strprintf("Listen failed on port %d: %s", port, sys_error().c_str()));
+  if (bound != 0) {
+    std::string reason = sys_error();
+    return fail(strprintf("Bind Failed - is another server running on this port: %d", port), reason);
+  }
+  if (::listen(fd, 128) != 0) {
+    std::string reason = sys_error();
+    return fail(strprintf("Listen failed on port %d: %s", port, reason.c_str()), reason);
+  }
   socklen_t len = sizeof a;
   getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len);
   auto made = ConnectionCore::make(n, ++n.last_id, service, 0);
@@ -484,7 +509,7 @@ int net_listen(int service, int port) {
   return ntohs(a.sin_port);
 }
 
-int net_start() {
+int net_start(std::vector<ListenReport>* report) {
   auto& n = net();
   if (!n.ensure_epoll()) return 1;
   // Serving many clients needs many descriptors: take what the system allows.
@@ -493,12 +518,26 @@ int net_start() {
     lim.rlim_cur = lim.rlim_max == RLIM_INFINITY ? 65536 : lim.rlim_max;
     setrlimit(RLIMIT_NOFILE, &lim);
   }
-  std::vector<std::pair<int, int>> wanted;  // copied: opening touches nothing of the list
-  for (const auto& s : n.services)
-    if (s.port && (!s.enabled || *s.enabled)) wanted.emplace_back(s.number, *s.port);
-  for (auto [number, port] : wanted)
-    if (net_listen(number, port) < 0) return 1;
-  return 0;
+  std::vector<ListenReport> wanted;  // copied: opening touches nothing of the list
+  std::vector<int> numbers;
+  for (const auto& s : n.services) {
+    if (!s.port) continue;
+    wanted.push_back({.service = s.name,
+                      .address = paths.bind_address.empty() ? "0.0.0.0" : paths.bind_address,
+                      .port = *s.port,
+                      .enabled = !s.enabled || *s.enabled,
+                      .error = {}});
+    numbers.push_back(s.number);
+  }
+  int rc = 0;
+  for (std::size_t i = 0; i < wanted.size(); ++i) {
+    if (wanted[i].enabled && net_listen(numbers[i], wanted[i].port, &wanted[i].error) < 0) {
+      if (wanted[i].error.empty()) wanted[i].error = "failed";
+      rc = 1;
+    }
+  }
+  if (report) *report = std::move(wanted);
+  return rc;
 }
 
 void net_close_all() {
@@ -510,7 +549,7 @@ void net_close_all() {
     if (it != n.entries.end()) it->second.connection->close_now(CloseReason::shutdown);
   }
   for (std::size_t fd = 0; fd < n.slots.size(); ++fd)
-    if (n.slots[fd].ready) unwatch(static_cast<int>(fd));
+    if (n.slots[fd].ready || n.slots[fd].writable) unwatch(static_cast<int>(fd));
   n.released.clear();
 }
 
@@ -549,10 +588,25 @@ void net_pass(int timeout_ms) {
     Slot* s = n.slot(fd);
     // A descriptor closed earlier in this pass may already serve another.
     if (!s || s->generation != static_cast<std::uint32_t>(ev.data.u64 >> 32)) continue;
-    if (s->ready) {
-      auto ready = s->ready;  // the callback may unwatch its own descriptor
+    if (s->ready || s->writable) {
       progress_code = 140106;
-      guarded("descriptor handler", ready);
+      const std::uint32_t generation = s->generation;
+      if (s->writable && (ev.events & (EPOLLOUT | EPOLLERR | EPOLLHUP))) {
+        auto writable = std::move(s->writable);  // one wait, one call
+        s->writable = nullptr;
+        n.set_events(fd, *s, s->ready ? std::uint32_t{EPOLLIN} : 0u);
+        guarded("descriptor handler", writable);
+        s = n.slot(fd);  // the callback may have unwatched or reused it
+        if (!s || s->generation != generation) continue;
+        if (!s->ready && !s->writable) {
+          n.drop_raw(fd);  // nothing waits on it any more
+          continue;
+        }
+      }
+      if (s->ready && (ev.events & (EPOLLIN | EPOLLERR | EPOLLHUP))) {
+        auto ready = s->ready;  // the callback may unwatch its own descriptor
+        guarded("descriptor handler", ready);
+      }
       continue;
     }
     auto it = n.entries.find(s->connection);
@@ -623,12 +677,31 @@ void every_tick(std::function<void()> hook) { net().tick_hooks.push_back(std::mo
 bool watch_readable(int fd, std::function<void()> ready) {
   auto& n = net();
   if (fd < 0 || !n.ensure_epoll()) return false;
-  if (Slot* old = n.slot(fd); old && (old->connection || old->ready)) return false;
-  Slot& s = n.claim(fd);
+  Slot* old = n.slot(fd);
+  if (old && (old->connection || old->ready)) return false;
+  Slot& s = old && old->writable ? *old : n.claim(fd);
   s.ready = std::move(ready);
-  if (!n.set_events(fd, s, EPOLLIN)) {
+  if (!n.set_events(fd, s, EPOLLIN | (s.writable ? std::uint32_t{EPOLLOUT} : 0u))) {
     serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
-    s = Slot{};
+    s.ready = nullptr;
+    if (!s.writable) n.drop_raw(fd);
+    return false;
+  }
+  return true;
+}
+
+bool watch_writable(int fd, std::function<void()> ready) {
+  auto& n = net();
+  if (fd < 0 || !ready || !n.ensure_epoll()) return false;
+  Slot* s = n.slot(fd);
+  if (s && s->connection) return false;
+  // A slot still registered (its last wait is being answered) is kept.
+  if (!s || (!s->ready && !s->writable && !s->watched)) s = &n.claim(fd);
+  s->writable = std::move(ready);
+  if (!n.set_events(fd, *s, (s->ready ? std::uint32_t{EPOLLIN} : 0u) | EPOLLOUT)) {
+    serious(strprintf("Cannot watch descriptor %d: %s", fd, sys_error().c_str()), kLogUnbuffered);
+    s->writable = nullptr;
+    if (!s->ready) n.drop_raw(fd);
     return false;
   }
   return true;
@@ -637,9 +710,8 @@ bool watch_readable(int fd, std::function<void()> ready) {
 void unwatch(int fd) {
   auto& n = net();
   Slot* s = n.slot(fd);
-  if (!s || !s->ready) return;
-  if (s->watched) epoll_ctl(n.epoll_fd, EPOLL_CTL_DEL, fd, nullptr);
-  *s = Slot{};
+  if (!s || (!s->ready && !s->writable)) return;
+  n.drop_raw(fd);
 }
 
 // ---- connections ----------------------------------------------------------------------
@@ -703,5 +775,19 @@ Connection* connect_to(int service, std::string_view host, std::uint16_t port, s
 }
 
 void net_set_resolver(NameResolver resolver) { net().resolver = std::move(resolver); }
+
+std::uint64_t net_lookup_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done) {
+  auto& n = net();
+  if (!n.resolver.mail_exchangers) {
+    done(MxAnswer{});
+    return 0;
+  }
+  return n.resolver.mail_exchangers(domain, std::move(done));
+}
+
+void net_cancel_lookup(std::uint64_t handle) {
+  auto& n = net();
+  if (handle && n.resolver.cancel) n.resolver.cancel(handle);
+}
 
 }  // namespace velmor

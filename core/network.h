@@ -17,6 +17,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core/config.h"
 #include "core/connection.h"
@@ -99,17 +100,30 @@ struct ServiceDescriptor {
 // Adds (or replaces) a service. Its listener opens at net_start.
 void service_register(ServiceDescriptor service);
 const ServiceDescriptor* service_find(int number);
+// Every registered service, in the order of registration.
+std::vector<const ServiceDescriptor*> service_list();
 Admission service_admit(const ServiceDescriptor& service, std::uint32_t peer_nbo);
 
 // ---- start-up and shutdown ----------------------------------------------------
 
+// What net_start did with one registered service that has a port key.
+struct ListenReport {
+  std::string service;  // its name
+  std::string address;  // the address listened on ("0.0.0.0": every address)
+  int port = 0;         // the port asked for
+  bool enabled = true;  // false: switched off in the configuration, nothing opened
+  std::string error;    // why the port could not be taken ("" = listening)
+};
 // Opens a listener for every registered, enabled service with a port key,
-// in the order they were registered. 0 = done; 1 = a listener failed (logged).
-int net_start();
+// in the order they were registered; a port that cannot be taken does not
+// stop the others from being tried, so every failure is named. 0 = every
+// listener is open; 1 = at least one failed (logged). `report`, when given,
+// gets one entry per service with a port key.
+int net_start(std::vector<ListenReport>* report = nullptr);
 // Opens a listener of `service` on `port` of paths.bind_address (every
 // address when empty); port 0 takes an ephemeral one. The port bound; -1
-// when it failed (logged).
-int net_listen(int service, int port);
+// when it failed (logged, and the reason put in `error` when given).
+int net_listen(int service, int port, std::string* error = nullptr);
 // Closes every connection (their sessions hear CloseReason::shutdown),
 // listener and watched descriptor.
 void net_close_all();
@@ -136,6 +150,12 @@ void run_after_pass();
 // "Call this when this descriptor is readable" for datagram and other raw
 // descriptors the caller owns. false when it cannot be watched.
 bool watch_readable(int fd, std::function<void()> ready);
+// "Call this once when this descriptor can be written" (a datagram socket
+// whose reader's queue was full): the wait ends with the call; ask again to
+// wait again. The descriptor may also be watched for reading. false when it
+// cannot be watched.
+bool watch_writable(int fd, std::function<void()> ready);
+// Stops watching a raw descriptor, for reading and writing.
 void unwatch(int fd);
 
 // ---- connections -----------------------------------------------------------------
@@ -157,10 +177,27 @@ Connection* connect_to(int service, std::string_view host, std::uint16_t port, s
 // `start` calls `done` once with the address (network order; 0 = failed),
 // possibly before it returns, and gives a handle (0 when it ended at once);
 // `cancel` drops a lookup still running.
+// `mail_exchangers` looks up a domain's mail hosts the same way.
+enum class MxResult {
+  found,           // `hosts` holds them, lowest preference first
+  none,            // the domain exists and has no mail exchanger
+  no_such_domain,  // the name does not exist
+  failed,          // no usable answer (time-out, link down, no resolver)
+};
+struct MxAnswer {
+  MxResult result = MxResult::failed;
+  std::vector<std::string> hosts{};
+};
 struct NameResolver {
   std::function<std::uint64_t(std::string_view name, std::function<void(std::uint32_t)> done)> start{};
   std::function<void(std::uint64_t handle)> cancel{};
+  std::function<std::uint64_t(std::string_view domain, std::function<void(MxAnswer)> done)> mail_exchangers{};
 };
 void net_set_resolver(NameResolver resolver);
+// A domain's mail exchangers through the resolver: `done` is called once,
+// possibly before this returns (then 0 is returned), else the handle of
+// the lookup, which net_cancel_lookup drops without calling `done`.
+std::uint64_t net_lookup_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done);
+void net_cancel_lookup(std::uint64_t handle);
 
 }  // namespace velmor

@@ -12,11 +12,13 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <functional>
 #include <stdexcept>
 #include <string>
 #include <vector>
 
 #include "core/control.h"
+#include "core/hooks.h"
 #include "core/telnet.h"
 #include "core/test_files.h"
 #include "core/test_fixture.h"
@@ -454,6 +456,39 @@ TEST_F(NetworkTest, TwoThousandIdleClientsAndTheControlChannelAnswers) {
   ::close(ctl);
   control_remove();
   EXPECT_EQ(::access(paths.control.c_str(), F_OK), -1);
+}
+
+// A listing far longer than a reader's queue (ten datagrams) reaches a
+// reader that takes one datagram per pass whole and in order: the rest
+// waits for room, and the loop does not wait for the reader.
+TEST_F(NetworkTest, AQueueListingWaitsForItsReader) {
+  testing_files::ScratchDir dir;
+  paths.control = (dir.path() / "control").string();
+  hooks.list_mail_queue = [](const std::function<void(std::string_view)>& send) {
+    send("start mq\n");
+    for (int i = 0; i < 100; ++i) send("entry " + std::to_string(i));
+    send("end mq\n");
+  };
+  ASSERT_EQ(control_open(), 0);
+  UniqueFd reader(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  sockaddr_un self{};
+  self.sun_family = AF_UNIX;
+  ASSERT_EQ(::bind(reader.get(), reinterpret_cast<sockaddr*>(&self), sizeof(sa_family_t)), 0);
+  sockaddr_un to{};
+  to.sun_family = AF_UNIX;
+  std::snprintf(to.sun_path, sizeof to.sun_path, "%s", paths.control.c_str());
+  ASSERT_EQ(::sendto(reader.get(), "listmq", 6, 0, reinterpret_cast<sockaddr*>(&to), sizeof to), 6);
+  std::vector<std::string> got;
+  ASSERT_TRUE(pump([&] {
+    char buf[64];
+    ssize_t n = ::recv(reader.get(), buf, sizeof buf, MSG_DONTWAIT);
+    if (n > 0) got.emplace_back(buf, static_cast<std::size_t>(n));
+    return !got.empty() && got.back() == "end mq\n";
+  })) << got.size() << " " << (got.empty() ? std::string() : got.back());
+  ASSERT_EQ(got.size(), 102u);
+  EXPECT_EQ(got[0], "start mq\n");
+  EXPECT_EQ(got[57], "entry 56");
+  control_remove();
 }
 
 // One address holds at most a quarter of a service's slots; loopback any.

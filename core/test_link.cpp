@@ -34,6 +34,7 @@ Transport::Io TestLink::Memory::read(char* to, std::size_t room, std::size_t& go
 Transport::Io TestLink::Memory::write(std::span<const std::string_view> parts, std::size_t& put) {
   put = 0;
   if (link.reset_) return Io::failed;
+  ++link.writes_;
   for (std::string_view p : parts) {
     std::size_t n = std::min(p.size(), link.window_);
     link.to_peer_.append(p.substr(0, n));

@@ -62,6 +62,8 @@ class TestLink final : public ConnectionHost {
 
   Connection& connection() { return *connection_; }
   bool closed() const { return connection_->closed(); }
+  // How many writes the connection made (each one a segment on a socket).
+  int writes() const { return writes_; }
   std::optional<CloseReason> reason() const { return reason_; }
 
   // ConnectionHost
@@ -90,6 +92,7 @@ class TestLink final : public ConnectionHost {
   std::size_t taken_ = 0;
   std::size_t window_ = std::numeric_limits<std::size_t>::max();
   bool eof_ = false, reset_ = false;
+  int writes_ = 0;
   std::optional<CloseReason> reason_;
   bool touched_ = false;
   std::int64_t due_ = 0;

@@ -4,6 +4,7 @@
 #include "core/tls.h"
 
 #include <gtest/gtest.h>
+#include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -138,12 +139,15 @@ TEST_F(TlsTest, AClientThatVerifiesRefusesAnUnknownCertificateAndGarbageFailsThe
 
 // ---- connections of the loop ------------------------------------------------------------
 
+// Added to the clock while pumping, so a test can move past a time-out.
+std::time_t clock_ahead = 0;
+
 template <class Pred>
 bool pump(Pred done, int ms = 5000) {
   auto end = Clock::now() + std::chrono::milliseconds(ms);
   while (!done()) {
     if (Clock::now() > end) return false;
-    server_now = std::time(nullptr);
+    server_now = std::time(nullptr) + clock_ahead;
     net_pass(5);
   }
   return true;
@@ -246,15 +250,15 @@ class TlsLoopTest : public TlsTest {
     TlsTest::SetUp();
     paths.bind_address = "127.0.0.1";
     config.sock_buffer = 1024;
-    for (auto [number, implicit] : {std::pair{svc::pop, false}, std::pair{svc::pops, true}}) {
+    for (auto [number, tls_first] : {std::pair{svc::pop, false}, std::pair{svc::pops, true}}) {
       service_register({.number = number,
-                        .name = implicit ? "lines-tls" : "lines",
+                        .name = tls_first ? "lines-tls" : "lines",
                         .port = &port_key,
                         .timeout = &timeout,
                         .make_session = [this](Connection&, Admission) {
                           return std::make_unique<Lines>(lines, closes);
                         },
-                        .implicit_tls = implicit});
+                        .implicit_tls = tls_first});
     }
     plain = net_listen(svc::pop, 0);
     implicit = net_listen(svc::pops, 0);
@@ -314,12 +318,11 @@ TEST_F(TlsLoopTest, GarbageFailsAtOnceAStalledHandshakeTimesOutAndOthersAreServe
   EXPECT_EQ(connection_count(svc::pops), 2);
 
   // The stalled one goes at its idle time-out; the busy one stays.
-  server_now = std::time(nullptr) + timeout + 1;
-  EXPECT_EQ(connection_count(svc::pops), 2);
+  clock_ahead = timeout + 1;
   fine.send("y\r\n");
   ASSERT_TRUE(fine.wait_for("y secure\r\n"));
-  server_now = std::time(nullptr) + timeout + 1;
   net_tick();
+  clock_ahead = 0;
   ASSERT_TRUE(stalled.wait_end());
   EXPECT_EQ(connection_count(svc::pops), 1);
   EXPECT_EQ(closes.back(), CloseReason::timed_out);

@@ -12,6 +12,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cctype>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -20,6 +21,8 @@
 #include <exception>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 #include "core/commands.h"
 #include "core/config.h"
@@ -34,13 +37,17 @@
 #include "core/process.h"
 #include "core/scheduler.h"
 #include "core/network.h"
+#include "core/pidfile.h"
 #include "core/strfmt.h"
 #include "core/tls.h"
 #include "dialler/dialin.h"
 #include "dialler/dialler.h"
 #include "dns/service.h"
+#include "mail/imap_server.h"
+#include "mail/pop_client.h"
 #include "mail/pop_server.h"
 #include "mail/queue.h"
+#include "mail/smtp_client.h"
 #include "mail/smtp_server.h"
 #include "users/admin.h"
 
@@ -49,37 +56,106 @@ namespace {
 
 // ---- command line -----------------------------------------------------------
 
-constexpr const char* kUsage =
-    "usage: velmor [--root DIR] [--pid-file PATH] [--control PATH] [--bind ADDR]\n"
-    "              [--init [--standard-ports] [--user NAME]] [--help] [--version]\n"
-    "       velmor [--root DIR] --adduser NAME [--password PW] [--full-name TEXT]\n"
-    "              [--home DIR] [--group N]\n"
-    "       velmor [--root DIR] --passwd NAME [--password PW]\n"
-    "       velmor [--root DIR] --deluser NAME\n"
-    "\n"
-    "  --root DIR        the installation folder (default /usr/local/velmor)\n"
-    "  --pid-file PATH   where the process id is written (default DIR/run/velmor.pid)\n"
-    "  --control PATH    the control socket (default DIR/run/control)\n"
-    "  --bind ADDR       listen on this IPv4 address only (default: every address)\n"
-    "  --init            write the default installation into the root folder and exit;\n"
-    "                    files that exist are left alone, and a self-signed TLS certificate\n"
-    "                    for this host is made when there is none. Services listen on\n"
-    "                    unprivileged ports (SMTP 2525, POP3 1110, IMAP 1143, NNTP 1119,\n"
-    "                    web 8000; over TLS: SMTP 1465, submission 1587, POP3 1995, IMAP 1993)\n"
-    "  --standard-ports  with --init: SMTP 25, POP3 110, IMAP 143, NNTP 119, web 80; SMTP 465,\n"
-    "                    submission 587, POP3 995, IMAP 993\n"
-    "  --user NAME       with --init: server.user, the user the suite runs as once its\n"
-    "                    listeners are bound when started as root\n"
-    "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
-    "                    --password the password is read from standard input\n"
-    "  --passwd NAME     set a user's password; --deluser NAME removes a user. A running\n"
-    "                    suite is told to reload the user file\n"
-    "  --help            this text\n"
-    "  --version         the version\n";
+// How the console names each service, and the ports the default
+// installation gives it (unprivileged, and with --standard-ports). A service
+// is listed, and switched on by --init, only once it is built:
+// register_services() below says which.
+struct ServiceName {
+  std::string_view name;  // the service's own name
+  const char* title;
+  std::string_view port_placeholder;     // in the default configuration
+  std::string_view enabled_placeholder;  // "yes" when built, else "no"
+  int port, standard_port;
+};
+constexpr ServiceName kServiceNames[] = {
+    {"smtp", "SMTP", "@SMTP_PORT@", "@SMTP_ENABLED@", 2525, 25},
+    {"pop", "POP3", "@POP_PORT@", "@POP_ENABLED@", 1110, 110},
+    {"imap", "IMAP", "@IMAP_PORT@", "@IMAP_ENABLED@", 1143, 143},
+    {"nntp", "NNTP", "@NNTP_PORT@", "@NNTP_ENABLED@", 1119, 119},
+    {"web", "web server", "@WEB_PORT@", "@WEB_ENABLED@", 8000, 80},
+    {"smtps", "SMTPS", "@SMTPS_PORT@", "@SMTPS_ENABLED@", 1465, 465},
+    {"submission", "Submission", "@SUBMISSION_PORT@", "@SUBMISSION_ENABLED@", 1587, 587},
+    {"pops", "POP3S", "@POPS_PORT@", "@POPS_ENABLED@", 1995, 995},
+    {"imaps", "IMAPS", "@IMAPS_PORT@", "@IMAPS_ENABLED@", 1993, 993},
+};
+
+const ServiceName* service_name(std::string_view name) {
+  for (const auto& s : kServiceNames)
+    if (s.name == name) return &s;
+  return nullptr;
+}
+
+std::string service_title(std::string_view name) {
+  if (const ServiceName* s = service_name(name)) return s->title;
+  std::string title(name);
+  for (char& c : title) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+  return title;
+}
+
+// The services this build runs, in the order their listeners open. A new
+// service adds its register call here; --help, --init and the start-up
+// lines then name it.
+void register_services() {
+  imap_register();
+  pop_register();
+  smtp_register();
+  pop_client_register();  // outward only: no listener
+  smtp_client_register();
+  // The TLS listeners share the sessions of the plain services above.
+  tls_register_services();
+}
+
+// "SMTP 2525, POP3 1110": the built services with their default ports.
+std::string built_ports(bool standard) {
+  std::string out;
+  for (const ServiceDescriptor* d : service_list()) {
+    const ServiceName* s = d->port ? service_name(d->name) : nullptr;
+    if (!s) continue;
+    if (!out.empty()) out += ", ";
+    out += strprintf("%s %d", s->title, standard ? s->standard_port : s->port);
+  }
+  return out;
+}
+
+std::string usage() {
+  return "usage: velmor [--root DIR] [--pid-file PATH] [--control PATH] [--bind ADDR]\n"
+         "              [--init [--standard-ports] [--user NAME] [--no-demo]] [--help] [--version]\n"
+         "       velmor [--root DIR] --adduser NAME [--password PW] [--full-name TEXT]\n"
+         "              [--home DIR] [--group N]\n"
+         "       velmor [--root DIR] --passwd NAME [--password PW]\n"
+         "       velmor [--root DIR] --deluser NAME\n"
+         "\n"
+         "  --root DIR        the installation folder (default /usr/local/velmor)\n"
+         "  --pid-file PATH   where the process id is written (default DIR/run/velmor.pid)\n"
+         "  --control PATH    the control socket (default DIR/run/control)\n"
+         "  --bind ADDR       listen on this IPv4 address only (default: every address)\n"
+         "  --init            write the default installation into the root folder and exit;\n"
+         "                    files that exist are left alone. The services this build runs\n"
+         "                    listen on unprivileged ports (" +
+         built_ports(false) +
+         ")\n"
+         "  --standard-ports  with --init: " +
+         built_ports(true) +
+         "\n"
+         "  --user NAME       with --init: server.user, the user the suite runs as once its\n"
+         "                    listeners are bound when started as root\n"
+         "  --no-demo         with --init: no demo user (otherwise a new installation gets\n"
+         "                    the user demo with a random password, kept in DIR/demo-login)\n"
+         "  --adduser NAME    add a user (home DIR/home/NAME, group 0 unless given); without\n"
+         "                    --password the password is read from standard input\n"
+         "  --passwd NAME     set a user's password; --deluser NAME removes a user. A running\n"
+         "                    suite is told to reload the user file\n"
+         "  --help            this text\n"
+         "  --version         the version\n"
+         "\n"
+         "The suite stays in the foreground and prints each service it listens on; stop it\n"
+         "with SIGTERM or Ctrl-C. velmorctl --root DIR help lists what a running suite is told.\n";
+}
 
 struct Options {
   bool init = false;
   bool standard_ports = false;
+  bool demo = true;  // --init without --no-demo
   std::string user;  // --init --user
 };
 
@@ -106,7 +182,8 @@ int parse_command_line(int argc, char** argv, Options& options) {
     };
     bool ok = true;
     if (arg == "--help" || arg == "-h") {
-      std::fputs(kUsage, stdout);
+      register_services();
+      std::fputs(usage().c_str(), stdout);
       return 0;
     } else if (arg == "--version") {
       std::printf("velmor %s %s\n", kVersion, kPlatform);
@@ -128,6 +205,8 @@ int parse_command_line(int argc, char** argv, Options& options) {
       options.init = true;
     } else if (arg == "--standard-ports") {
       options.standard_ports = true;
+    } else if (arg == "--no-demo") {
+      options.demo = false;
     } else if (arg == "--user") {
       ok = value(options.user);
       if (ok && options.user.find_first_not_of("abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789._-") !=
@@ -136,16 +215,16 @@ int parse_command_line(int argc, char** argv, Options& options) {
         return 2;
       }
     } else {
-      std::fprintf(stderr, "velmor: unknown option '%s'\n%s", argv[i], kUsage);
+      std::fprintf(stderr, "velmor: unknown option '%s' (velmor --help lists them)\n", argv[i]);
       return 2;
     }
     if (!ok) {
-      std::fprintf(stderr, "velmor: %s needs a value\n%s", argv[i], kUsage);
+      std::fprintf(stderr, "velmor: %s needs a value (velmor --help lists the options)\n", argv[i]);
       return 2;
     }
   }
-  if ((options.standard_ports || !options.user.empty()) && !options.init) {
-    std::fprintf(stderr, "velmor: --standard-ports and --user go with --init\n");
+  if ((options.standard_ports || !options.user.empty() || !options.demo) && !options.init) {
+    std::fprintf(stderr, "velmor: --standard-ports, --user and --no-demo go with --init\n");
     return 2;
   }
   if (!root.empty()) {
@@ -203,19 +282,17 @@ int make_certificate(const Options& options) {
 // name and the ports filled in, and makes the folders the suite uses.
 int init_installation(const Options& options) {
   const bool standard = options.standard_ports;
-  const std::pair<std::string_view, std::string> values[] = {
+  std::vector<std::pair<std::string_view, std::string>> values = {
       {"@HOSTNAME@", host_name()},
-      {"@SMTP_PORT@", standard ? "25" : "2525"},
-      {"@POP_PORT@", standard ? "110" : "1110"},
-      {"@IMAP_PORT@", standard ? "143" : "1143"},
-      {"@NNTP_PORT@", standard ? "119" : "1119"},
-      {"@WEB_PORT@", standard ? "80" : "8000"},
-      {"@SMTPS_PORT@", standard ? "465" : "1465"},
-      {"@SUBMISSION_PORT@", standard ? "587" : "1587"},
-      {"@POPS_PORT@", standard ? "995" : "1995"},
-      {"@IMAPS_PORT@", standard ? "993" : "1993"},
       {"@SERVER_USER@", options.user},
   };
+  register_services();
+  for (const auto& s : kServiceNames) {
+    values.emplace_back(s.port_placeholder, std::to_string(standard ? s.standard_port : s.port));
+    bool built = false;
+    for (const ServiceDescriptor* d : service_list()) built = built || d->name == s.name;
+    values.emplace_back(s.enabled_placeholder, built ? "yes" : "no");
+  }
   make_path(paths.root);
   if (!file_is_directory(paths.root)) {
     std::printf("Cannot make the installation folder %s: %s\n", paths.root.c_str(), std::strerror(errno));
@@ -249,9 +326,21 @@ int init_installation(const Options& options) {
   }
   if (make_certificate(options) != 0) return 1;
   // Later subsystems add their own first-run steps here (sample users, ...).
-  if (users_make_demo() != 0) return 1;
+  if (options.demo && users_make_demo() != 0) return 1;
   std::printf("Velmor installation in %s: %d files written, %d left as they were\n", paths.root.c_str(), written,
               kept);
+  // What it will run: the built services switched on in its master file.
+  config_reset();
+  config_load_file(paths.master());
+  register_services();
+  std::string services;
+  for (const ServiceDescriptor* d : service_list()) {
+    if (!d->port || (d->enabled && !*d->enabled)) continue;
+    if (!services.empty()) services += ", ";
+    services += strprintf("%s port %d", service_title(d->name).c_str(), *d->port);
+  }
+  std::printf("Services: %s\n", services.empty() ? "none switched on" : services.c_str());
+  std::printf("Start it with: velmor --root %s\n", paths.root.c_str());
   return 0;
 }
 
@@ -325,7 +414,8 @@ void set_signal_handlers() {
   for (int s : {SIGPIPE, SIGIO, SIGURG}) sigaction(s, &sa, nullptr);
 }
 
-bool pid_file_written = false;
+// Held from the first step of start-up to the last of shutdown.
+PidFile pid_file;
 
 // ---- main loop --------------------------------------------------------------
 
@@ -397,7 +487,7 @@ void poll() {
 
 void shutdown_suite() {
   log_message("Shutting down");
-  if (pid_file_written) ::unlink(paths.pid_file.c_str());
+  pid_file.remove();
   control_remove();
   log_message("Shutting down dialler");
   dialler_shutdown();
@@ -412,31 +502,68 @@ void shutdown_suite() {
 
 // ---- start-up ---------------------------------------------------------------
 
-// An admin.email without "@" gets the mail domain (the first of
-// mail.domains, else server.name): it goes into every greeting.
-void complete_admin_email() {
-  if (!config.admin_email || config.admin_email->find('@') != std::string::npos) return;
-  std::string domain = text_of(config.mail_domains);
-  domain = domain.substr(0, domain.find_first_of(", \t"));
-  if (domain.empty()) domain = text_of(config.server_name);
-  if (!domain.empty()) *config.admin_email += "@" + domain;
+constexpr const char* kRefusal = "Velmor server is already running, or has died messily - cannot start new server";
+
+// Says what became of each service's port; the last word on a port that
+// could not be taken is the log's.
+void report_listeners(const std::vector<ListenReport>& report) {
+  for (const ListenReport& r : report) {
+    std::string title = service_title(r.service);
+    std::string line;
+    if (!r.enabled) {
+      line = "Not listening for " + title + ": switched off in the master configuration";
+    } else if (r.error.empty()) {
+      line = strprintf("Listening for %s on %s:%d", title.c_str(), r.address.c_str(), r.port);
+    } else {
+      line = strprintf("Cannot listen for %s on %s:%d: %s", title.c_str(), r.address.c_str(), r.port,
+                       r.error.c_str());
+    }
+    std::printf("%s\n", line.c_str());
+    log_message(line);
+  }
 }
 
-// The pid file is written under a temporary name and renamed into place, so
-// whoever sees it sees the whole number. When it cannot be written the suite
-// runs without one.
-void write_pid_file() {
+// Writes the pid file (see core/pidfile.h). False when another instance
+// published its own since start-up began: this one must not run.
+bool publish_pid_file() {
   make_parent_dirs(paths.pid_file);
-  pid_file_written = file_write_atomic(paths.pid_file, std::to_string(getpid()), false, 0644) == 0;
+  switch (pid_file.publish(getpid())) {
+    case PidFile::Claim::running:
+      return false;
+    case PidFile::Claim::failed:
+      log_message("The pid file cannot be written, running without one: ", pid_file.error());
+      break;
+    case PidFile::Claim::stale: {
+      std::string line = "Replaced the pid file of a suite that is no longer running";
+      if (!pid_file.stale_pid().empty()) line += " (process " + pid_file.stale_pid() + ")";
+      std::printf("%s\n", line.c_str());
+      log_message(line + ": ", pid_file.path());
+      break;
+    }
+    case PidFile::Claim::free:
+      break;
+  }
+  return true;
 }
 
 int start_and_run() {
   server_now = std::time(nullptr);
   refresh_crash_stamp();
   set_signal_handlers();
-  if (file_is_regular(paths.pid_file)) {
-    std::printf("Velmor server is already running, or has died messily - cannot start new server\n");
-    return 1;
+  // A file whose lock nobody holds was left by a suite that died: it is
+  // kept locked (so a second instance stops here) and replaced once the
+  // listeners are open.
+  switch (pid_file.claim(paths.pid_file)) {
+    case PidFile::Claim::running:
+      std::printf("%s\n", kRefusal);
+      return 1;
+    case PidFile::Claim::failed:
+      std::printf("%s\n(the pid file %s cannot be tested: %s)\n", kRefusal, paths.pid_file.c_str(),
+                  pid_file.error().c_str());
+      return 1;
+    case PidFile::Claim::free:
+    case PidFile::Claim::stale:
+      break;
   }
   std::printf("Velmor Server Suite starting...\n");
 
@@ -447,6 +574,10 @@ int start_and_run() {
   }
   if (int rc = config_load()) {
     std::printf("Config load faile d\n");
+    struct stat st {};
+    if (::stat(paths.master().c_str(), &st) != 0 && errno == ENOENT)
+      std::printf("No master configuration in %s: make a default installation with: velmor --root %s --init\n",
+                  paths.root.c_str(), paths.root.c_str());
     return rc;
   }
   std::printf("loaded config\n");
@@ -498,17 +629,15 @@ int start_and_run() {
   dns_register();  // its sockets open once the loop is up
   log_message("Initialising mail system");
   mail_init();
-  complete_admin_email();
-  // The services, in the order their listeners open; the TLS listeners
-  // follow the plain services whose sessions they share.
-  pop_register();
-  smtp_register();
-  tls_register_services();
+  register_services();
   tls_load();  // "TLS certificate loaded: ..." or why TLS is off
   log_message("Starting listening sockets");
+  std::vector<ListenReport> listening;
+  int listen_rc = net_start(&listening);
+  report_listeners(listening);
   // Without its control channel the suite could not be steered, and a
   // squatter on the path would get what local tools send: no start.
-  if (net_start() != 0 || control_open() != 0) {
+  if (listen_rc != 0 || control_open() != 0) {
     log_message("Socket initialisation failed - see logs for more info");
     net_close_all();
     control_remove();
@@ -524,9 +653,19 @@ int start_and_run() {
   }
   if (!text_of(config.server_user).empty()) log_message("Running as user ", text_of(config.server_user));
 
+  std::printf("Control channel: %s\n", paths.control.c_str());
+
   log_message("Suite started: ", kVersion);
   progress_code = 0;
-  write_pid_file();
+  if (!publish_pid_file()) {
+    log_message("Another suite started meanwhile: stopping");
+    dns_shutdown();
+    net_close_all();
+    control_remove();
+    return fail(kRefusal, 1);
+  }
+  std::printf("Velmor %s is running as process %ld; velmorctl --root %s status tells how it is\n", kVersion,
+              static_cast<long>(getpid()), paths.root.c_str());
 
   poll();
   shutdown_suite();

@@ -571,6 +571,7 @@ int dialler_init() {
   hooks.dial = [] { dial(); };
   hooks.disconnect = [] { disconnect(); };
   hooks.link_watch = [] { link_watch(); };
+  hooks.dialler_busy = [] { return dialler().state != st::idle; };
   return 0;
 }
 

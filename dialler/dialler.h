@@ -14,7 +14,8 @@
 
 namespace velmor {
 
-// Start-up: fills hooks.dial, hooks.disconnect and hooks.link_watch. 0.
+// Start-up: fills hooks.dial, hooks.disconnect, hooks.link_watch and
+// hooks.dialler_busy. 0.
 int dialler_init();
 // Main loop, every tick: finishes a serial-port reset that is due, runs the
 // link watch, checks the carrier while on line and advances the script.

@@ -265,6 +265,7 @@ void Resolver::finish(QueryId qid, Query& q, QueryState end, bool notify) {
     q.socket = 0;
   }
   q.state = end;
+  if (end == QueryState::failed && q.failure == Failure::none) q.failure = Failure::no_answer;
   if (notify && q.kind == Kind::lookup) ended_.emplace_back(qid, end);
 }
 
@@ -282,6 +283,13 @@ void Resolver::notify_ended() {
 QueryState Resolver::state(QueryId id) const {
   const Query* q = find(id);
   return q ? q->state : QueryState::failed;
+}
+
+Failure Resolver::failure(QueryId id) const {
+  const Query* q = find(id);
+  if (!q) return Failure::no_answer;
+  if (q->state != QueryState::failed) return Failure::none;
+  return q->failure == Failure::none ? Failure::no_answer : q->failure;
 }
 
 const std::vector<Answer>* Resolver::answers(QueryId id) const {
@@ -409,6 +417,7 @@ void Resolver::receive(SocketId socket, std::uint32_t source, std::uint16_t port
       debug("adding search:", q.name);
       if (!prepare_query(qid, q) || !transmit(q)) finish(qid, q, QueryState::failed, true);
     } else {
+      q.failure = Failure::no_such_name;
       finish(qid, q, QueryState::failed, true);
     }
     notify_ended();
@@ -462,6 +471,7 @@ void Resolver::take_answer(QueryId qid, Query& q, const std::vector<Record>& rec
     if (asked && same_name(r.name, current)) found = true;
   }
   if (!found) {
+    q.failure = Failure::no_records;
     finish(qid, q, QueryState::failed, true);
     return;
   }

@@ -63,6 +63,11 @@ std::vector<std::uint32_t> parse_servers(std::string_view text);
 
 enum class QueryState { started = 1, waiting = 2, failed = 3, complete = 4 };
 
+// Why a lookup failed: what a mail route needs to tell a domain that does
+// not exist (its mail goes back at once) from one without records of the
+// asked type and from a server that did not answer (try again later).
+enum class Failure { none, no_such_name, no_records, no_answer };
+
 // One answer record kept on a finished lookup: the records of the chain
 // from the question (CNAMEs and the asked type).
 struct Answer {
@@ -108,6 +113,8 @@ class Resolver {
   QueryId client_start(std::string_view name, int qclass, int qtype);
   // The lookup's state; failed for an unknown handle.
   QueryState state(QueryId id) const;
+  // Why a failed lookup failed (none while it has not failed).
+  Failure failure(QueryId id) const;
   // The IPv4 address (network byte order) of a complete lookup, following
   // its CNAMEs (8 at most); 0 when there is none.
   std::uint32_t client_ipaddr(QueryId id) const;
@@ -159,6 +166,7 @@ class Resolver {
     int retries = 0;
     std::size_t server_index = 0;
     std::vector<Answer> answers;
+    Failure failure = Failure::none;
   };
 
   std::time_t now() const { return clock_(); }

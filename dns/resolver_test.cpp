@@ -182,6 +182,24 @@ TEST_F(ResolverTest, MailExchangersComeBackByPreference) {
   EXPECT_EQ(hosts[0].host, "a.example.org");
 }
 
+// A mail route needs to know why: no such name, no records of the type,
+// or no answer at all.
+TEST_F(ResolverTest, AFailedLookupSaysWhy) {
+  QueryId nx = resolver.client_start("gone.example", 1, rrtype::mx);
+  Bytes reply = response(net.sent.at(0).packet, {});
+  reply[3] |= 3;  // name error
+  resolver.receive(net.sent.at(0).socket, net.sent.at(0).server, 53, reply);
+  EXPECT_EQ(resolver.failure(nx), Failure::no_such_name);
+  QueryId empty = resolver.client_start("plain.example", 1, rrtype::mx);
+  answer(net.sent.at(1), {});
+  EXPECT_EQ(resolver.failure(empty), Failure::no_records);
+  QueryId silent = resolver.client_start("slow.example", 1, rrtype::mx);
+  EXPECT_EQ(resolver.failure(silent), Failure::none);
+  for (std::time_t t = 1001; t <= 1020; ++t) at(t);
+  EXPECT_EQ(resolver.state(silent), QueryState::failed);
+  EXPECT_EQ(resolver.failure(silent), Failure::no_answer);
+}
+
 TEST(DnsCache, KeepsTenThousandNamesDroppingTheLeastRecentlyUsed) {
   Cache cache;
   auto record = [](int i) { return Record{Section::answer, "n" + std::to_string(i), 1, 1, 60, 0, "abcd"}; };

@@ -78,6 +78,7 @@ struct Glue {
   UdpTransport transport;
   dns::Resolver resolver{transport, [] { return server_now; }};
   std::unordered_map<QueryId, std::function<void(std::uint32_t)>> callbacks;
+  std::unordered_map<QueryId, std::function<void(MxAnswer)>> mx_callbacks;
   std::array<std::uint8_t, 65536> buffer{};
   // The key texts last applied, so a "reload config" is noticed.
   std::string servers_text, search_text;
@@ -110,8 +111,32 @@ void apply_settings() {
   g.resolver.configure(std::move(s));
 }
 
+MxAnswer mx_answer(QueryId id) {
+  auto& r = glue().resolver;
+  MxAnswer a;
+  if (r.state(id) == dns::QueryState::complete) {
+    for (dns::MxHost& h : r.client_mx(id)) a.hosts.push_back(std::move(h.host));
+    a.result = a.hosts.empty() ? MxResult::none : MxResult::found;
+    return a;
+  }
+  switch (r.failure(id)) {
+    case dns::Failure::no_such_name: a.result = MxResult::no_such_domain; break;
+    case dns::Failure::no_records: a.result = MxResult::none; break;
+    default: a.result = MxResult::failed; break;
+  }
+  return a;
+}
+
 void lookup_ended(QueryId id, dns::QueryState state) {
   auto& g = glue();
+  if (auto mx = g.mx_callbacks.find(id); mx != g.mx_callbacks.end()) {
+    auto done = std::move(mx->second);
+    g.mx_callbacks.erase(mx);
+    MxAnswer answer = mx_answer(id);
+    g.resolver.client_discard(id);
+    done(std::move(answer));
+    return;
+  }
   auto cb = g.callbacks.find(id);
   if (cb == g.callbacks.end()) return;
   auto done = std::move(cb->second);
@@ -162,7 +187,8 @@ void dns_register() {
   net_set_resolver({.start = [](std::string_view name, std::function<void(std::uint32_t)> done) {
                       return dns_lookup(name, std::move(done));
                     },
-                    .cancel = client_discard});
+                    .cancel = client_discard,
+                    .mail_exchangers = dns_mail_exchangers});
   hooks.lookup = control_lookup;
   hooks.link_probe_restart = [] { glue().resolver.restart_probing(); };
   hooks.link_hung_up = [] { glue().resolver.hung_up(); };
@@ -182,6 +208,7 @@ void dns_poll() {
 void dns_shutdown() {
   auto& g = glue();
   g.callbacks.clear();
+  g.mx_callbacks.clear();
   g.resolver.clear();
   g.transport.ready = false;
 }
@@ -197,6 +224,7 @@ std::uint32_t client_ipaddr(QueryId id) { return glue().resolver.client_ipaddr(i
 std::vector<dns::MxHost> client_mx(QueryId id) { return glue().resolver.client_mx(id); }
 void client_discard(QueryId id) {
   glue().callbacks.erase(id);
+  glue().mx_callbacks.erase(id);
   glue().resolver.client_discard(id);
 }
 
@@ -211,6 +239,19 @@ QueryId dns_lookup(std::string_view name, std::function<void(std::uint32_t addre
   std::uint32_t address = state == dns::QueryState::complete ? g.resolver.client_ipaddr(id) : 0;
   if (id) g.resolver.client_discard(id);
   done(address);
+  return 0;
+}
+
+QueryId dns_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done) {
+  auto& g = glue();
+  QueryId id = g.callbacks.size() + g.mx_callbacks.size() < kMaxCallbackLookups ? client_start(domain, 1, 15) : 0;
+  if (id && g.resolver.state(id) == dns::QueryState::waiting) {
+    g.mx_callbacks[id] = std::move(done);
+    return id;
+  }
+  MxAnswer answer = id ? mx_answer(id) : MxAnswer{};
+  if (id) g.resolver.client_discard(id);
+  done(std::move(answer));
   return 0;
 }
 

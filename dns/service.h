@@ -8,6 +8,7 @@
 #include <string_view>
 #include <vector>
 
+#include "core/network.h"
 #include "dns/resolver.h"
 
 namespace velmor {
@@ -38,5 +39,7 @@ void client_discard(QueryId id);
 // address in network byte order or 0 when it failed. The handle of the
 // lookup while it runs; 0 when it ended at once (`done` has been called).
 QueryId dns_lookup(std::string_view name, std::function<void(std::uint32_t address)> done);
+// A mail-exchanger lookup (class 1, type 15) with the same contract.
+QueryId dns_mail_exchangers(std::string_view domain, std::function<void(MxAnswer)> done);
 
 }  // namespace velmor

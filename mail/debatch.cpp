@@ -1,7 +1,9 @@
 // Debatching: one incoming file is checked against the sender's group
 // limits, every recipient is resolved through the alias table, local
 // recipients get the message in their mailbox and outside ones a file of the
-// outgoing queue. The recipients of a file are handled one per step, and the
+// outgoing queue (fetched mail excepted: it reaches local mailboxes only,
+// and a fetched message nobody local receives goes to oddments). The
+// recipients of a file are handled one per step, and the
 // poll works for a bounded time, so a message for many never holds up the
 // connections. Each mailbox and each outside address gets one copy however
 // often it is named. The incoming file is deleted only when every copy made
@@ -22,14 +24,16 @@
 #include "core/hooks.h"
 #include "core/log.h"
 #include "core/strfmt.h"
-#include "core/textfile.h"
 #include "core/util.h"
 #include "mail/alias.h"
 #include "mail/delivery.h"
 #include "mail/mailbox.h"
+#include "mail/pop_client.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
+#include "mail/recipient.h"
+#include "mail/smtp_client.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -41,6 +45,7 @@ using Clock = std::chrono::steady_clock;
 
 std::time_t g_last_traffic = 0;
 std::time_t g_retry_at = 0;  // rescan for files left after a temporary failure
+std::set<std::string> g_waiting_retry;  // those files, until the rescan lists them again
 bool g_debatch_pending = false;
 
 // A message that has passed this many relays is looping.
@@ -53,7 +58,7 @@ constexpr auto kDebatchSlice = std::chrono::milliseconds(10);
 // How long the overviews' upkeep may run in one go.
 constexpr auto kUpkeepSlice = std::chrono::milliseconds(4);
 
-class Debatch final : public AliasSink {
+class Debatch final : public QueueSink {
  public:
   Debatch(std::string path, CacheFile file) : path_(std::move(path)), file_(std::move(file)) {}
   ~Debatch() override {
@@ -63,8 +68,6 @@ class Debatch final : public AliasSink {
   const std::string path_;
   CacheFile file_;
   QueueEnvelope env_;
-  std::shared_ptr<const GroupOptions> sender_group;  // a local sender's group
-  bool sender_local = false;
   std::size_t next = 0;     // the envelope recipient to handle next
 
   int copies = 0;           // copies safely made (mailboxes, files, error mails)
@@ -102,11 +105,6 @@ class Debatch final : public AliasSink {
   }
 
   // ---- AliasSink ----
-  std::string local_user(std::string_view address) override {
-    return mail_local_user(address).value_or(std::string());
-  }
-  bool user_exists(std::string_view user) override { return velmor::user_exists(user); }
-
   // A local copy is queued here and written by run_deliveries(), a piece
   // at a time; it counts once its mailbox's commit has synced it.
   bool deliver_local(std::string_view user, std::string_view to_address) override {
@@ -156,6 +154,12 @@ class Debatch final : public AliasSink {
 
   void deliver_remote(std::string_view address) override {
     if (moved || !remote_.emplace(address).second) return;
+    if (env_.fetched) {
+      // Fetched mail is the site's own, collected from its providers: sent
+      // out again it would go back where it came from, and come back.
+      log_message("Fetched mail not sent on to ", address, logfac::maildebatch);
+      return;
+    }
     std::string_view domain = address_domain(address);
     if (!domain.empty() && config.smtp_direct && wildcard_match(domain, *config.smtp_direct)) {
       send_direct(address);
@@ -189,22 +193,13 @@ class Debatch final : public AliasSink {
       return false;
     }
     ++copies;
+    mail_log(strprintf("Archived: %s appended to %.*s (%llu bytes)", path_.c_str(), static_cast<int>(target.size()),
+                       target.data(), static_cast<unsigned long long>(filecache_length(file_))));
     return true;
   }
 
-  bool read_list(std::string_view target, std::vector<std::string>& lines) override {
-    std::string list_path(target);
-    if (!list_path.empty() && list_path.front() == '$') list_path.erase(0, 1);
-    std::optional<std::string> text = read_text_file(list_path);
-    if (!text) return false;
-    for_each_line(*text, [&](std::string_view line) { lines.emplace_back(line.substr(0, 128)); });
-    return true;
-  }
-
-  // Group mail ("+N") is for senders whose group may override the mail
-  // limits: the permission to reach a whole group.
   bool deliver_group(int number) override {
-    if (!sender_local || !sender_group || !(sender_group->mail_flags & gflag::mail_override)) {
+    if (!may_mail_group()) {
       error(strprintf("You do not have the permission to email group %d\r\n", number), {});
       return false;
     }
@@ -214,14 +209,7 @@ class Debatch final : public AliasSink {
   }
 
   void loop_report() override {
-    error("Aliasing loop whilst processing the following article\r\n", text_of(config.admin_email));
-  }
-
-  std::tm local_time() override {
-    std::time_t now = server_now ? server_now : std::time(nullptr);
-    std::tm tm{};
-    localtime_r(&now, &tm);
-    return tm;
+    error("Aliasing loop whilst processing the following article\r\n", admin_address());
   }
 
   void temporary(const std::string& recipient, std::string_view user) {
@@ -248,13 +236,18 @@ class Debatch final : public AliasSink {
       filecache_destroy(outgoing_);
       return;
     }
-    if (!commit_outgoing(outgoing_, !write_failed_))
+    std::string rcpts;
+    for (const std::string& r : outgoing_rcpts_) rcpts += (rcpts.empty() ? "" : ", ") + r;
+    if (!commit_outgoing(outgoing_, !write_failed_, rcpts))
       retry.insert(retry.end(), outgoing_rcpts_.begin(), outgoing_rcpts_.end());
   }
 
  private:
+  // A forced sender never replaces the null sender: an error mail must not
+  // be answered by another.
   std::string outgoing_sender() const {
-    if (config.mail_from_force && !config.mail_from_force->empty()) return *config.mail_from_force;
+    if (!env_.sender.empty() && config.mail_from_force && !config.mail_from_force->empty())
+      return *config.mail_from_force;
     return env_.sender;
   }
 
@@ -276,13 +269,13 @@ class Debatch final : public AliasSink {
       return;
     }
     int rc = filecache_write(out, "MAIL FROM:<" + outgoing_sender() + ">\r\nRCPT TO:<" + std::string(address) + ">\r\n");
-    if (!commit_outgoing(out, rc == 0)) retry.emplace_back(address);
+    if (!commit_outgoing(out, rc == 0, address)) retry.emplace_back(address);
   }
 
   // Copies the message (from its DATA line) behind an outgoing envelope,
   // syncs the file into place and lists it; a failure is temporary (the
   // disk may be full) and false.
-  bool commit_outgoing(CacheFile& out, bool ok) {
+  bool commit_outgoing(CacheFile& out, bool ok, std::string_view recipients) {
     if (ok && filecache_copy(file_, env_.data_offset, out, kToEnd) != 0) ok = false;
     std::string name = filecache_path(out);
     if (!ok) filecache_destroy(out);
@@ -292,6 +285,8 @@ class Debatch final : public AliasSink {
     }
     ++copies;
     queue_add_outgoing(name);
+    mail_log(strprintf("Queued to send: %.*s in %s (%llu bytes)", static_cast<int>(recipients.size()),
+                       recipients.data(), name.c_str(), static_cast<unsigned long long>(file_size(name))));
     return true;
   }
 
@@ -437,8 +432,7 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
     log_message("Article was POPed", {}, logfac::house);
   } else {
     std::optional<std::string> user = mail_local_user(env.sender);
-    d->sender_local = user.has_value();
-    d->sender_group = user_group(user.value_or(std::string()));
+    d->set_sender(env.sender);
     if (d->sender_group && refused_by_group(*d, *d->sender_group, user ? *user : env.sender, size)) {
       filecache_close(d->file_);
       if (d->moved) return nullptr;
@@ -450,8 +444,8 @@ std::unique_ptr<Debatch> debatch_start(const std::string& path) {
       return nullptr;
     }
   }
-  d->trace = strprintf("%ld %llu %s", static_cast<long>(std::time(nullptr)), static_cast<unsigned long long>(size),
-                       env.sender.c_str());
+  // Stamped like every other mail-log line (the SMTP lines share the file).
+  d->trace = strprintf("%llu <%s>", static_cast<unsigned long long>(size), env.sender.c_str());
   return d;
 }
 
@@ -479,13 +473,16 @@ bool debatch_recipient(Debatch& d) {
     d.next = d.env_.recipients.size();  // the header named the recipient
     return true;
   }
-  std::optional<std::string> local = mail_local_user(address);
-  if (local) {
-    if (alias_resolve(alias_table(), *local, d)) return true;
-    if (user_exists(*local) && d.deliver_local(*local, address)) return true;
-    d.error(strprintf("Local user %s does not exist\r\n", local->c_str()), {});
-  } else if (!alias_resolve(alias_table(), address, d)) {
-    d.deliver_remote(address);
+  RecipientResult to = route_recipient(address, d);
+  if (to.route == RecipientRoute::unknown_user) {
+    // A fetched message's sender is the site's own account at a provider:
+    // nobody there is told; unless delivered, it goes to oddments.
+    if (!d.env_.fetched) d.error(strprintf("Local user %s does not exist\r\n", to.local.c_str()), {});
+  } else if (to.route == RecipientRoute::no_administrator) {
+    // Kept for the operator rather than bounced: postmaster must reach someone.
+    log_write("Mail debatch: postmaster mail has nobody to go to (no postmaster alias, and admin.email names no user)",
+              logchan::errors);
+    d.fail("No administrator for postmaster mail - set a postmaster alias or admin.email");
   }
   return true;
 }
@@ -496,10 +493,13 @@ bool debatch_recipient(Debatch& d) {
 void debatch_finish(Debatch& d) {
   if (d.awaiting) mailbox_commit_staged();  // nothing is settled before its copies are
   d.finish_outgoing();
-  log_write(d.trace, logchan::mail_trace, kLogNoStamp);
+  log_write(d.trace, logchan::mail_trace);
   const std::string& path = d.path_;
   if (d.moved) {
     filecache_close(d.file_);
+  } else if (d.failure.empty() && d.env_.fetched && d.copies == 0) {
+    filecache_close(d.file_);
+    mail_move_to_oddments(path, "Fetched mail for no local user");
   } else if (d.failure.empty()) {
     filecache_close(d.file_);
     filecache_delete(path);
@@ -523,6 +523,8 @@ void debatch_finish(Debatch& d) {
     }
     filecache_close(d.file_);
     log_write("Mail debatch: " + d.failure + " - " + path + " left in the queue for a later try", logchan::errors);
+    mail_log("Kept for a later try: " + path + ": " + d.failure);
+    g_waiting_retry.insert(path);
     queue_retry_later();
   }
 }
@@ -616,6 +618,7 @@ int mail_init() {
   queue_init(now);
   g_last_traffic = now;
   g_retry_at = 0;
+  g_waiting_retry.clear();
   g_debatch_pending = false;
   log_message("    Loading mail alias entries", {}, logfac::house);
   alias_load();
@@ -628,12 +631,18 @@ int mail_init() {
 
   hooks.mailrescan = [] {
     queue_scan_outgoing();
+    g_waiting_retry.clear();  // listed again
     queue_scan_incoming();
   };
   hooks.maildebatch = [] { mail_debatch_one(); };
   hooks.background = mail_background;
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
+  hooks.incoming_mail_count = [] {
+    std::size_t retry = g_waiting_retry.size();
+    return std::pair<std::size_t, std::size_t>{queue_incoming().size() + (g_job ? 1 : 0) + g_parked.size() + retry,
+                                               retry};
+  };
   return 0;
 }
 
@@ -642,6 +651,7 @@ void mail_debatch_one() { debatch_for(Clock::now() + kDebatchSlice, true); }
 void mail_poll() {
   if (g_retry_at && server_now >= g_retry_at) {
     g_retry_at = 0;
+    g_waiting_retry.clear();
     queue_scan_incoming();
   }
   if (!queue_incoming().empty() && config.mail_debatch_time > 0 &&
@@ -650,7 +660,9 @@ void mail_poll() {
   // A slice per poll, bounded in time; while files wait, mail_background()
   // goes on between the dispatcher's passes.
   if (g_debatch_pending) debatch_for(Clock::now() + kDebatchSlice, false);
+  smtp_client_poll();
   mailbox_upkeep(Clock::now() + kUpkeepSlice);
+  pop_client_poll();  // the timed fetch, while the link is up
 }
 
 bool mail_background() {

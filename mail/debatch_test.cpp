@@ -133,20 +133,62 @@ TEST_F(DebatchTest, AFileWithoutRecipientsOrBodyGoesToOddments) {
   EXPECT_TRUE(folder_names(root + "/in", true).empty());
 }
 
-TEST_F(DebatchTest, FetchedMailGoesByTheListedHeaderAndOutwardUnderTheForcedSender) {
+TEST_F(DebatchTest, FetchedMailGoesByTheListedHeaderOrTheAliasesAndNeverOutward) {
   config.pop_headers = "X-Envelope-To, Delivered-To";
-  config.mail_from_force = "relay@site.example";
-  const std::string fetched = "POP3 MAIL FROM:<x@far.example>\r\nRCPT TO:<bob@site.example>\r\nDATA\r\n";
+  const std::string fetched = "POP3 MAIL FROM:<acct@isp.example>\r\nRCPT TO:<acct@isp.example>\r\nDATA\r\n";
   write_file(in("1"), fetched + "Delivered-To: Ann <ann@site.example>\r\nSubject: s\r\n\r\nbody\r\n.\r\n");
   debatch_file(in("1"));
   EXPECT_NE(read_file(root + "/home/ann/mail/inbox").find("Subject: s"), std::string::npos);
-  EXPECT_EQ(read_file(root + "/home/bob/mail/inbox"), "");
-  // No listed header: the envelope decides; outward the sender is forced.
-  write_file(in("2"), fetched.substr(0, 35) + "RCPT TO:<b@far.example>\r\n" + kMessage);
-  debatch_file(in("2"));
+  EXPECT_EQ(file_size(in("1")), -1);
+  // No listed header, nobody local behind the account's address, nor behind
+  // the header's, nor behind an alias that points outside: oddments, never
+  // the outgoing queue (it would go back to the provider).
+  alias_table() = alias_parse("other@isp.example friend@far.example\n");
+  write_file(in("2"), fetched + "Subject: s\r\n\r\nbody\r\n.\r\n");
+  write_file(in("3"), fetched + "Delivered-To: nosuch@site.example\r\n\r\nbody\r\n.\r\n");
+  write_file(in("4"), fetched + "X-Envelope-To: other@isp.example\r\n\r\nbody\r\n.\r\n");
+  for (const char* n : {"2", "3", "4"}) debatch_file(in(n));
+  EXPECT_TRUE(folder_names(root + "/out", true).empty());
+  EXPECT_TRUE(queue_incoming().empty());  // and nobody was sent an error mail
+  EXPECT_EQ(folder_names(root + "/odd", true).size(), 3u);
+  // An alias of the account's address delivers it.
+  alias_table() = alias_parse("acct@isp.example bob\n");
+  write_file(in("5"), fetched + "Subject: t\r\n\r\nbody\r\n.\r\n");
+  debatch_file(in("5"));
+  EXPECT_NE(read_file(root + "/home/bob/mail/inbox").find("Subject: t"), std::string::npos);
+  EXPECT_EQ(folder_names(root + "/odd", true).size(), 3u);
+  // An error mail keeps the null sender under a forced sender, so nobody answers it.
+  config.mail_from_force = "relay@site.example";
+  write_file(in("6"), std::string("MAIL FROM:<>\r\nRCPT TO:<c@far.example>\r\n") + kMessage);
+  debatch_file(in("6"));
   std::vector<std::string> out = folder_names(root + "/out", true);
   ASSERT_EQ(out.size(), 1u);
-  EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<relay@site.example>\r\nRCPT TO:<b@far.example>\r\n") + kMessage);
+  EXPECT_EQ(read_file(out[0]), std::string("MAIL FROM:<>\r\nRCPT TO:<c@far.example>\r\n") + kMessage);
+}
+
+TEST_F(DebatchTest, PostmasterMailGoesToTheAdministratorOrWaitsInOddments) {
+  auto postmaster = [&](const std::string& name, const char* to) {
+    write_file(in(name), "MAIL FROM:<x@far.example>\r\nRCPT TO:<" + std::string(to) + ">\r\n" + kMessage);
+    debatch_file(in(name));
+  };
+  config.admin_email = "bob";  // admin.email's local user
+  postmaster("1", "PostMaster@site.example");
+  EXPECT_NE(read_file(root + "/home/bob/mail/inbox").find("Subject: s"), std::string::npos);
+  alias_table() = alias_parse("postmaster carl\n");  // an alias comes first
+  postmaster("2", "postmaster");
+  EXPECT_NE(read_file(root + "/home/carl/mail/inbox").find("Subject: s"), std::string::npos);
+  alias_table().clear();
+  config.admin_email = "ops@far.example";  // an administrator elsewhere
+  postmaster("3", "postmaster@site.example");
+  std::vector<std::string> out = folder_names(root + "/out", true);
+  ASSERT_EQ(out.size(), 1u);
+  EXPECT_NE(read_file(out[0]).find("RCPT TO:<ops@far.example>\r\n"), std::string::npos);
+  // Nobody at all: kept for the operator, and no error mail to the sender.
+  config.admin_email = "postmaster";
+  postmaster("4", "postmaster@site.example");
+  EXPECT_EQ(folder_names(root + "/odd", true).size(), 1u);
+  EXPECT_TRUE(queue_incoming().empty());
+  EXPECT_TRUE(folder_names(root + "/in", true).empty());
 }
 
 TEST_F(DebatchTest, GroupMailReachesEveryMemberOnlyFromAPermittedSender) {

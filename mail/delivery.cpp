@@ -299,6 +299,8 @@ bool forwarded(const Recipient& r, const SafeDir& home, ByteSource& in, const Qu
     return false;
   }
   debug("Forwarded to:", target);
+  mail_log(strprintf("Forwarded: %s to %s by %s/.forward (%llu bytes)", r.user->login.c_str(), target.c_str(),
+                     r.user->home.c_str(), static_cast<unsigned long long>(in.size())));
   return true;
 }
 
@@ -320,29 +322,16 @@ void vacation(const Recipient& r, const SafeDir& home, const QueueLayout& q, std
     msg += as_transmission_body(body);
     return filecache_write(out, msg);
   });
-  if (rc) debug("Vacation reply could not be queued:", error_text(rc));
+  if (rc) {
+    debug("Vacation reply could not be queued:", error_text(rc));
+  } else {
+    mail_log("Vacation reply: to " + s + " for " + r.user->login);
+  }
 }
 
 // How much of a message one piece writes or parses.
 constexpr std::uint64_t kPieceBytes = 1024 * 1024;
 
-// A source seen only up to `limit` (the message just written, not what
-// may follow it).
-class LimitedSource final : public ByteSource {
- public:
-  LimitedSource(ByteSource& in, std::uint64_t limit) : in_(in), limit_(limit) {}
-  std::uint64_t size() const override { return std::min(in_.size(), limit_); }
-  std::string_view view(std::uint64_t offset, std::size_t want) override {
-    if (offset >= size()) return {};
-    std::string_view v = in_.view(offset, want);
-    return v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), size() - offset)));
-  }
-  bool failed() const override { return in_.failed(); }
-
- private:
-  ByteSource& in_;
-  std::uint64_t limit_;
-};
 
 std::unordered_map<std::string, std::pair<std::time_t, int>> g_new_boxes;  // login -> day, boxes made
 
@@ -648,10 +637,15 @@ struct LocalDelivery::State {
         written.reset();
         if (rec.total_length != at - slot.offset || next != kNoMessage) return failed(EIO);
         mailbox_append_stage(*box, slot, std::move(rec),
-                             [done = std::move(committed), login = r.user->login, where = path](int error) {
-                               if (error)
+                             [done = std::move(committed), login = r.user->login, where = path, to = recipient,
+                              size = at - slot.offset](int error) {
+                               if (error) {
                                  log_write("Mail delivery for `" + login + "' waits: " + where + ": " + error_text(error),
                                            logchan::errors);
+                               } else {
+                                 mail_log(strprintf("Delivered: %s to %s (%llu bytes)", to.c_str(), where.c_str(),
+                                                    static_cast<unsigned long long>(size)));
+                               }
                                if (done) done(error);
                              });
         return LocalOutcome::staged;

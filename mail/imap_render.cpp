@@ -203,8 +203,9 @@ class MimeValue {
       if (i_ >= v_.size() || v_[i_] != '(') return;
       int depth = 0;
       for (; i_ < v_.size(); ++i_) {
+        // A backslash quotes the next byte, when there is one.
         if (v_[i_] == '\\') {
-          ++i_;
+          if (i_ + 1 < v_.size()) ++i_;
           continue;
         }
         if (v_[i_] == '(') ++depth;

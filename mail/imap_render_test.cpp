@@ -213,6 +213,12 @@ TEST(ImapRender, NestedMultipartStructureAndParts) {
   EXPECT_EQ(b.item("RFC822.SIZE", "RFC822.SIZE"), std::to_string(b.item("BODY.PEEK[]", "BODY[]").size()));
 }
 
+TEST(ImapRender, AContentTypeEndingInAQuotingBackslashStillRenders) {
+  // A comment cut short by a lone backslash once read past the value's end.
+  Box b("Content-Type: text/plain; (a\\\r\n\r\nbody\r\n");
+  EXPECT_EQ(structure(b, "BODY"), "(\"TEXT\" \"PLAIN\" NIL NIL NIL \"7BIT\" 6 1)");
+}
+
 TEST(ImapRender, AttachedMessageHasItsEnvelopeAndItsOwnSections) {
   const char text[] =
       "Subject: fwd\r\nContent-Type: multipart/mixed; boundary=b\r\n\r\n"

@@ -28,6 +28,18 @@ std::list<Mailbox> g_boxes;  // lives as long as the process
 
 std::time_t now() { return server_now ? server_now : std::time(nullptr); }
 
+// A validity for identifiers starting afresh: the time, and never the one a
+// mailbox of that path had before in this run.
+std::uint32_t fresh_validity(const std::string& path) {
+  static std::unordered_map<std::string, std::uint32_t> given;
+  auto v = static_cast<std::uint32_t>(std::time(nullptr));
+  std::uint32_t& last = given[path];
+  if (v <= last) v = last + 1;
+  if (v == 0) v = 1;
+  last = v;
+  return v;
+}
+
 // ---- files below the home ---------------------------------------------------
 
 // The home of a mailbox path when none is given: the folder above "mail".
@@ -345,6 +357,7 @@ std::uint64_t entry_size(const MessageRecord& m) {
 // length. A reader takes the last such line, so the file is whole exactly
 // where one of them ends.
 void append_trailer(std::string& out, const Mailbox& box) {
+  if (box.uid_validity) strappendf(out, "#uidvalidity %u\n", box.uid_validity);
   strappendf(out, "#uidnext %u\n#length %llu\n", box.next_uid, static_cast<unsigned long long>(box.bytes));
 }
 
@@ -485,10 +498,24 @@ void appends_lost(Mailbox& box, int error) {
 void rebuild(Mailbox& box, ByteSource& in) {
   std::uint32_t next = std::max<std::uint32_t>(box.next_uid, 1);
   appends_lost(box, EAGAIN);
+  // Flags set by readers live in the overview only; the messages that keep
+  // their identifiers keep them.
+  constexpr std::uint32_t kKept = msgflag::seen | msgflag::answered | msgflag::flagged | msgflag::deleted |
+                                  msgflag::draft;
+  std::unordered_map<std::uint32_t, std::uint32_t> flags;
+  for (const auto& m : box.messages) flags.emplace(m.uid, m.flags & kKept);
   reset(box);
   box.next_uid = 1;
   parse_all(box, in, 0);
   box.next_uid = std::max(box.next_uid, next);
+  if (!flags.empty()) {
+    for (auto& m : box.messages) {
+      auto it = flags.find(m.uid);
+      if (it != flags.end()) m.flags = (m.flags & ~kKept) | it->second;
+    }
+    recount(box);
+  }
+  mailbox_notify(box);
   box.tail = box.bytes;
   overview_write_whole(box);
 }
@@ -538,6 +565,7 @@ void settle(Mailbox& box, FileSource& in, const struct stat& st) {
     parse_all(box, in, known);
     box.tail = box.bytes;
     overview_add(box, last == box.messages.end() ? box.messages.begin() : std::next(last));
+    mailbox_notify(box);
   } else {
     cut_back(box, st, known);
     ++box.epoch;
@@ -881,7 +909,7 @@ int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live_out)
     bool gone;
   };
   std::vector<Block> blocks;
-  std::uint32_t next = 1;
+  std::uint32_t next = 1, validity = 0;
   std::optional<std::uint64_t> committed;
   std::uint64_t sum = 0;
   // Numbers must fit their fields, or what is written back would differ.
@@ -926,6 +954,8 @@ int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live_out)
   while (next_line(line)) {
     if (line.substr(0, 9) == "#uidnext ") {
       next = std::max(next, parse_u32(line.substr(9)));
+    } else if (line.substr(0, 13) == "#uidvalidity ") {
+      validity = parse_u32(line.substr(13));
     } else if (line.substr(0, 8) == "#length ") {
       std::uint64_t v = 0;
       if (std::from_chars(line.data() + 8, line.data() + line.size(), v).ec != std::errc()) return 1;
@@ -1017,6 +1047,7 @@ int parse_overview(Mailbox& box, std::string_view text, std::uint64_t* live_out)
   box.messages = std::move(messages);
   box.flags_pending.clear();
   box.next_uid = next;
+  if (validity) box.uid_validity = validity;
   box.loaded = now();
   recount(box);
   box.tail = box.bytes;
@@ -1124,7 +1155,24 @@ int mailbox_commit_staged(Mailbox& box) {
   for (auto& s : staged) {
     if (s.done) s.done(rc);
   }
+  if (!rc) mailbox_notify(box);
   return rc;
+}
+
+void mailbox_append_withdraw(Mailbox& box, int error) {
+  if (box.staged.empty() || box.appending) return;
+  std::list<StagedMessage> staged;
+  staged.swap(box.staged);
+  if (box.append_fd) {
+    int fd = box.append_fd.get();
+    if (sysio::ftruncate(fd, static_cast<off_t>(box.bytes)) == 0) sysio::fsync(fd);
+  }
+  box.tail = box.bytes;
+  box.next_uid = staged.front().record.uid;
+  box.append_fd.close();
+  for (auto& s : staged) {
+    if (s.done) s.done(error);
+  }
 }
 
 void mailbox_commit_staged() {
@@ -1137,6 +1185,7 @@ void mailbox_commit_staged() {
 
 void mailbox_flags_changed(Mailbox& box, MessageRecord& message) {
   box.changed = true;
+  mailbox_notify(box);
   if (!message.flags_pending) {
     message.flags_pending = true;
     box.flags_pending.push_back(&message);
@@ -1264,10 +1313,23 @@ Mailbox* mailbox_lookup(const std::string& path, const std::string& home) {
     std::uint64_t known = mailbox_size(box);
     if (known < in.size() || (known == in.size() && !newer(st.st_mtim, written))) {
       settle(box, in, st);
+      if (!box.uid_validity) {
+        // An overview from before identifiers were given a validity: one
+        // is chosen now, and kept.
+        box.uid_validity = fresh_validity(box.path);
+        std::string trailer;
+        append_trailer(trailer, box);
+        overview_append(box, trailer);
+      }
+      box.recent_uid = box.next_uid - 1;
       return &box;
     }
   }
+  // A new mailbox, or one whose overview was lost: its identifiers start a
+  // new validity (a rebuild of a known overview keeps it).
+  if (!box.uid_validity) box.uid_validity = fresh_validity(box.path);
   rebuild(box, in);  // keeps the next identifier the overview knew
+  box.recent_uid = box.next_uid - 1;
   return &box;
 }
 
@@ -1292,18 +1354,59 @@ bool mailbox_take(Mailbox& box, std::uint64_t owner) {
   return true;
 }
 
+bool mailbox_share(Mailbox& box, std::uint64_t owner, std::function<void()> changed) {
+  if ((box.flags & boxflag::in_use) && box.sharers.empty()) return false;  // held whole by another
+  for (auto& s : box.sharers) {
+    if (s.owner == owner) {
+      s.changed = std::move(changed);
+      return true;
+    }
+  }
+  box.flags |= boxflag::in_use;
+  box.in_use_by = 0;
+  box.sharers.push_back({owner, std::move(changed)});
+  return true;
+}
+
 void mailbox_release(Mailbox& box, std::uint64_t owner) {
+  if (!box.sharers.empty()) {
+    std::erase_if(box.sharers, [owner](const Mailbox::Sharer& s) { return s.owner == owner; });
+    if (box.sharers.empty()) box.flags &= ~boxflag::in_use;
+    return;
+  }
   if ((box.flags & boxflag::in_use) && box.in_use_by == owner) {
     box.flags &= ~boxflag::in_use;
     box.in_use_by = 0;
   }
 }
 
+void mailbox_notify(Mailbox& box) {
+  for (std::size_t i = 0; i < box.sharers.size(); ++i) {
+    if (box.sharers[i].changed) box.sharers[i].changed();
+  }
+}
+
+bool mailbox_forget(const std::string& path) {
+  auto under = [&path](const Mailbox& b) {
+    return b.path == path || (b.path.size() > path.size() && b.path.starts_with(path) && b.path[path.size()] == '/');
+  };
+  for (const auto& box : g_boxes) {
+    if (under(box) && ((box.flags & boxflag::in_use) || box.appending || !box.staged.empty())) return false;
+  }
+  for (auto& box : g_boxes) {
+    if (!under(box)) continue;
+    compaction_abort(box);
+    g_compact_failed.erase(&box);
+  }
+  g_boxes.remove_if(under);
+  return true;
+}
+
 // ---- expunge ----------------------------------------------------------------
 
-int mailbox_expunge(Mailbox& box) {
-  bool any = std::any_of(box.messages.begin(), box.messages.end(),
-                         [](const MessageRecord& m) { return m.flags & msgflag::deleted; });
+int mailbox_expunge(Mailbox& box, const std::function<bool(const MessageRecord&)>& only) {
+  auto going = [&only](const MessageRecord& m) { return (m.flags & msgflag::deleted) && (!only || only(m)); };
+  bool any = std::any_of(box.messages.begin(), box.messages.end(), going);
   if (!any) return 0;
   // Messages written but not yet committed are committed first, so that
   // the new mailbox keeps them.
@@ -1333,7 +1436,7 @@ int mailbox_expunge(Mailbox& box) {
   int rc = 0;
   std::uint64_t offset = 0, run_start = 0, run_length = 0;
   for (const auto& m : box.messages) {
-    if (m.flags & msgflag::deleted) {
+    if (going(m)) {
       if (run_length && !rc) rc = copy_range(old.get(), run_start, run_length, out.get());
       run_start = offset + m.total_length;
       run_length = 0;
@@ -1366,9 +1469,9 @@ int mailbox_expunge(Mailbox& box) {
   // messages); it is compacted later, in the background.
   std::string text;
   std::uint64_t gone_live = 0;
-  std::erase_if(box.flags_pending, [](const MessageRecord* m) { return (m->flags & msgflag::deleted) != 0; });
+  std::erase_if(box.flags_pending, [&going](const MessageRecord* m) { return going(*m); });
   for (auto it = box.messages.begin(); it != box.messages.end();) {
-    if (!(it->flags & msgflag::deleted)) {
+    if (!going(*it)) {
       ++it;
       continue;
     }
@@ -1403,6 +1506,7 @@ int mailbox_expunge(Mailbox& box) {
   } else {
     overview_append(box, text);
   }
+  mailbox_notify(box);
   return 0;
 }
 

@@ -92,6 +92,21 @@ struct Mailbox {
   std::string home;
   std::uint32_t flags = 0;
   std::uint64_t in_use_by = 0;  // Connection::id() of the in-use mark's holder; 0 = none
+  // IMAP sessions share a mailbox among themselves (the in-use mark is then
+  // set with in_use_by 0, so POP3 and web mail stay out); each is told when
+  // the mailbox changes under it (new mail, flags, an expunge), so that its
+  // own view of the mailbox can catch up.
+  struct Sharer {
+    std::uint64_t owner = 0;
+    std::function<void()> changed;
+  };
+  std::vector<Sharer> sharers;
+  // Chosen when the mailbox is first indexed and kept in its overview, so
+  // identifiers stay valid across restarts (0 = not chosen yet).
+  std::uint32_t uid_validity = 0;
+  // Messages with identifiers above this one are new to the next IMAP
+  // session that looks (\Recent); kept in memory only.
+  std::uint32_t recent_uid = 0;
   int count = 0, unseen = 0;
   std::uint32_t next_uid = 1;
   bool changed = false;
@@ -143,11 +158,22 @@ UniqueFd mailbox_open(const Mailbox& box);
 // a mark can never pass to a later connection on the same descriptor.
 bool mailbox_take(Mailbox& box, std::uint64_t owner);
 void mailbox_release(Mailbox& box, std::uint64_t owner);
+// The shared form for IMAP sessions: any number of them hold a mailbox at
+// once, never together with an exclusive holder. `changed` is called (it
+// must only take note) whenever the mailbox changes. mailbox_release lets
+// go of either form.
+bool mailbox_share(Mailbox& box, std::uint64_t owner, std::function<void()> changed);
+// Tells every sharer that the mailbox changed.
+void mailbox_notify(Mailbox& box);
+// Drops the cached mailbox `path` and every one in a folder of that path
+// (they were deleted or renamed). Refused, with nothing dropped, while
+// anyone holds one of them or messages are being written into it.
+bool mailbox_forget(const std::string& path);
 // Removes the deleted messages, rewriting the mailbox through a temporary
 // file (made O_EXCL beside it, synced, given the old owner through its
 // descriptor) and a rename. 0 or an errno value (the old mailbox is then
-// intact).
-int mailbox_expunge(Mailbox& box);
+// intact). With `only`, just the deleted messages it accepts go.
+int mailbox_expunge(Mailbox& box, const std::function<bool(const MessageRecord&)>& only = {});
 int mailbox_overview_write(Mailbox& box);
 int mailbox_overview_read(Mailbox& box);
 // Marks a message seen by `user` (the message starts at `offset` of the
@@ -207,6 +233,10 @@ void mailbox_append_stage(Mailbox& box, const AppendSlot& slot, MessageRecord re
 // The append of `slot` failed: the file is cut back to where it began and
 // its identifier is given back when no later one was handed out.
 void mailbox_append_abandon(Mailbox& box, const AppendSlot& slot);
+// Takes back every staged message not yet committed (none may be in the
+// middle of being written): the file is cut back to the committed length,
+// their identifiers are handed out again, and each `done` hears `error`.
+void mailbox_append_withdraw(Mailbox& box, int error);
 // Whether the file was replaced or cut back since the slot was reserved.
 bool mailbox_append_stale(const Mailbox& box, const AppendSlot& slot);
 // Commits the staged messages of one box, or of every box. 0 or the errno
@@ -245,7 +275,8 @@ bool mailbox_header_dropped(std::string_view line);
 // "work"); "inbox" for anything that is not a plain name.
 std::string mailbox_box_for_address(std::string_view address);
 // The overview text, as compacted. Beside the messages it records the next
-// identifier ("#uidnext") and the mailbox's committed length ("#length", the
+// identifier ("#uidnext", behind "#uidvalidity" once one was chosen) and
+// the mailbox's committed length ("#length", the
 // sum of the messages' lengths; the last such line counts), so that what an
 // interrupted append left behind the committed length is recognised.
 // Later changes are appended as records: further "#msg" blocks, then

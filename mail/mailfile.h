@@ -56,6 +56,25 @@ class FileSource : public ByteSource {
   bool failed_ = false;
 };
 
+// The first `limit` bytes of another source (what is behind them is not
+// there for the reader).
+class LimitedSource final : public ByteSource {
+ public:
+  LimitedSource(ByteSource& in, std::uint64_t limit) : in_(in), limit_(limit) {}
+  std::uint64_t size() const override { return in_.size() < limit_ ? in_.size() : limit_; }
+  std::string_view view(std::uint64_t offset, std::size_t want) override {
+    if (offset >= size()) return {};
+    std::string_view v = in_.view(offset, want);
+    std::uint64_t left = size() - offset;
+    return v.size() > left ? v.substr(0, static_cast<std::size_t>(left)) : v;
+  }
+  bool failed() const override { return in_.failed(); }
+
+ private:
+  ByteSource& in_;
+  std::uint64_t limit_;
+};
+
 struct Line {
   std::uint64_t offset = 0;
   std::uint64_t length = 0;  // including the line end; 0 at the end of the source

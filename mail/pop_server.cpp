@@ -110,7 +110,7 @@ void PopSession::on_open(Connection& c) {
   c.send(strprintf("+OK %s Velmor Server Suite POP3 Server (v%s %s) ready at %s - Report problems to %s\r\n",
                    short_text(text_of(config.server_name)).c_str(), kVersion, kPlatform,
                    time_text(server_now ? server_now : std::time(nullptr)).c_str(),
-                   short_text(text_of(config.admin_email)).c_str()));
+                   short_text(admin_address()).c_str()));
 }
 
 void PopSession::on_input(Connection& c) {
@@ -254,7 +254,7 @@ bool PopSession::pass(Connection& c, std::string_view password) {
   std::size_t count;
   std::uint64_t octets;
   totals(count, octets);
-  log_message("Login:", user->login, logfac::pop);
+  log_message("Login:", user->login + " from " + c.peer().text, logfac::pop);
   c.send(strprintf("+OK %zu messages waiting for %s\r\n", count, user->login.c_str()));
   return true;
 }
@@ -484,6 +484,13 @@ bool PopSession::command(Connection& c, std::string_view line) {
     return true;
   }
   if (is("PASS")) return pass(c, arg);
+  if (is("CAPA")) {
+    // In every state; what a client may rely on (RFC 2449).
+    c.send(strprintf("+OK Capability list follows\r\nUSER\r\nUIDL\r\nTOP\r\nPIPELINING\r\nRESP-CODES\r\n"
+                     "IMPLEMENTATION Velmor-Server-Suite-%s\r\n.\r\n",
+                     kVersion));
+    return true;
+  }
   if (is("QUIT")) {
     quit(c);
     return true;

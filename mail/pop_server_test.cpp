@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <limits>
 
+#include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
 #include "mail/mailbox.h"
@@ -139,6 +140,23 @@ TEST_F(PopSessionTest, OverlongLinesLongVerbsAndLineEnds) {
   EXPECT_EQ(say(link, "NOOP\r"), "+OK\r\n");
   EXPECT_EQ(say(link, "\nNOOP\r\n"), "+OK\r\n");
   EXPECT_EQ(say(link, "\r\n"), "-ERR Bad command\r\n");
+}
+
+// The list itself is checked with a real client; here that it is the same
+// in every state, and that a login is logged with the client's address.
+TEST_F(PopSessionTest, CapaInEveryStateAndTheLoginLogNamesTheClient) {
+  mailbox({message(1, "a\r\n")});
+  log_parse("2 " + root + "/main\n");
+  log_mask = logfac::pop;
+  TestLink link(svc::pop);
+  link.take();
+  std::string capa = say(link, "CAPA\r\n");
+  EXPECT_TRUE(capa.starts_with("+OK ") && capa.ends_with("\r\n.\r\n")) << capa;
+  EXPECT_EQ(say(link, "USER alice\r\ncapa\r\n"), "+OK please send PASS command\r\n" + capa);
+  EXPECT_EQ(say(link, "PASS secret\r\nCAPA\r\n"), "+OK 1 messages waiting for alice\r\n" + capa);
+  log_flush_all();
+  EXPECT_NE(read_file(root + "/main").find("Login:alice from 127.0.0.1"), std::string::npos) << read_file(root + "/main");
+  log_parse("");
 }
 
 // A listing far longer than the output's high-water mark, to a client that

@@ -15,6 +15,7 @@
 #include "core/config.h"
 #include "core/globals.h"
 #include "core/log.h"
+#include "core/network.h"
 #include "core/strfmt.h"
 #include "core/textfile.h"
 #include "core/util.h"
@@ -179,18 +180,23 @@ PendingIncoming queue_open_incoming_pending() {
 namespace {
 struct Commit {
   std::string path, hidden;
-  int owner;
+  std::function<void(int error)> done;
 };
 std::vector<Commit> g_commits;
 }  // namespace
 
-void queue_commit_later(std::string path, std::string hidden, int owner) {
-  g_commits.push_back({std::move(path), std::move(hidden), owner});
+void queue_commit_later(std::string path, std::string hidden, std::function<void(int error)> done) {
+  g_commits.push_back({std::move(path), std::move(hidden), std::move(done)});
 }
 
 bool queue_commit_pending() { return !g_commits.empty(); }
 
-void queue_commit(const std::function<void(int owner, int error)>& done) {
+void queue_commit_register() {
+  // Each service that commits asks; a second hook finds nothing left to do.
+  after_pass([] { queue_commit(); });
+}
+
+void queue_commit() {
   std::vector<Commit> batch;
   batch.swap(g_commits);
   if (batch.empty()) return;
@@ -221,7 +227,7 @@ void queue_commit(const std::function<void(int owner, int error)>& done) {
       log_write(strprintf("Mail queue: %s not queued: %s", batch[i].path.c_str(), error_text(errors[i]).c_str()),
                 logchan::errors);
     }
-    done(batch[i].owner, errors[i]);
+    if (batch[i].done) batch[i].done(errors[i]);
   }
 }
 
@@ -298,6 +304,13 @@ void queue_scan_outgoing() {
 
 const std::list<std::string>& queue_incoming() { return g_incoming; }
 const std::list<OutgoingEntry>& queue_outgoing() { return g_outgoing; }
+std::list<OutgoingEntry>& queue_outgoing_entries() { return g_outgoing; }
+
+void queue_drop_outgoing(const std::string& path) {
+  auto before = g_outgoing.size();
+  g_outgoing.remove_if([&](const OutgoingEntry& e) { return e.path == path; });
+  if (g_outgoing.size() != before) status_bits |= status::mail_queue_changed;
+}
 
 // A message half written when the suite stopped was never acknowledged;
 // the counters start from the clock.
@@ -335,13 +348,7 @@ std::optional<std::string> mail_local_user(std::string_view address) {
   return name;
 }
 
-std::string mail_primary_domain() {
-  if (!config.mail_domains || config.mail_domains->empty()) return text_of(config.server_name);
-  std::string_view d = *config.mail_domains;
-  d = d.substr(d.find_first_not_of(" \t,") == std::string_view::npos ? d.size() : d.find_first_not_of(" \t,"));
-  d = d.substr(0, d.find_first_of(" \t,\r\n"));
-  return std::string(d.substr(0, 120));
-}
+std::string mail_primary_domain() { return primary_mail_domain(); }
 
 std::string mail_message_id(std::string_view header_name) {
   static unsigned long sequence = 0;
@@ -469,6 +476,8 @@ bool mail_filter_match(std::string_view filter, const std::string& path) {
   return found;
 }
 
+void mail_log(std::string_view line) { log_write(line, logchan::mail); }
+
 void mail_move_to_oddments(const std::string& path, std::string_view reason) {
   std::string dir = oddments_dir();
   make_path(dir);
@@ -479,8 +488,12 @@ void mail_move_to_oddments(const std::string& path, std::string_view reason) {
   log_write(strprintf("%.*s: %s moved to %s", static_cast<int>(reason.size()), reason.data(), path.c_str(),
                       target.c_str()),
             logchan::errors);
-  if (file_rename(path, target) != 0)
+  if (file_rename(path, target) != 0) {
     log_write("Mail queue: can't move " + path + " to oddments", logchan::errors);
+    return;
+  }
+  mail_log(strprintf("Oddment: %s moved to %s: %.*s", path.c_str(), target.c_str(), static_cast<int>(reason.size()),
+                     reason.data()));
 }
 
 // ---- error mails --------------------------------------------------------------------
@@ -502,6 +515,18 @@ std::string mail_body_lines(std::string_view text) {
   }
   return out;
 }
+
+namespace {
+
+// The reason an error mail gives, as one line for the mail log.
+std::string first_text_line(std::string_view text) {
+  std::string_view line = text.substr(0, text.find_first_of("\r\n"));
+  return std::string(line.empty() ? std::string_view("(no reason given)") : line);
+}
+
+std::string about(const std::string& file) { return file.empty() ? std::string() : " about " + file; }
+
+}  // namespace
 
 ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file, bool headers_only) {
   std::string recipient(to);
@@ -525,6 +550,7 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
   // Never answer the null sender: that is how mail loops and backscatter start.
   if (recipient.empty() || recipient == "<>") {
     log_message("mail send_error: no error mail to the null sender", {}, logfac::maildebatch);
+    mail_log("No error mail to the null sender" + about(file) + ": " + first_text_line(text));
     return ErrorMail::skipped;
   }
   if (source && (str_istarts_with(env.first_line, "X-Loop:") || file_contains(source, {"\nX-Loop:"}))) {
@@ -541,9 +567,11 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
     }
     return ErrorMail::failed;
   }
-  std::string admin = text_of(config.admin_email);
+  std::string admin = admin_address();
   std::string head;
-  head += "MAIL FROM:<" + admin + ">\r\n";
+  // From the null sender: a report about a report is never sent, so two
+  // sites can never bounce mail to each other for ever.
+  head += "MAIL FROM:<>\r\n";
   head += "RCPT TO:<" + recipient + ">\r\n";
   head += "DATA\r\n";
   head += "Date: " + mail_date_text(std::time(nullptr)) + "\r\n";
@@ -599,6 +627,7 @@ ErrorMail send_error_mail(std::string_view text, std::string_view to, const std:
     return ErrorMail::failed;
   }
   queue_add_incoming(path);
+  mail_log("Error mail to " + recipient + about(file) + ": " + first_text_line(text));
   return ErrorMail::sent;
 }
 

@@ -27,8 +27,9 @@ struct OutgoingEntry {
   std::string recipients;  // joined by ", "
   std::time_t mtime = 0;
   std::int64_t size = 0;
-  // Descriptor of the connection sending this file (-1 none): a rescan never
-  // drops an entry that a live connection holds.
+  // The SMTP client connection that has taken this file (-1 none), until
+  // that connection ends: no other connection sends it meanwhile, and a
+  // rescan never drops it.
   int holder = -1;
 };
 
@@ -56,9 +57,11 @@ const std::list<OutgoingEntry>& queue_outgoing();
 
 // The local user of an address, or nullopt when the address is not local.
 std::optional<std::string> mail_local_user(std::string_view address);
+// The site's primary mail domain (primary_mail_domain() in core/config.h).
 std::string mail_primary_domain();
 // Writes an error mail about `file` (may be empty) to `to` (or the file's
-// sender) into the incoming queue.
+// sender) into the incoming queue. It comes from the null sender "<>" (its
+// From: line names the administrator), and none goes to the null sender.
 void mail_send_error(std::string_view text, std::string_view to, const std::string& file);
 // The same for a message refused by size or content: only its header is
 // attached, so the report itself never breaks the limit it reports.

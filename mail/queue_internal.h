@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <ctime>
 #include <functional>
+#include <list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -13,6 +14,7 @@
 
 #include "core/filecache.h"
 #include "mail/mailfile.h"
+#include "mail/queue.h"
 
 namespace velmor {
 
@@ -79,23 +81,29 @@ enum class ErrorMail {
 ErrorMail send_error_mail(std::string_view text, std::string_view to, const std::string& file,
                           bool headers_only = false);
 
-// Incoming files committed in groups (the SMTP server): the message is
-// written to its hidden name and flushed without a sync of its own; one
-// commit then syncs the file system once, renames every finished file into
-// place and syncs the folder once, so a burst of messages costs two syncs in
-// all rather than two each. Nothing is acknowledged before its commit.
+// Incoming files committed in groups (the SMTP server, the POP3 client):
+// the message is written to its hidden name and flushed without a sync of
+// its own; one commit then syncs the file system once, renames every
+// finished file into place and syncs the folder once, so a burst of
+// messages costs two syncs in all rather than two each. Nothing is
+// acknowledged (or deleted at its source) before its commit. The commit
+// runs after the loop's pass (queue_commit_register).
 struct PendingIncoming {
   CacheFile file;         // writes go to the hidden name
   std::string path;       // the final name
   std::string hidden;     // the name it is written under
 };
 PendingIncoming queue_open_incoming_pending();
-// Queues a flushed file for the next commit; `owner` identifies who waits.
-void queue_commit_later(std::string path, std::string hidden, int owner);
+// Queues a flushed file for the next commit; `done(error)` is called when it
+// has run (error 0: the file is in place, durable and in the incoming list;
+// otherwise the hidden file is gone). Whoever waits for `done` and may go
+// away first must make it harmless (it is called in any case).
+void queue_commit_later(std::string path, std::string hidden, std::function<void(int error)> done);
 bool queue_commit_pending();
-// Runs the commit; `done(owner, error)` is called for each file (error 0:
-// the file is in place, durable and in the incoming list).
-void queue_commit(const std::function<void(int owner, int error)>& done);
+// Runs the commit for every file queued so far.
+void queue_commit();
+// Has the loop run the commit after every pass.
+void queue_commit_register();
 
 // Keeps a queue file for the recipients still to do: `first_line`, these
 // recipients and the message from its DATA line are written under the
@@ -112,6 +120,11 @@ void queue_file_discard(CacheFile& file);
 // Text made safe as message lines: CR LF line ends, dot-stuffed.
 std::string mail_body_lines(std::string_view text);
 
+// The outgoing list for the SMTP client, which claims entries (`holder`)
+// and drops the entry of a file it has delivered or returned.
+std::list<OutgoingEntry>& queue_outgoing_entries();
+void queue_drop_outgoing(const std::string& path);
+
 // Start-up of the queue itself: name counters from `now`, unfinished
 // hidden files removed.
 void queue_init(std::time_t now);
@@ -119,6 +132,10 @@ void queue_init(std::time_t now);
 std::optional<std::string> queue_pop_incoming();
 // The "listmq" listing, one datagram per call of `send`.
 void queue_list(const std::function<void(std::string_view)>& send);
+
+// One line of the mail log (stamped like every other line there) for each
+// delivery, forward, message queued to be sent, error mail and oddment.
+void mail_log(std::string_view line);
 
 // Noted whenever an SMTP connection receives data (the quiet period before
 // debatching runs from the last traffic).

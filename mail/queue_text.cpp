@@ -3,6 +3,7 @@
 #include <arpa/inet.h>
 
 #include <algorithm>
+#include <cstdint>
 
 #include "core/util.h"
 
@@ -36,6 +37,11 @@ EnvelopePath parse_envelope_path(std::string_view argument, std::string_view key
   EnvelopePath path;
   if (!envelope_keyword(argument, keyword)) return path;
   path.address = envelope_address(argument);
+  std::size_t end = path.address.data() ? static_cast<std::size_t>(path.address.data() - argument.data()) +
+                                              path.address.size()
+                                        : argument.size();
+  path.parameters = trim_blanks(argument.substr(std::min(end, argument.size())));
+  if (!path.parameters.empty() && path.parameters.front() == '>') path.parameters = trim_blanks(path.parameters.substr(1));
   if (path.address.empty() && !allow_empty) return path;
   if (path.address.size() > kMaxAddress) {
     path.result = PathResult::too_long;
@@ -43,6 +49,27 @@ EnvelopePath parse_envelope_path(std::string_view argument, std::string_view key
     path.result = envelope_address_fits(path.address) ? PathResult::ok : PathResult::bad_chars;
   }
   return path;
+}
+
+SizeParameter mail_size_parameter(std::string_view parameters, std::uint64_t& size) {
+  while (!parameters.empty()) {
+    std::size_t start = parameters.find_first_not_of(" \t");
+    if (start == std::string_view::npos) break;
+    parameters.remove_prefix(start);
+    std::string_view word = parameters.substr(0, parameters.find_first_of(" \t"));
+    parameters.remove_prefix(word.size());
+    if (!str_istarts_with(word, "SIZE=")) continue;
+    std::string_view digits = word.substr(5);
+    if (digits.empty() || digits.size() > 20 || digits.find_first_not_of("0123456789") != std::string_view::npos)
+      return SizeParameter::bad;
+    size = 0;
+    for (char c : digits) {
+      unsigned d = static_cast<unsigned>(c - '0');
+      size = size > (UINT64_MAX - d) / 10 ? UINT64_MAX : size * 10 + d;
+    }
+    return SizeParameter::given;
+  }
+  return SizeParameter::absent;
 }
 
 bool envelope_address_fits(std::string_view address) {
@@ -96,7 +123,7 @@ std::string mail_date_text(std::time_t t) { return date_text(t, "%a, %d %b %Y %H
 
 void MessageReceiver::end_of_header(std::string& out) {
   in_header_ = false;
-  if (date_seen_) return;
+  if (date_seen_ || !add_date) return;
   out += "Date: ";
   out += mail_date_text(now ? now : std::time(nullptr));
   out += "\r\n";

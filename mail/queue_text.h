@@ -41,9 +41,16 @@ enum class PathResult {
 };
 struct EnvelopePath {
   PathResult result = PathResult::syntax;
-  std::string_view address;  // points into the argument
+  std::string_view address;     // points into the argument
+  std::string_view parameters;  // what follows the path ("SIZE=1000 BODY=8BITMIME")
 };
 EnvelopePath parse_envelope_path(std::string_view argument, std::string_view keyword, bool allow_empty);
+
+// The SIZE=n parameter of MAIL (the size the client declares). `absent`
+// without one; `bad` when its value is not 1 to 20 digits. A value past
+// what 64 bits hold reads as the largest.
+enum class SizeParameter { absent, given, bad };
+SizeParameter mail_size_parameter(std::string_view parameters, std::uint64_t& size);
 // True when "RCPT TO:<address>" reads back as this same address.
 bool envelope_address_fits(std::string_view address);
 
@@ -80,6 +87,7 @@ class MessageReceiver {
   bool done() const { return done_; }
   bool date_added() const { return date_added_; }
   std::time_t now = 0;  // for the generated Date header (0: time(nullptr))
+  bool add_date = true;  // false: the header is kept as it came (fetched mail)
 
  private:
   void end_of_header(std::string& out);

@@ -8,8 +8,10 @@
 #include <limits>
 #include <set>
 
+#include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "mail/alias.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
 #include "users/users.h"
@@ -220,6 +222,70 @@ TEST_F(SmtpSessionTest, TheAcceptRuleRefusesBlocksAndAsksStrangersToIdentify) {
   for (const char* real : {"MAIL FROM:<ann@site.example>\r\n", "MAIL FROM:<someone@far.example>\r\n"})
     EXPECT_EQ(say(verify, std::string(real) + "RCPT TO:<ann@site.example>\r\n").back(),
               "250 OK Recipient syntactically correct");
+}
+
+// What a real client sees of the limit (552 at MAIL and at the end of the
+// data) is tested end to end; here the parts no client shows.
+TEST_F(SmtpSessionTest, EhloNamesItsExtensionsAndTheLimitCountsTheWholeQueueFile) {
+  write_file(root + "/groups", "#0\n%mail.msg.size: 1\n");  // 1024 bytes for every stranger
+  ASSERT_EQ(groups_load(root + "/groups"), 0);
+  config.server_name = "mx.site.example";
+  auto link = open();
+  EXPECT_EQ(say(*link, "EHLO client.example\r\nEHLO\r\n"),
+            (std::vector<std::string>{"250-mx.site.example Hello client.example, how's life?", "250-PIPELINING",
+                                      "250-SIZE 1024", "250-8BITMIME", "250 HELP",
+                                      "501 Syntax: EHLO hostname"}));
+  EXPECT_EQ(say(*link, "HELP\r\n").back(), "214 Report problems to postmaster@site.example");
+  EXPECT_EQ(say(*link, "MAIL FROM:<x@far.example> SIZE=12x\r\n"),
+            std::vector<std::string>{"501 Syntax error in SIZE parameter"});
+  // The envelope and the trace lines count: a 1000-byte message does not fit.
+  std::string text = "Subject: s\r\n\r\n" + std::string(980, 'z') + "\r\n.\r\n";
+  EXPECT_EQ(say(*link, std::string(kEnvelope) + text).back(), "552 Message size exceeds fixed maximum message size");
+  EXPECT_EQ(hidden(), std::vector<std::string>{});
+  // A group that overrides the limits has none.
+  write_file(root + "/groups", "#0\n%mail.msg.size: 1\n%mail.override: yes\n");
+  ASSERT_EQ(groups_load(root + "/groups"), 0);
+  EXPECT_EQ(say(*link, "EHLO again\r\n")[2], "250-SIZE");
+  EXPECT_EQ(say(*link, std::string(kEnvelope) + text).back(), "250 OK");
+}
+
+TEST_F(SmtpSessionTest, RecipientsAreCheckedAlongDebatchsRoute) {
+  write_file(root + "/users", "ann,x,Ann Lee," + root + "/ann,0\nboss,x,Boss," + root + "/boss,1\n");
+  write_file(root + "/groups", "#0\n#1\n%mail.override: yes\n");
+  ASSERT_EQ(user_load(root + "/users"), 0);
+  ASSERT_EQ(groups_load(root + "/groups"), 0);
+  write_file(root + "/list", "ann\n");
+  alias_table() = alias_parse("team ann,someone@far.example\nlist $" + root + "/list\nghost nosuchuser\n");
+  auto link = open();
+  say(*link, "MAIL FROM:<x@far.example>\r\n");
+  for (const char* known : {"ann_box@site.example", "team@site.example", "list@localhost", "Postmaster@localhost",
+                            "postmaster", "ann.lee@site.example", "a.lee@site.example", "nobody@site.example",
+                            "someone@far.example"})
+    EXPECT_EQ(say(*link, "RCPT TO:<" + std::string(known) + ">\r\n"),
+              std::vector<std::string>{"250 OK Recipient syntactically correct"})
+        << known;
+  for (const char* unknown : {"nosuchuser@site.example", "ghost@localhost", "+1@site.example"})
+    EXPECT_EQ(say(*link, "RCPT TO:<" + std::string(unknown) + ">\r\n"),
+              std::vector<std::string>{"550 Unknown local user <" + std::string(unknown) + ">"});
+  EXPECT_EQ(say(*link, "DATA\r\nSubject: s\r\n\r\nx\r\n.\r\n").back(), "250 OK");
+  std::string file = read_file(stored().at(0));
+  EXPECT_EQ(file.find("nosuchuser"), std::string::npos);
+  EXPECT_EQ(file.find("+1"), std::string::npos);
+  // Group mail from a sender whose group may reach a whole group.
+  EXPECT_EQ(say(*link, "MAIL FROM:<boss@site.example>\r\nRCPT TO:<+0@site.example>\r\n").back(),
+            "250 OK Recipient syntactically correct");
+  alias_table().clear();
+}
+
+TEST_F(SmtpSessionTest, CredentialsNeverReachTheMailLog) {
+  log_parse("8 " + root + "/maillog\n");
+  auto link = open();
+  say(*link, "AUTH PLAIN AGFubgBzZWNyZXQ=\r\n");
+  log_flush_all();
+  std::string log = read_file(root + "/maillog");
+  EXPECT_NE(log.find(" 127.0.0.1 - AUTH\n"), std::string::npos) << log;
+  EXPECT_EQ(log.find("AGFubgBzZWNyZXQ"), std::string::npos);
+  log_parse("");
 }
 
 }  // namespace

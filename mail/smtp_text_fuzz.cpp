@@ -1,4 +1,4 @@
-// Any bytes as a MAIL or RCPT argument, as a queue file and as the DATA
+// Any bytes as a MAIL or RCPT argument (and its parameters), as a queue file and as the DATA
 // stream. An address the server takes reads back the same from the queue
 // file line built from it; the queue file reader stays inside its input and
 // never hands out an address longer than a path may be; the message
@@ -24,6 +24,11 @@ void check(bool ok) {
 void envelope_paths(std::string_view text) {
   for (bool recipient : {true, false}) {
     EnvelopePath path = parse_envelope_path(text, recipient ? "to" : "from", !recipient);
+    // The parameters are a part of the argument behind the path.
+    check(path.parameters.empty() || (path.parameters.data() >= text.data() &&
+                                      path.parameters.data() + path.parameters.size() <= text.data() + text.size()));
+    std::uint64_t size = 0;
+    if (mail_size_parameter(path.parameters, size) != SizeParameter::given) check(size == 0);
     if (path.result != PathResult::ok) continue;
     std::string address(path.address);
     std::string file = "MAIL FROM:<a@b>\r\nRCPT TO:<" + address + ">\r\nDATA\r\nx\r\n.\r\n";

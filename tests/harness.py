@@ -163,19 +163,27 @@ class Suite:
         return self.proc
 
     def start(self, timeout=20):
-        """Starts the daemon and waits until it is ready: the pid file is
-        written (after the listeners are open) and, when velmorctl is built,
+        """Starts the daemon and waits until it is ready: the pid file names
+        it (written after the listeners are open) and, when velmorctl is built,
         the control channel answers "test"."""
         self.spawn()
         deadline = time.monotonic() + timeout
         while time.monotonic() < deadline:
             if self.proc.poll() is not None:
                 raise RuntimeError('velmor exited with %d:\n%s' % (self.proc.returncode, self.output()))
-            if os.path.exists(self.pid_file) and self._answers():
+            if self._pid_file_is_ours() and self._answers():
                 return self
             time.sleep(0.05)
         self.kill()
         raise RuntimeError('velmor did not become ready:\n' + self.output())
+
+    def _pid_file_is_ours(self):
+        # A file left by a killed suite names another process until it is replaced.
+        try:
+            with open(self.pid_file) as f:
+                return f.read().strip() == str(self.proc.pid)
+        except OSError:
+            return False
 
     def _answers(self):
         if not os.path.exists(VELMORCTL_BIN):
@@ -183,10 +191,12 @@ class Suite:
         rc, out = self.ctl('test', timeout=5)
         return rc == 0 and out.startswith('test:')
 
-    def ctl(self, command, timeout=10):
-        """Runs velmorctl --root R COMMAND -> (returncode, stdout)."""
-        r = subprocess.run([VELMORCTL_BIN, '--root', self.root, command], stdin=subprocess.DEVNULL,
-                           stdout=subprocess.PIPE, stderr=subprocess.STDOUT, timeout=timeout, text=True)
+    def ctl(self, command, timeout=10, raw=False):
+        """Runs velmorctl --root R COMMAND -> (returncode, stdout); with `raw`,
+        the suite's replies as they came (status: "is:...")."""
+        r = subprocess.run([VELMORCTL_BIN, '--root', self.root] + (['--raw'] if raw else []) + [command],
+                           stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.STDOUT,
+                           timeout=timeout, text=True)
         return r.returncode, r.stdout
 
     def signal(self, signum):

@@ -1,9 +1,12 @@
 """The control channel, through velmorctl and through plain datagram sockets."""
 
 import os
+import re
+import smtplib
 import socket
 import stat
 import subprocess
+import tempfile
 import time
 import unittest
 
@@ -45,7 +48,7 @@ class ControlChannelTest(SuiteTestCase):
         self.assertRegex(out, r'^test:\d+\n$')
         self.assertLess(abs(int(out[5:]) - time.time()), 5)
         for word in ('status', 'STATUS', 'Status'):
-            rc, out = self.suite.ctl(word)
+            rc, out = self.suite.ctl(word, raw=True)  # the reply as it came
             self.assertEqual(rc, 0)
             self.assertRegex(out, r'^is:\d+\nmq:\d+\nnq:0\nwf:\d+\npf:\d+\n$')
         # A trailing CR LF is ignored; anything more makes another command.
@@ -117,6 +120,7 @@ class ControlChannelTest(SuiteTestCase):
             r = subprocess.run([VELMORCTL_BIN, '--control', silent, 'status'], capture_output=True, timeout=10)
             self.assertNotEqual(r.returncode, 0)
             self.assertEqual(s.recv(100), b'status')
+            self.assertEqual(s.recv(100), b'incoming')  # status in words asks for that queue too
             # A command without a reply does not wait for one.
             r = subprocess.run([VELMORCTL_BIN, '--control', silent, 'reload', 'users'],
                                capture_output=True, timeout=10)
@@ -124,6 +128,57 @@ class ControlChannelTest(SuiteTestCase):
             self.assertEqual(s.recv(100), b'reload users')
         r = subprocess.run([VELMORCTL_BIN], capture_output=True, timeout=10)
         self.assertEqual(r.returncode, 2)
+
+
+class VelmorctlTest(SuiteTestCase):
+    config = {'mail.debatch.time': '0'}  # delivered only on "maildebatch"
+
+    def test_status_in_words(self):
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
+            c.sendmail('ann@example.org', ['demo@localhost'], b'Subject: hi\r\n\r\nhello\r\n')
+        rc, out = self.suite.ctl('status')
+        self.assertEqual(rc, 0, out)
+        lines = [' '.join(line.split()) for line in out.splitlines()]
+        for wanted in ('Incoming mail: 1 message waiting to be delivered',
+                       'Outgoing mail: 0 messages waiting to be sent',
+                       'News: 0 articles waiting to be sent', 'Link: down'):
+            self.assertIn(wanted, lines)
+        self.suite.ctl('maildebatch')
+        self.assertTrue(wait_for(lambda: 'Incoming mail: 0 messages waiting to be delivered'
+                                 in ' '.join(self.suite.ctl('status')[1].split()), 10))
+        # ... and the mail log says where it went.
+        self.assertRegex(self.suite.log('mail'), r'(?m) -> Delivered: demo@localhost to %s \(\d+ bytes\)$'
+                         % re.escape(self.suite.path('home/demo/mail/inbox')))
+
+
+class VelmorctlCommandLineTest(unittest.TestCase):
+
+    def run_ctl(self, *args):
+        return subprocess.run([VELMORCTL_BIN] + list(args), capture_output=True, text=True, timeout=10)
+
+    def test_help_version_and_an_unknown_command(self):
+        r = self.run_ctl('help')
+        self.assertEqual(r.returncode, 0)
+        listed = [line.split()[0] for line in r.stdout.splitlines() if line.startswith('  ') and
+                  not line.startswith('  --')]
+        for word in ('status', 'test', 'listmq', 'listnq', 'reload', 'change', 'log', 'nolog', 'clear',
+                     'maildebatch', 'mailrescan', 'mailtransfer', 'connect', 'disconnect', 'smtpkick',
+                     'popkick', 'newskick', 'newsdebatch', 'lookup', 'help'):
+            self.assertIn(word, listed)
+        r = self.run_ctl('--version')
+        self.assertEqual((r.returncode, r.stdout), (0, 'velmorctl 2.0.49\n'))
+        # Refused here, never sent: the suite would ignore it without a word.
+        with tempfile.TemporaryDirectory() as d, socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM) as s:
+            path = os.path.join(d, 'control')
+            s.bind(path)
+            for bad in (['stauts'], ['log', 'nosuch'], ['lookup']):
+                r = self.run_ctl('--control', path, *bad)
+                self.assertEqual(r.returncode, 2, bad)
+                self.assertIn('velmorctl help lists the commands', r.stderr)
+            self.assertIn("unknown command 'stauts'", self.run_ctl('--control', path, 'stauts').stderr)
+            s.setblocking(False)
+            with self.assertRaises(BlockingIOError):
+                s.recv(100)
 
 
 class ControlSocketLifetimeTest(unittest.TestCase):

@@ -53,7 +53,7 @@ class ResolverCase(unittest.TestCase):
 
     @classmethod
     def link_bit(cls):
-        rc, out = cls.suite.ctl('status')
+        rc, out = cls.suite.ctl('status', raw=True)
         return rc == 0 and int(out.split('\n')[0][3:]) & LINK
 
     @classmethod

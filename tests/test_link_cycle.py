@@ -59,7 +59,7 @@ class MailTransferCycleTest(unittest.TestCase):
         return [(response(query, rcode=3), None)]
 
     def status(self):
-        rc, out = self.suite.ctl('status')
+        rc, out = self.suite.ctl('status', raw=True)
         self.assertEqual(rc, 0, out)
         return int(out.split('\n')[0][3:]) & (LINK | DIALLER_ON)
 

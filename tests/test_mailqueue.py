@@ -42,6 +42,13 @@ class QueueCase(unittest.TestCase):
         with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
             c.sendmail(sender, recipients, message)
 
+    def queue(self, files):
+        """Puts files into the incoming queue as another program would."""
+        for name, text in files.items():
+            with open(os.path.join(self.suite.path('mail/in'), name), 'w', newline='') as f:
+                f.write(text)
+        self.suite.ctl('mailrescan')
+
     def debatch_all(self):
         """Debatches until the incoming queue is empty (error mails included)."""
         deadline = time.time() + 15
@@ -90,14 +97,18 @@ class DebatchTest(QueueCase):
         self.assertEqual(envelope, b'MAIL FROM:<ann@far.example>\r\nRCPT TO:<bob@remote.example>\r\n'
                                    b'RCPT TO:<carl@remote.example>\r\nRCPT TO:<dave@localhost>\r\n')
 
-    def test_unknown_local_user_gets_an_error_mail_but_the_null_sender_none(self):
-        self.send('', ['nosuchuser@localhost'], 'Subject: bounce me\r\n\r\nx\r\n')
+    def test_error_mail_goes_from_the_null_sender_and_never_to_it(self):
+        # The SMTP server refuses unknown local users; these files come from
+        # elsewhere (a fetched or a locally written message).
+        self.queue({'1': 'MAIL FROM:<>\r\nRCPT TO:<nosuchuser@localhost>\r\nDATA\r\nSubject: bounce me\r\n\r\nx\r\n.\r\n'})
         self.debatch_all()
         self.assertEqual(self.outgoing(), [])
-        self.send('ann@far.example', ['nosuchuser@localhost'], 'Subject: bounce me\r\n\r\nx\r\n')
+        self.queue({'2': 'MAIL FROM:<ann@far.example>\r\nRCPT TO:<nosuchuser@localhost>\r\nDATA\r\n'
+                         'Subject: bounce me\r\n\r\nx\r\n.\r\n'})
         self.debatch_all()
         [out] = self.outgoing()
-        self.assertTrue(out.startswith(b'MAIL FROM:<postmaster@site.example>\r\nRCPT TO:<ann@far.example>\r\nDATA\r\n'))
+        self.assertTrue(out.startswith(b'MAIL FROM:<>\r\nRCPT TO:<ann@far.example>\r\nDATA\r\n'))
+        self.assertIn(b'\r\nFrom: postmaster@site.example\r\n', out)
         self.assertIn(b'\r\nSubject: Mail failure\r\n', out)
         self.assertIn(b'\r\nX-Loop: 0\r\n', out)
         self.assertIn(b'Local user nosuchuser does not exist\r\n', out)
@@ -106,7 +117,6 @@ class DebatchTest(QueueCase):
         self.assertNotIn(b'\n', out.replace(b'\r\n', b''))
 
     def test_malformed_and_looping_files_go_to_oddments(self):
-        incoming = self.suite.path('mail/in')
         received = ''.join('Received: from hop%d\r\n' % i for i in range(31))
         samples = {
             '1': 'MAIL FROM:<a@b>\r\n',  # too short
@@ -116,10 +126,7 @@ class DebatchTest(QueueCase):
             '4': ('MAIL FROM:<a@far.example>\r\nRCPT TO:<nosuchuser@localhost>\r\nDATA\r\n'
                   'Subject: loop\r\nx-loop: 1\r\n\r\nx\r\n.\r\n'),
         }
-        for name, text in samples.items():
-            with open(os.path.join(incoming, name), 'w', newline='') as f:
-                f.write(text)
-        self.suite.ctl('mailrescan')
+        self.queue(samples)
         self.debatch_all()
         odd = [read(p) for p in numbered(self.suite, 'mail/odd')]
         self.assertEqual(sorted(odd), sorted(t.encode() for t in samples.values()))
@@ -158,10 +165,12 @@ class GroupLimitTest(QueueCase):
     files = {'config/groups': '#0\n%group.name: everyone\n%mail.msg.size: 1\n%mail.smtp.send: yes\n'}
 
     def test_message_over_the_size_limit_is_refused_with_an_error_mail(self):
-        self.send('ann@far.example', ['bob@remote.example'], 'Subject: large\r\n\r\n' + 'z' * 3000 + '\r\n')
+        # Over SMTP it never gets this far; a file written by another program does.
+        self.queue({'1': 'MAIL FROM:<ann@far.example>\r\nRCPT TO:<bob@remote.example>\r\nDATA\r\n'
+                         'Subject: large\r\n\r\n' + 'z' * 3000 + '\r\n.\r\n'})
         self.debatch_all()
         [out] = self.outgoing()
-        self.assertTrue(out.startswith(b'MAIL FROM:<postmaster@site.example>\r\nRCPT TO:<ann@far.example>\r\n'))
+        self.assertTrue(out.startswith(b'MAIL FROM:<>\r\nRCPT TO:<ann@far.example>\r\n'))
         self.assertIn(b'The following email was greater than the 1kB length limit, at 3kB\r\n', out)
         self.assertIn(b'Subject: large\r\n', out)
         self.assertNotIn(b'zzzz', out)  # the refused body is not sent back

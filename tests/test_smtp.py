@@ -4,6 +4,7 @@ Debatching is off (mail.debatch.time 0), so every accepted message stays in
 the incoming queue where the tests read it back.
 """
 import os
+import re
 import select
 import shutil
 import smtplib
@@ -82,8 +83,9 @@ class SmtpServerTest(SuiteTestCase):
         with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
             refused = c.sendmail('ann@far.example', ['postmaster@localhost', 'bob@remote.example'], message)
             self.assertEqual(refused, {})
-            # smtplib tried EHLO first, got the unknown-command reply and fell back.
-            self.assertIsNone(c.esmtp_features.get('size'))
+            # EHLO names the extensions; SIZE is the default group's limit (10240 kB).
+            self.assertEqual(c.esmtp_features,
+                             {'pipelining': '', 'size': '10485760', '8bitmime': '', 'help': ''})
         files = queue_files(self.suite)
         self.assertEqual(len(files), 1)
         data = read(files[0])
@@ -108,7 +110,8 @@ class SmtpServerTest(SuiteTestCase):
         c = Conversation(self.suite.port('smtp'))
         self.assertRegex(c.greeting, r'^220 \S+ Velmor Server Suite SMTP Server  \(v2\.0\.49 \[Linux/i386\]\) ready at '
                                      r'\d\d:\d\d:\d\d, \d\d \w{3} - Report problems to \S+$')
-        self.assertEqual(c.cmd('EHLO me.example'), '500 Unknown command:EHLO')
+        self.assertRegex(c.cmd('EHLO me.example'), r"^250-\S+ Hello me.example, how's life\?$")
+        self.assertEqual([c.line() for _ in range(4)], ['250-PIPELINING', '250-SIZE 10485760', '250-8BITMIME', '250 HELP'])
         self.assertEqual(c.cmd('HELO me.example'), "250 Hello me.example, how's life?")
         self.assertEqual(c.cmd('VERYLONGVERB x'), '500 Bad command - too long')
         self.assertEqual(c.line(), '500 Unknown command:VERYLONGVE')
@@ -120,6 +123,7 @@ class SmtpServerTest(SuiteTestCase):
         self.assertEqual(c.cmd('DATA'), '503 Need RCPT before DATA')
         self.assertEqual(c.cmd('RCPT TO:<>'), '501 Syntax: RCPT TO:<address>')
         self.assertEqual(c.cmd('VRFY nosuchuser'), '550 Unknown user (Server only checks mailbox/login names)')
+        self.assertRegex(c.cmd('VRFY demo'), r'^250 .* <demo@localhost>$')  # loopback is the site's own
         self.assertEqual(c.cmd('TURN'), '502 TURN not available')
         self.assertEqual(c.cmd('NOOP'), '250 OK')
         self.assertEqual(c.cmd('RSET'), '250 Reset OK')
@@ -132,6 +136,7 @@ class SmtpServerTest(SuiteTestCase):
         self.assertEqual(len(hidden_files(self.suite)), 1)  # the transaction's file
         self.assertRegex(c.cmd('QUIT'), r'^221 \S+ Velmor SMTP Server \(2\.0\.49\) closing connection at ')
         c.wait_closed()  # the session has let go of everything by now
+        c.close()
         self.assertEqual(queue_files(self.suite), [])
         self.assertEqual(hidden_files(self.suite), [])
 
@@ -183,7 +188,7 @@ class SmtpServerTest(SuiteTestCase):
 
     def test_ten_megabyte_message(self):
         line = b'0123456789' * 7 + b'\r\n'
-        body = line * (10 * 1024 * 1024 // len(line) + 1)
+        body = line * (10 * 1000 * 1000 // len(line))  # just inside the default 10240 kB limit
         message = b'Subject: big\r\n\r\n' + body
         with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=30) as c:
             c.sendmail('ann@far.example', ['postmaster@localhost'], message)
@@ -207,12 +212,12 @@ class SmtpServerTest(SuiteTestCase):
         self.assertEqual(len(queue_files(self.suite)), 1)
 
     def test_envelopes_are_stored_as_judged_each_recipient_once_and_at_most_a_hundred(self):
-        recipients = ['postmaster@localhost'] * 3 + ['u%d@localhost' % i for i in range(100)]
+        recipients = ['postmaster@localhost'] * 3 + ['u%d@remote.example' % i for i in range(100)]
         with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
             refused = c.sendmail('ann@far.example', recipients, 'Subject: many\r\n\r\nx\r\n')
-        self.assertEqual(refused, {'u99@localhost': (452, b'Too many recipients')})
+        self.assertEqual(refused, {'u99@remote.example': (452, b'Too many recipients')})
         envelope = read(queue_files(self.suite)[0]).split(b'\r\nDATA\r\n')[0].split(b'\r\n')
-        self.assertEqual(envelope[1:3], [b'RCPT TO:<postmaster@localhost>', b'RCPT TO:<u0@localhost>'])
+        self.assertEqual(envelope[1:3], [b'RCPT TO:<postmaster@localhost>', b'RCPT TO:<u0@remote.example>'])
         self.assertEqual(len(envelope), 101)
         # The file holds the addresses as parsed, never the client's lines;
         # a line over the limit is refused whole, never acted on in part.
@@ -276,10 +281,12 @@ class PublicPeerTest(unittest.TestCase):
                 replies = peer.talk(suite.port('smtp'), [
                     'HELO stranger', 'MAIL FROM:<someone@far.example>', 'RCPT TO:<victim@evil.org>',
                     'RCPT TO:' + ' ' * 4072 + '<victim@evil.org.example.com>', 'RCPT TO:<demo@localhost>',
-                    'DATA', 'Subject: relay?\r\n\r\nbody\r\n.', 'QUIT'])
+                    'DATA', 'Subject: relay?\r\n\r\nbody\r\n.', 'VRFY demo', 'QUIT'])
                 self.assertEqual(replies[3:6], ['550 Posting to this address forbidden', '500 Line too long',
                                                 '250 OK Recipient syntactically correct'])
                 self.assertEqual(replies[7], '250 OK')
+                # Who the users are is for the site's own network only.
+                self.assertEqual(replies[8], '252 Cannot VRFY user, but will accept message and attempt delivery')
                 [queued] = queue_files(suite)
                 self.assertTrue(read(queued).startswith(
                     b'MAIL FROM:<someone@far.example>\r\nRCPT TO:<demo@localhost>\r\nDATA\r\n'))
@@ -291,6 +298,72 @@ class PublicPeerTest(unittest.TestCase):
                 self.assertFalse(any(b'evil.org' in read(p) for p in queue_files(suite, 'mail/out')))
             finally:
                 suite.cleanup()
+
+
+class LimitAndRecipientTest(unittest.TestCase):
+    """Every stranger may send 1 kB; config/aliases is the one --init wrote,
+    with one alias more."""
+
+    def setUp(self):
+        self.suite = Suite(config=NO_DEBATCH)
+        self.addCleanup(self.suite.cleanup)
+        with open(self.suite.path('config/groups'), 'w') as f:
+            f.write('#0\n%group.name: everyone\n%mail.msg.size: 1\n%mail.smtp.send: yes\n')
+        with open(self.suite.path('config/aliases'), 'a') as f:
+            f.write('team demo\n')
+        self.suite.start()
+
+    def test_a_message_over_the_limit_is_refused_at_mail_or_at_the_end_of_its_data(self):
+        big = 'Subject: large\r\n\r\n' + ('z' * 70 + '\r\n') * 40
+        with smtplib.SMTP('127.0.0.1', self.suite.port('smtp'), timeout=10) as c:
+            c.ehlo('me.example')
+            self.assertEqual(c.esmtp_features['size'], '1024')
+            # smtplib declares the size: refused before any data is sent.
+            with self.assertRaises(smtplib.SMTPSenderRefused) as refused:
+                c.sendmail('ann@far.example', ['postmaster@localhost'], big)
+            self.assertEqual(refused.exception.smtp_code, 552)
+            # Declared small, sent large: refused at the end, nothing kept.
+            self.assertEqual(c.mail('ann@far.example', ['SIZE=100'])[0], 250)
+            self.assertEqual(c.rcpt('postmaster@localhost')[0], 250)
+            self.assertEqual(c.data(big), (552, b'Message size exceeds fixed maximum message size'))
+            self.assertEqual(queue_files(self.suite), [])
+            self.assertEqual(hidden_files(self.suite), [])
+            self.assertEqual(c.sendmail('ann@far.example', ['postmaster@localhost'], 'Subject: small\r\n\r\nx\r\n'), {})
+        self.assertEqual(len(queue_files(self.suite)), 1)
+
+    def test_unknown_local_users_are_refused_and_postmaster_sub_addresses_and_aliases_delivered(self):
+        c = Conversation(self.suite.port('smtp'))
+        c.cmd('HELO me')
+        c.cmd('MAIL FROM:<ann@far.example>')
+        self.assertEqual(c.cmd('RCPT TO:<nosuchuser@site.example>'), '550 Unknown local user <nosuchuser@site.example>')
+        for known in ('PostMaster@site.example', 'demo_work@localhost', 'team@site.example'):
+            self.assertEqual(c.cmd('RCPT TO:<%s>' % known), '250 OK Recipient syntactically correct')
+        self.assertTrue(c.cmd('DATA').startswith('354'))
+        self.assertEqual(c.cmd('Subject: for postmaster\r\n\r\nx\r\n.'), '250 OK')
+        c.close()
+        self.assertNotIn(b'nosuchuser', read(queue_files(self.suite)[0]))
+        # postmaster is the administrator: the alias --init wrote names demo.
+        deadline = time.monotonic() + 15
+        while queue_files(self.suite) and time.monotonic() < deadline:
+            self.suite.ctl('maildebatch')
+            time.sleep(0.1)
+        self.assertIn(b'Subject: for postmaster', read(self.suite.path('home/demo/mail/inbox')))
+        self.assertIn(b'Subject: for postmaster', read(self.suite.path('home/demo/mail/work')))
+        self.assertEqual(queue_files(self.suite, 'mail/odd'), [])
+        # One mail log: every line has the same stamp, and the SMTP lines name the client.
+        log = self.suite.log('mail').splitlines()
+        self.assertTrue(all(re.match(r'\d\d:\d\d:\d\d, \d\d \w{3} -> ', line) for line in log), log)
+        self.assertTrue(any(line.endswith(' 127.0.0.1 - RCPT TO:<nosuchuser@site.example>') for line in log), log)
+        self.assertTrue(any(re.search(r'-> \d+ <ann@far\.example> PostMaster@site\.example demo_work@localhost', line)
+                            for line in log), log)
+
+    def test_the_greeting_names_the_administrator_with_the_domain_after_a_reload(self):
+        for reload in (False, True):
+            if reload:
+                self.assertEqual(self.suite.ctl('reload config')[0], 0)
+            c = Conversation(self.suite.port('smtp'))
+            self.assertTrue(c.greeting.endswith(' - Report problems to postmaster@localhost'), c.greeting)
+            c.close()
 
 
 class BlockTest(SuiteTestCase):

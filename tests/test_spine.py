@@ -1,6 +1,7 @@
 """Start-up, the pid file, the quit signals, the crash line and --init."""
 
 import os
+import re
 import signal
 import socket
 import subprocess
@@ -9,7 +10,7 @@ import tempfile
 import time
 import unittest
 
-from harness import Suite, SuiteTestCase, VELMOR_BIN
+from harness import Suite, SuiteTestCase, VELMOR_BIN, wait_for
 
 STARTUP_CONSOLE = [
     'Velmor Server Suite starting...',
@@ -57,18 +58,30 @@ class StartAndStop(unittest.TestCase):
         return subprocess.run([VELMOR_BIN, '--root', self.suite.root] + list(args), stdin=subprocess.DEVNULL,
                               stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, timeout=timeout)
 
-    def test_startup_pid_file_and_second_instance(self):
+    def test_startup_names_its_ports_and_a_crash_leaves_nothing_in_the_way(self):
         s = self.suite.start()
         console = s.output().splitlines()
         self.assertEqual(console[:len(STARTUP_CONSOLE)], STARTUP_CONSOLE)
+        for name, title in (('smtp', 'SMTP'), ('pop', 'POP3')):
+            self.assertIn('Listening for %s on 127.0.0.1:%d' % (title, s.port(name)), console)
         assert_in_order(self, STARTUP_LOG, log_texts(s.log('main')))
         with open(s.pid_file) as f:
             self.assertEqual(f.read(), str(s.proc.pid))  # decimal, no newline
 
+        # A crash leaves its pid file behind; the next start replaces it.
+        dead = s.proc.pid
+        s.kill()
+        self.assertTrue(os.path.exists(s.pid_file))
+        s.start()
+        replaced = 'Replaced the pid file of a suite that is no longer running (process %d)' % dead
+        self.assertIn(replaced, s.output().splitlines())
+        self.assertTrue(wait_for(lambda: replaced + ': ' + s.pid_file in log_texts(s.log('main'))))
+
+        # A live one still keeps a second instance out, without touching the log.
+        starts = log_texts(s.log('main')).count(STARTUP_LOG[0])
         second = self.run_velmor('--bind', '127.0.0.1')
-        self.assertEqual(second.returncode, 1)
-        self.assertEqual(second.stdout, REFUSAL + '\n')
-        self.assertEqual(log_texts(s.log('main')).count(STARTUP_LOG[0]), 1)
+        self.assertEqual((second.returncode, second.stdout), (1, REFUSAL + '\n'))
+        self.assertEqual(log_texts(s.log('main')).count(STARTUP_LOG[0]), starts)
         self.assertIsNone(s.proc.poll(), 'the first instance must keep running')
 
         self.assertEqual(s.stop(), 0)
@@ -96,25 +109,6 @@ class StartAndStop(unittest.TestCase):
         self.assertRegex(s.output(), r'(?m)^\+\*\+\*\+\*\+\*\+\*\+\* seg fault:\d+$')
         self.assertRegex(s.log('errors'), r'(?m)^\d\d:\d\d:\d\d, \d\d \w+ -> \+\*\+\*\+\*\+\*\+\*\+\* seg fault:\d+$')
 
-    def test_pid_file_blocks_start_but_a_folder_does_not(self):
-        os.makedirs(os.path.dirname(self.suite.pid_file), exist_ok=True)
-        with open(self.suite.pid_file, 'w') as f:
-            f.write('1')
-        r = self.run_velmor()
-        self.assertEqual((r.returncode, r.stdout), (1, REFUSAL + '\n'))
-        self.assertEqual(self.suite.log('main'), '')  # the log is not touched
-
-        os.remove(self.suite.pid_file)
-        os.mkdir(self.suite.pid_file)
-        self.suite.spawn()
-        deadline = time.monotonic() + 20
-        while 'Suite started' not in self.suite.log('main') and self.suite.proc.poll() is None:
-            self.assertLess(time.monotonic(), deadline, self.suite.output())
-            time.sleep(0.05)
-        self.assertEqual(self.suite.stop(), 0)
-        self.assertIn('Suite started: 2.0.49', self.suite.log('main'))
-        self.assertTrue(os.path.isdir(self.suite.pid_file))
-
     def test_a_port_in_use_stops_start_up(self):
         s = self.suite.start()
         listening = []
@@ -136,6 +130,8 @@ class StartAndStop(unittest.TestCase):
             r = self.run_velmor('--bind', '127.0.0.1')
         self.assertEqual(r.returncode, 1)
         self.assertEqual(r.stdout.splitlines()[-1], 'Socket initialisation failed - see logs for more info')
+        self.assertRegex(r.stdout, r'(?m)^Cannot listen for \S+ on 127\.0\.0\.1:%d: Address already in use$'
+                         % listening[0])
         self.assertIn('Bind Failed - is another server running on this port: %d' % listening[0],
                       self.suite.log('errors'))
         self.assertFalse(os.path.exists(self.suite.pid_file))
@@ -149,6 +145,8 @@ class StartAndStop(unittest.TestCase):
             'Loading config file',
             'Couldn\'t open config file:%s' % self.suite.path('config/master'),
             'Config load faile d',
+            'No master configuration in %s: make a default installation with: velmor --root %s --init'
+            % (self.suite.root, self.suite.root),
         ])
         self.assertFalse(os.path.exists(self.suite.pid_file))
 
@@ -197,11 +195,12 @@ class Init(unittest.TestCase):
         return keys
 
     def test_fresh_installation_and_existing_files_kept(self):
-        self.assertEqual(self.init().returncode, 0)
+        r = self.init()
+        self.assertEqual(r.returncode, 0)
         for d in ('logs', 'tmp', 'run', 'mail/in', 'mail/out', 'mail/odd', 'home'):
             self.assertTrue(os.path.isdir(os.path.join(self.root, d)), d)
         keys = self.master()
-        self.assertEqual(len(keys), 233)
+        self.assertEqual(len(keys), 253)
         self.assertEqual([keys[k] for k in ('smtp.sock.port', 'pop.sock.port', 'imap.sock.port', 'nntp.sock.port',
                                             'web.sock.port', 'proxy.http.sock.port')],
                          ['2525', '1110', '1143', '1119', '8000', '8080'])
@@ -210,7 +209,19 @@ class Init(unittest.TestCase):
         self.assertEqual(keys['mail.domains'], keys['server.name'] + ', localhost')
         self.assertEqual(keys['sock.buffer'], '16384')
         with open(os.path.join(self.root, 'config/templates/master')) as f:
-            self.assertEqual(f.read().count('\n%'), 233)
+            self.assertEqual(f.read().count('\n%'), 253)
+        # Switched on, and named, are exactly the services this build runs;
+        # --help names the same with their ports.
+        named = re.search(r'(?m)^Services: (.*)$', r.stdout).group(1).split(', ')
+        titles = {'SMTP': 'smtp', 'POP3': 'pop', 'IMAP': 'imap', 'NNTP': 'nntp', 'WEB SERVER': 'web', 'SMTPS': 'smtps',
+                  'SUBMISSION': 'submission', 'POP3S': 'pops', 'IMAPS': 'imaps'}
+        on = {k[:-len('.sock.enabled')] for k, v in keys.items() if k.endswith('.enabled') and v == 'yes'}
+        self.assertEqual({titles[n.rsplit(' port ', 1)[0].upper()] for n in named}, on)
+        self.assertIn('smtp', on)
+        usage = subprocess.run([VELMOR_BIN, '--help'], stdout=subprocess.PIPE, text=True, timeout=10).stdout
+        self.assertEqual(sorted(n.replace(' port ', ' ') for n in named),
+                         sorted(re.search(r'unprivileged ports \(([^)]*)\)', usage.replace('\n', ' '))
+                                .group(1).split(', ')))
 
         path = os.path.join(self.root, 'config/mimemap')
         with open(path, 'w') as f:
@@ -227,7 +238,9 @@ class Init(unittest.TestCase):
         self.assertEqual(keys['server.name'], 'gateway.example.org')
         self.assertEqual(keys['mail.domains'], 'gateway.example.org, localhost')
         self.assertEqual([keys[k] for k in ('smtp.sock.port', 'pop.sock.port', 'imap.sock.port', 'nntp.sock.port',
-                                            'web.sock.port')], ['25', '110', '143', '119', '80'])
+                                            'web.sock.port', 'smtps.sock.port', 'submission.sock.port',
+                                            'pops.sock.port', 'imaps.sock.port')],
+                         ['25', '110', '143', '119', '80', '465', '587', '995', '993'])
 
     def test_help_version_and_bad_options(self):
         r = subprocess.run([VELMOR_BIN, '--version'], stdout=subprocess.PIPE, text=True, timeout=10)

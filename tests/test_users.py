@@ -68,6 +68,14 @@ class InitMakesADemoUser(unittest.TestCase):
         rc, out = velmor(other, '--init')
         self.assertNotIn(password, out)
 
+        # The line demo.sh shows is kept private and current.
+        login = os.path.join(self.root, 'demo-login')
+        self.assertEqual(stat.S_IMODE(os.stat(login).st_mode), 0o600)
+        self.assertEqual(read(login), 'Demo login: demo  password: %s\n' % password)
+        rc, out = velmor(self.root, '--passwd', 'demo', '--password', 'Newer-Secret-7')
+        self.assertEqual(rc, 0, out)
+        self.assertEqual(read(login), 'Demo login: demo  password: Newer-Secret-7\n')
+
 
 def pop_login(suite, user, password):
     """True when the POP3 server lets `user` in with `password`."""

@@ -189,6 +189,17 @@ bool tell_daemon(std::string_view command) {
   return sent == static_cast<ssize_t>(command.size());
 }
 
+// The demo user's password is kept where demo.sh shows it from: written
+// by --init with the user, kept current by --passwd demo, removed with the
+// user. Only while the file exists: deleting it ends the keeping.
+constexpr const char* kDemoUser = "demo";
+
+std::string demo_login_path() { return path_join(paths.root, "demo-login"); }
+
+std::string demo_login_text(std::string_view password) {
+  return "Demo login: " + std::string(kDemoUser) + "  password: " + std::string(password) + "\n";
+}
+
 int fail(const std::string& text) {
   std::fprintf(stderr, "velmor: %s\n", text.c_str());
   return 1;
@@ -284,11 +295,15 @@ int users_command_run() {
       if (password->empty()) return fail("the password is empty");
       if (user_set_password(login, *password) != UserChange::done) return fail(user_last_error());
       std::printf("Changed the password of %s\n", login.c_str());
+      if (login == kDemoUser && file_is_regular(demo_login_path()) &&
+          file_write_atomic(demo_login_path(), demo_login_text(*password), false, 0600) != 0)
+        std::printf("Couldn't update %s: it holds the old password\n", demo_login_path().c_str());
       break;
     }
     case Request::Action::remove:
       if (user_remove(req.name) != UserChange::done) return fail(user_last_error());
       std::printf("Removed user %s (the home folder is left as it is)\n", req.name.c_str());
+      if (req.name == kDemoUser) ::unlink(demo_login_path().c_str());
       break;
     case Request::Action::none:
       break;
@@ -317,12 +332,15 @@ int users_make_demo() {
     return 1;
   }
   std::string home = in_root("home/demo");
-  if (user_add("demo", password, "Demo User", home, 0) != UserChange::done) {
+  if (user_add(kDemoUser, password, "Demo User", home, 0) != UserChange::done) {
     std::printf("Couldn't add the demo user: %s\n", user_last_error().c_str());
     return 1;
   }
   make_path(home);
-  std::printf("Demo login: demo  password: %s\n", password.c_str());
+  std::string line = demo_login_text(password);
+  std::fputs(line.c_str(), stdout);
+  if (file_write_atomic(demo_login_path(), line, false, 0600) != 0)
+    std::printf("Couldn't write %s: keep the password above\n", demo_login_path().c_str());
   return 0;
 }
 

@@ -33,7 +33,9 @@ int users_command_run();
 // The demo user of a new installation under paths.root: when the user file
 // (file.user.dbase of the master file) holds no user at all, adds "demo" with
 // a random password, home <root>/home/demo and group 0, and prints the login
-// and password. 0, or 1 on a failure.
+// and password; the same line is kept in <root>/demo-login (mode 0600),
+// which `--passwd demo` keeps current and `--deluser demo` removes. 0, or 1
+// on a failure.
 int users_make_demo();
 
 }  // namespace velmor

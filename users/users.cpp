@@ -35,6 +35,7 @@ using Bucket = std::vector<std::unique_ptr<UserRecord>>;
 
 struct UserTable {
   std::array<Bucket, kBuckets> buckets;
+  std::string header;  // the comment lines the file starts with, written back as they were
   std::string path;
   std::string last_error;
 };
@@ -229,6 +230,7 @@ UserChange bad_field(std::string why) {
 int user_load(const std::string& path) {
   UserTable& t = table();
   t.path = path;
+  t.header.clear();
   for (auto& bucket : t.buckets) bucket.clear();
   try {
     std::optional<std::string> text = path.empty() ? std::nullopt : read_text_file(path);
@@ -239,10 +241,31 @@ int user_load(const std::string& path) {
   }
 }
 
+namespace {
+
+// The comment ("|") and empty lines the file starts with, as they are.
+// Lines end where for_each_line ends them (at a CR too), so no user line
+// is ever taken into the header and written back twice.
+std::string_view header_of(std::string_view text) {
+  std::size_t pos = 0;
+  while (pos < text.size()) {
+    std::size_t end = text.find_first_of("\r\n", pos);
+    std::string_view line = text.substr(pos, end == std::string_view::npos ? std::string_view::npos : end - pos);
+    if (!line.empty() && line[0] != '|') break;
+    pos = end == std::string_view::npos ? text.size() : end + 1;
+  }
+  return text.substr(0, pos);
+}
+
+}  // namespace
+
 int users_parse(std::string_view text) {
   UserTable& t = table();
   for (auto& bucket : t.buckets) bucket.clear();
+  t.header.clear();
   try {
+    t.header = header_of(text);
+    if (!t.header.empty() && t.header.back() != '\n') t.header += '\n';
     for_each_line(text, [&](std::string_view line) {
       if (auto user = parse_line(line)) {
         int b = bucket_of(user->login);
@@ -256,7 +279,7 @@ int users_parse(std::string_view text) {
 }
 
 std::string users_text() {
-  std::string text;
+  std::string text = table().header;
   for (const auto& bucket : table().buckets) {
     for (const auto& user : bucket) text += record_line(*user);
   }

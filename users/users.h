@@ -29,7 +29,8 @@ struct UserRecord {
 
 int user_load(const std::string& path);  // 0; 1 cannot open (table empty); 2 no memory
 // What user_load does with the file's text: replaces the table with its
-// users (the file user_save writes is unchanged). 0; 2 no memory.
+// users and keeps the comment lines the file starts with, which every save
+// writes back first (the file user_save writes is unchanged). 0; 2 no memory.
 int users_parse(std::string_view text);
 // The text user_save writes for the table.
 std::string users_text();

@@ -82,6 +82,9 @@ TEST_F(UsersTest, ReadsTheFileAsWrittenAndSavesItBackUnchanged) {
   std::string before = read_file(users_file());
   ASSERT_EQ(user_save(), 0);
   std::string first = read_file(users_file());
+  // The comment lines the file starts with stay; the lines ignored below them do not.
+  EXPECT_TRUE(first.starts_with("| a comment\n")) << first;
+  EXPECT_EQ(first.find("indented"), std::string::npos) << first;
   EXPECT_EQ(read_file(dir_.string() + "/users~"), before);
   EXPECT_EQ(mode_of(users_file()), 0600u);
 
@@ -99,6 +102,26 @@ TEST_F(UsersTest, ANulByteInTheFileIsSavedBackUnchanged) {
   std::string text("a\0b,hash,Ann\0Lee,/home/a,1\n", 27);
   ASSERT_EQ(users_parse(text), 0);
   EXPECT_EQ(users_text(), text);
+}
+
+// The header that explains the file survives every change made through the
+// suite (it used to be dropped by the first save).
+TEST_F(UsersTest, TheCommentHeaderIsKeptAcrossSaves) {
+  const std::string header = "| The user database\r\n|   login,hash,...\n\n| (edit with --adduser)\n";
+  load(header + "bob," + kBlankHash + "\n");
+  ASSERT_EQ(user_add("ann", "pw", "Ann Lee", "/home/ann", 0), UserChange::done);
+  ASSERT_EQ(user_remove("bob"), UserChange::done);
+  std::string saved = read_file(users_file());
+  EXPECT_TRUE(saved.starts_with(header + "ann,")) << saved;
+  ASSERT_EQ(users_parse("| no line end"), 0);
+  EXPECT_EQ(users_text(), "| no line end\n");
+  // A lone CR ends a line: the user behind it is a user, not header text
+  // (which would write it twice, and then once more at every save).
+  ASSERT_EQ(users_parse(std::string("| note\rbob,") + kBlankHash + "\n"), 0);
+  std::string text = users_text();
+  ASSERT_EQ(users_parse(text), 0);
+  EXPECT_EQ(users_text(), text);
+  EXPECT_EQ(user_list().size(), 1u);
 }
 
 TEST_F(UsersTest, FindsByLoginDottedFullNameAndInitials) {

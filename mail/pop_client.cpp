@@ -1,0 +1,523 @@
+// The POP3 client: one PopClientSession per account and run. Replies are
+// taken in the order the commands went; a message is read up to its
+// terminator line into a hidden incoming file, handed to the queue's group
+// commit with the others finished about the same time, and only its commit
+// lets its DELE go out.
+#include "mail/pop_client.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <ctime>
+#include <deque>
+#include <map>
+#include <unordered_map>
+#include <utility>
+
+#include "core/config.h"
+#include "core/connection.h"
+#include "core/globals.h"
+#include "core/hooks.h"
+#include "core/log.h"
+#include "core/network.h"
+#include "core/strfmt.h"
+#include "core/util.h"
+#include "mail/queue.h"
+#include "mail/queue_internal.h"
+#include "mail/queue_text.h"
+
+namespace velmor {
+
+namespace {
+
+// Commands on their way at once when the server pipelines.
+constexpr std::size_t kWindow = 64;
+// Messages asked for ahead of the one arriving.
+constexpr int kRetrAhead = 16;
+// Finished messages committed together (one sync for all of them) ...
+constexpr std::size_t kBatch = 32;
+// ... or once the first of them has waited this long.
+constexpr auto kBatchWait = std::chrono::milliseconds(500);
+// Messages received and not yet committed: no more are asked for.
+constexpr std::size_t kMaxUnsettled = 64;
+
+class PopClientSession;
+
+struct PopClient {
+  // Accounts with a connection (user, host and port): the serial of the
+  // session that holds each, which alone may free it.
+  std::map<std::string, std::uint64_t> busy;
+  std::unordered_map<std::uint64_t, PopClientSession*> live;  // by serial, for the commits
+  std::uint64_t next_serial = 1;
+  std::time_t next_run = 0;
+};
+PopClient& client() {
+  static PopClient c;
+  return c;
+}
+
+std::string account_key(const PopAccount& a) {
+  return a.user + '\n' + a.host + ':' + std::to_string(a.port);
+}
+
+class PopClientSession final : public Session {
+ public:
+  explicit PopClientSession(PopAccount account)
+      : account_(std::move(account)), key_(account_key(account_)), serial_(client().next_serial++) {
+    client().live[serial_] = this;
+  }
+  ~PopClientSession() override { release(); }
+
+  void on_open(Connection& c) override;
+  void on_input(Connection& c) override;
+  void on_timer(Connection& c) override;
+  void on_close(Connection& c, CloseReason reason) override;
+  // The group commit has run for message `number`.
+  void committed(std::uint32_t number, int error);
+  std::uint64_t serial() const { return serial_; }
+
+ private:
+  enum class Command { greeting, user, pass, capa, stat, retr, dele, quit };
+  enum class Reading {
+    reply,         // status lines
+    capabilities,  // the lines of a CAPA answer, up to "."
+    message,       // a message, up to its terminator line
+  };
+  struct Finished {
+    std::string path, hidden;
+    std::uint32_t number;
+  };
+
+  void send(Connection& c, Command command, std::string_view text, std::uint32_t number = 0);
+  void reply(Connection& c, std::string_view line);
+  void stat(Connection& c, std::string_view line);
+  void start_message(std::uint32_t number);
+  bool read_message(Connection& c);
+  void finish_message(Connection& c);
+  void hand_over();
+  void pump(Connection& c);
+  void give_up(Connection& c) {
+    c.send("QUIT\r\n");
+    c.close_after_send();
+  }
+  void stop(std::string_view why);
+  void discard_unsettled();
+  void release();
+
+  const PopAccount account_;
+  const std::string key_;
+  const std::uint64_t serial_;
+  Connection* conn_ = nullptr;
+  std::string trace_;  // the Received: lines before their date
+
+  std::deque<std::pair<Command, std::uint32_t>> sent_;  // awaiting their replies, in order
+  Reading reading_ = Reading::reply;
+  bool pipelining_ = false;
+  bool counted_ = false;       // STAT has answered: messages may be asked for
+  std::uint32_t next_ = 0;     // the next message to ask for (0: none left)
+  int retrs_out_ = 0;          // RETR commands not yet answered in full
+  bool stopping_ = false;      // ask for nothing more; settle and QUIT
+  bool quit_sent_ = false;
+  bool released_ = false;
+
+  // The message arriving.
+  std::uint32_t number_ = 0;
+  PendingIncoming file_;
+  bool write_failed_ = false;
+  MessageReceiver receiver_;
+  std::string chunk_, headers_;
+
+  std::vector<Finished> finished_;  // flushed, waiting to be handed to the commit
+  std::size_t committing_ = 0;      // handed to the commit, not yet done
+  std::deque<std::uint32_t> to_delete_;  // committed; DELE not yet sent
+  std::uint32_t fetched_ = 0;
+};
+
+// Once, at the close or (for a session never connected) at its end: by
+// the time the session itself goes, a new run may hold the account.
+void PopClientSession::release() {
+  if (released_) return;
+  released_ = true;
+  client().live.erase(serial_);
+  if (auto it = client().busy.find(key_); it != client().busy.end() && it->second == serial_) client().busy.erase(it);
+  discard_unsettled();
+  if (client().live.empty() && (status_bits & status::pop_client_running))
+    status_bits = (status_bits & ~status::pop_client_running) | status::pop_client_ended | status::changed;
+}
+
+// A message half received, or received and not handed to the commit, is
+// thrown away: nothing was deleted for it, so the next run fetches it.
+void PopClientSession::discard_unsettled() {
+  if (file_.file) {
+    queue_file_discard(file_.file);
+    unlink(file_.hidden.c_str());
+  }
+  for (const Finished& f : finished_) unlink(f.hidden.c_str());
+  finished_.clear();
+}
+
+void PopClientSession::on_open(Connection& c) {
+  conn_ = &c;
+  sent_.emplace_back(Command::greeting, 0);
+  trace_ = strprintf("Received: from %s [%s]\r\n\tby %s with POP3 (Velmor %s);\r\n\t", account_.host.c_str(),
+                     c.peer().text.c_str(), text_of(config.server_name).c_str(), kVersion);
+  log_message("POP3 client connected to: ", c.peer().text, logfac::house);
+}
+
+void PopClientSession::on_close(Connection&, CloseReason reason) {
+  if (reason == CloseReason::lookup_failed || reason == CloseReason::connect_failed) {
+    log_message("POP client fail", {}, logfac::pop);
+    log_message("POP3 client hostname lookup failed", {}, logfac::house);
+  } else if (!quit_sent_ && reason != CloseReason::requested) {
+    log_message(strprintf("POP client - connection to %s ended (%s) after %u messages", account_.host.c_str(),
+                          close_reason_text(reason), fetched_));
+  }
+  log_message("POP client dispose", {}, logfac::pop);
+  conn_ = nullptr;
+  release();
+}
+
+void PopClientSession::send(Connection& c, Command command, std::string_view text, std::uint32_t number) {
+  sent_.emplace_back(command, number);
+  c.send(text);
+}
+
+void PopClientSession::on_input(Connection& c) {
+  mail_note_traffic();
+  while (!c.closed()) {
+    if (reading_ == Reading::message) {
+      if (!read_message(c)) return;
+      pump(c);
+      continue;
+    }
+    std::string_view line;
+    LineResult r = c.read_line(line);
+    if (r == LineResult::need_more) return;
+    if (r == LineResult::overlong) {
+      log_message("POP client - reply too long from ", account_.host);
+      c.close_now();
+      return;
+    }
+    if (reading_ == Reading::capabilities) {
+      if (line == ".") {
+        reading_ = Reading::reply;
+        send(c, Command::stat, "STAT\r\n");
+      } else if (str_iequals(trim_blanks(line), "PIPELINING")) {
+        pipelining_ = true;
+      }
+      continue;
+    }
+    reply(c, line);
+    pump(c);
+  }
+}
+
+void PopClientSession::on_timer(Connection& c) {
+  hand_over();
+  pump(c);
+}
+
+// One status line: the answer to the oldest command still waiting.
+void PopClientSession::reply(Connection& c, std::string_view line) {
+  if (sent_.empty()) {
+    log_message("POP client - unexpected reply from ", account_.host);
+    c.close_now();
+    return;
+  }
+  auto [command, number] = sent_.front();
+  sent_.pop_front();
+  const bool positive = !line.empty() && line.front() == '+';
+  switch (command) {
+    case Command::greeting:
+      if (!positive) {
+        log_message("POP client - connect failed to ", account_.host, logfac::pop);
+        c.close_now();
+        return;
+      }
+      send(c, Command::user, "USER " + account_.user + "\r\n");
+      break;
+    case Command::user:
+      if (!positive) {
+        log_message(strprintf("POP client - Bad user %s", account_.user.c_str()), {}, logfac::pop);
+        give_up(c);
+        return;
+      }
+      send(c, Command::pass, "PASS " + account_.password + "\r\n");
+      break;
+    case Command::pass:
+      if (!positive) {
+        log_message(strprintf("POP client - Bad password for %s", account_.user.c_str()), {}, logfac::pop);
+        give_up(c);
+        return;
+      }
+      // Whether the server takes commands ahead of its answers.
+      send(c, Command::capa, "CAPA\r\n");
+      break;
+    case Command::capa:
+      if (positive) {
+        reading_ = Reading::capabilities;
+      } else {
+        send(c, Command::stat, "STAT\r\n");
+      }
+      break;
+    case Command::stat:
+      stat(c, line);
+      break;
+    case Command::retr:
+      if (positive) {
+        start_message(number);
+      } else {
+        --retrs_out_;
+        log_message("Couldn't fetch article, server said:", line.substr(0, 128), logfac::house);
+      }
+      break;
+    case Command::dele:
+      if (!positive) log_message(strprintf("POP client - DELE %u refused: ", number), line.substr(0, 128));
+      break;
+    case Command::quit:
+      log_message("POP client closing connection", {}, logfac::house);
+      c.close_after_send();
+      break;
+  }
+}
+
+void PopClientSession::stat(Connection& c, std::string_view line) {
+  std::string_view rest = line.size() > 3 ? trim_blanks(line.substr(3)) : std::string_view();
+  std::size_t digits = 0;
+  std::uint64_t count = 0;
+  while (digits < rest.size() && rest[digits] >= '0' && rest[digits] <= '9' && count <= 0xffffffffu)
+    count = count * 10 + static_cast<unsigned>(rest[digits++] - '0');
+  if (line.empty() || line.front() != '+' || digits == 0 || count > 0xffffffffu) {
+    log_message("POP Client - Server does not understand STAT", {}, logfac::house);
+    give_up(c);
+    return;
+  }
+  log_message("POP client fetching articles: ", line.substr(1, 128), logfac::house);
+  // The last message first, as the queue has always received them.
+  next_ = static_cast<std::uint32_t>(count);
+  counted_ = true;
+}
+
+// A positive answer to RETR: the message follows, into a hidden incoming
+// file behind its envelope and trace.
+void PopClientSession::start_message(std::uint32_t number) {
+  number_ = number;
+  reading_ = Reading::message;
+  write_failed_ = false;
+  receiver_ = MessageReceiver{};
+  receiver_.add_date = false;
+  if (stopping_) return;  // read and dropped: nothing more is queued
+  file_ = queue_open_incoming_pending();
+  if (!file_.file) {
+    log_message("Couldn't open new incoming file", {}, logfac::house);
+    stop("the incoming file could not be made");
+    return;
+  }
+  std::time_t now = server_now ? server_now : std::time(nullptr);
+  std::string address = account_.address();
+  std::string head = "POP3 MAIL FROM:<" + address + ">\r\nRCPT TO:<" + address + ">\r\nDATA\r\n" + trace_ +
+                     mail_date_text(now) + "\r\n";
+  if (filecache_write(file_.file, head) != 0) write_failed_ = true;
+}
+
+// Takes what has arrived of the message; true once its terminator has.
+bool PopClientSession::read_message(Connection& c) {
+  chunk_.clear();
+  headers_.clear();
+  std::string_view in = c.buffered();
+  std::size_t used = receiver_.feed(in, false, chunk_, &headers_);
+  // A line longer than the whole buffer is taken in parts.
+  if (used == 0 && c.input_full()) used = receiver_.feed(in, true, chunk_, &headers_);
+  c.consume(used);
+  if (!headers_.empty()) log_header_summary(static_cast<int>(c.id()), headers_);
+  if (file_.file && !write_failed_ && !chunk_.empty() && filecache_write(file_.file, chunk_) != 0)
+    write_failed_ = true;
+  if (!receiver_.done()) return false;
+  finish_message(c);
+  return true;
+}
+
+void PopClientSession::finish_message(Connection& c) {
+  reading_ = Reading::reply;
+  --retrs_out_;
+  if (!file_.file) return;
+  int rc = write_failed_ ? EIO : filecache_purge(file_.file);
+  if (rc != 0) {
+    log_write(strprintf("POP client: message %u of %s not queued: %s", number_, account_.address().c_str(),
+                        error_text(rc).c_str()),
+              logchan::errors);
+    queue_file_discard(file_.file);
+    unlink(file_.hidden.c_str());
+    file_ = PendingIncoming{};
+    stop("an incoming file could not be written");
+    return;
+  }
+  finished_.push_back({std::move(file_.path), std::move(file_.hidden), number_});
+  file_ = PendingIncoming{};
+  ++fetched_;
+  // Committed together with those that follow closely (pump hands them
+  // over once the batch is full or nothing more is coming), at the latest
+  // after a short wait.
+  if (finished_.size() == 1) c.wake_after(kBatchWait);
+}
+
+// The finished messages go to the next group commit (after this pass).
+void PopClientSession::hand_over() {
+  if (finished_.empty()) return;
+  if (conn_) conn_->wake_after(std::chrono::milliseconds(0));
+  for (Finished& f : finished_) {
+    ++committing_;
+    queue_commit_later(std::move(f.path), std::move(f.hidden), [serial = serial_, number = f.number](int error) {
+      auto& live = client().live;
+      auto it = live.find(serial);
+      if (it != live.end()) it->second->committed(number, error);
+    });
+  }
+  finished_.clear();
+}
+
+void PopClientSession::committed(std::uint32_t number, int error) {
+  --committing_;
+  if (error != 0) {
+    stop("an incoming file could not be committed");
+  } else if (!account_.keep) {
+    to_delete_.push_back(number);
+  }
+  if (conn_ && !conn_->closed()) pump(*conn_);
+}
+
+void PopClientSession::stop(std::string_view why) {
+  if (!stopping_)
+    log_message(strprintf("POP client - fetching from %s stopped: ", account_.address().c_str()), why);
+  stopping_ = true;
+}
+
+// Sends what may go now: the DELEs of committed messages, the next RETRs,
+// and QUIT once everything asked for is settled.
+void PopClientSession::pump(Connection& c) {
+  if (!counted_ || quit_sent_ || c.closed()) return;
+  const bool last = retrs_out_ == 0 && (next_ == 0 || stopping_);
+  if (finished_.size() >= kBatch || (last && !finished_.empty())) hand_over();
+  // Without pipelining a command waits for the whole answer to the last
+  // one, a message included.
+  auto room = [&] { return pipelining_ ? sent_.size() < kWindow : sent_.empty() && reading_ == Reading::reply; };
+  while (!to_delete_.empty() && room()) {
+    std::uint32_t n = to_delete_.front();
+    to_delete_.pop_front();
+    send(c, Command::dele, strprintf("DELE %u\r\n", n), n);
+  }
+  while (!stopping_ && next_ > 0 && room() && retrs_out_ < kRetrAhead &&
+         finished_.size() + committing_ < kMaxUnsettled) {
+    send(c, Command::retr, strprintf("RETR %u\r\n", next_), next_);
+    --next_;
+    ++retrs_out_;
+  }
+  if ((next_ == 0 || stopping_) && retrs_out_ == 0 && finished_.empty() && committing_ == 0 &&
+      to_delete_.empty() && room()) {
+    quit_sent_ = true;
+    send(c, Command::quit, "QUIT\r\n");
+  }
+}
+
+}  // namespace
+
+// ---- accounts ---------------------------------------------------------------
+
+std::vector<PopAccount> pop_accounts_parse(std::string_view text) {
+  std::vector<PopAccount> accounts;
+  std::size_t pos = 0;
+  while (pos <= text.size()) {
+    std::size_t end = text.find_first_of(",\r\n", pos);
+    if (end == std::string_view::npos) end = text.size();
+    std::string_view entry = trim_blanks(text.substr(pos, end - pos));
+    pos = end + 1;
+    PopAccount a;
+    while (!entry.empty() && (entry.front() == '-' || entry.front() == '*')) {
+      if (entry.front() == '-') a.keep = true;
+      entry.remove_prefix(1);
+    }
+    std::size_t colon = entry.find(':');
+    std::size_t at = entry.rfind('@');
+    if (colon == std::string_view::npos || at == std::string_view::npos || at < colon || colon == 0) continue;
+    a.user = std::string(entry.substr(0, colon));
+    a.password = std::string(entry.substr(colon + 1, at - colon - 1));
+    std::string_view host = entry.substr(at + 1);
+    if (std::size_t port_at = host.find(':'); port_at != std::string_view::npos) {
+      std::string_view port = host.substr(port_at + 1);
+      host = host.substr(0, port_at);
+      unsigned value = 0;
+      bool ok = !port.empty() && port.size() <= 5;
+      for (char ch : port) {
+        ok = ok && ch >= '0' && ch <= '9';
+        if (ok) value = value * 10 + static_cast<unsigned>(ch - '0');
+      }
+      if (!ok || value == 0 || value > 65535) continue;
+      a.port = static_cast<std::uint16_t>(value);
+    }
+    if (host.empty()) continue;
+    a.host = std::string(host);
+    accounts.push_back(std::move(a));
+  }
+  return accounts;
+}
+
+std::string pop_accounts_show(const std::vector<PopAccount>& accounts) {
+  std::string out;
+  for (const PopAccount& a : accounts) {
+    out += a.keep ? "-*" : "*";
+    out += a.user + ":" + a.password + "@" + a.host;
+    if (a.port != 110) out += ":" + std::to_string(a.port);
+    out += "\n";
+  }
+  return out;
+}
+
+// ---- runs -----------------------------------------------------------------------
+
+std::unique_ptr<Session> pop_client_session(PopAccount account) {
+  return std::make_unique<PopClientSession>(std::move(account));
+}
+
+int pop_fetch_run() {
+  PopClient& pc = client();
+  std::time_t now = server_now ? server_now : std::time(nullptr);
+  pc.next_run = now + static_cast<std::time_t>(config.pop_time) * 60;
+  log_message("POP3 client fetch check - next one at: ", time_text(pc.next_run), logfac::house);
+  if (!link_up) return 0;
+  int started = 0;
+  for (PopAccount& a : pop_accounts_parse(text_of(config.pop_hosts))) {
+    std::string key = account_key(a);
+    if (pc.busy.count(key)) continue;
+    // Its address heads each fetched message's envelope, and must read back whole.
+    if (!envelope_address_fits(a.address())) {
+      log_message("POP client - account unusable in an envelope: ", a.address());
+      continue;
+    }
+    std::string host = a.host;
+    std::uint16_t port = a.port;
+    auto session = std::make_unique<PopClientSession>(std::move(a));
+    pc.busy[key] = session->serial();
+    if (connect_to(svc::pop_client, host, port, std::move(session))) ++started;
+  }
+  if (started) status_bits |= status::pop_client_running | status::changed;
+  return started;
+}
+
+void pop_client_poll() {
+  if (link_up && config.pop_time > 0 && server_now > client().next_run) pop_fetch_run();
+}
+
+void pop_client_register() {
+  client().next_run = server_now ? server_now : std::time(nullptr);
+  service_register({
+      .number = svc::pop_client,
+      .name = "pop client",
+      .timeout = &config.pop_sock_timeout,
+  });
+  queue_commit_register();
+  hooks.popkick = [] { return pop_fetch_run() > 0; };
+  hooks.pop_client_count = [] { return connection_count(svc::pop_client); };
+}
+
+}  // namespace velmor

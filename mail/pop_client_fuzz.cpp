@@ -1,0 +1,89 @@
+// The POP3 client's reply and message reader through the test driver: a
+// server sends arbitrary bytes in arbitrary pieces (after a login, when the
+// first byte asks for one). Every command sent is a whole CR LF line, no
+// message is deleted that is not in the queue, every queued file is a whole
+// message, and a connection that ends leaves no half-written file.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdint>
+#include <filesystem>
+#include <string>
+
+#include "core/config.h"
+#include "core/filecache.h"
+#include "core/globals.h"
+#include "core/network.h"
+#include "core/test_link.h"
+#include "mail/pop_client.h"
+#include "mail/queue.h"
+#include "mail/queue_internal.h"
+#include "mail/session_fuzz.h"
+
+using namespace velmor;
+
+namespace {
+
+using namespace velmor::fuzzing;
+
+struct Scratch {
+  ScratchFolder folder;
+  std::string root = folder.path(), in = root + "/in";
+  Scratch() {
+    paths.tmp_dir = root + "/tmp";
+    config.server_name = "fuzz.example";
+    config.sock_buffer = 1024;
+    config.mail_dir_incoming = in;
+    mkdir((root + "/tmp").c_str(), 0700);
+    filecache_init();
+    pop_client_register();
+  }
+  void clear() {
+    std::filesystem::remove_all(in);
+    std::filesystem::create_directories(in);
+    while (queue_pop_incoming()) {
+    }
+  }
+};
+
+std::size_t count(const std::string& text, std::string_view what) {
+  std::size_t n = 0;
+  for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+  return n;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+  static Scratch scratch;
+  if (size < 2) return 0;
+  scratch.clear();
+  const std::size_t piece = data[1] % 31 + 1;
+  std::string input(reinterpret_cast<const char*>(data + 2), size - 2);
+  if (data[0] & 1)
+    input = "+OK\r\n+OK\r\n+OK\r\n" + std::string(data[0] & 2 ? "+OK\r\nPIPELINING\r\n.\r\n" : "-ERR\r\n") +
+            "+OK 3 0\r\n" + input;
+  server_now = 1700000000;
+  std::string sent;
+  {
+    TestLink link(pop_client_session(PopAccount{"u", "p", "h.example", 110, (data[0] & 4) != 0}));
+    link.feed(input, piece);
+    link.advance(std::chrono::seconds(1));  // a batch waiting for more is committed
+    link.finish();
+    link.advance(std::chrono::seconds(1));
+    check(link.closed());
+    sent = link.output();
+  }
+  check_lines(sent);
+  std::size_t files = 0;
+  for (const auto& e : std::filesystem::directory_iterator(scratch.in)) {
+    std::string name = e.path().filename().string();
+    check(name.find_first_not_of("0123456789") == std::string::npos);  // nothing half written
+    std::string text = read_all(e.path().string());
+    check(text.starts_with("POP3 MAIL FROM:<u@h.example>\r\n") && text.ends_with("\r\n.\r\n"));
+    ++files;
+  }
+  check(count(sent, "DELE ") <= files);
+  return 0;
+}

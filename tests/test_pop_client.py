@@ -1,0 +1,381 @@
+"""The POP3 client end to end: against a POP3 server written here for what
+real servers will not do on request (drops, wrong sizes, empty messages, a
+refused message), against a private Dovecot (whole messages, deletion, a
+full disk), and in the dial-up mail transfer. Fetched mail is delivered to
+local users only; the rest lands in oddments."""
+
+import os
+import random
+import re
+import socket
+import subprocess
+import threading
+import unittest
+
+import dovecot
+from dns_server import NameServer, response, test_address
+from fake_modem import FakeModem
+from harness import Suite, VELMOR_BIN, wait_for as wait_briefly
+
+RUNNING, ENDED = 0x400, 16  # status bits: a POP3 client runs / a run ended
+
+
+def wait_for(predicate, timeout=20.0):
+    return wait_briefly(predicate, timeout=timeout)
+
+
+def numbered(folder):
+    if not os.path.isdir(folder):
+        return []
+    return sorted((os.path.join(folder, n) for n in os.listdir(folder) if n.isdigit()),
+                  key=lambda p: int(os.path.basename(p)))
+
+
+def read(path):
+    with open(path, 'rb') as f:
+        return f.read()
+
+
+def transmitted(message):
+    """A message (LF or CR LF lines) as POP3 carries it and the queue keeps it."""
+    lines = message.replace(b'\r\n', b'\n').split(b'\n')
+    if lines and lines[-1] == b'':
+        lines.pop()
+    return b''.join((b'.' + l if l.startswith(b'.') else l) + b'\r\n' for l in lines) + b'.\r\n'
+
+
+def fetched_message(path):
+    """The message part of a fetched queue file (behind its Received trace)."""
+    text = read(path)
+    assert text.startswith(b'POP3 MAIL FROM:<'), text[:80]
+    marker = b' with POP3 (Velmor 2.0.49);\r\n\t'
+    date_at = text.index(marker) + len(marker)
+    return text[text.index(b'\r\n', date_at) + 2:]
+
+
+class PopServer:
+    """A POP3 server on 127.0.0.1 for one account. `messages` is a list of
+    (bytes, how): how is 'ok' ("+OK n octets"), 'bare' ("+OK" alone),
+    'wrong' (a size far too small), 'err' (RETR refused) or 'drop' (the
+    connection is cut half way through the message). Deletions apply at
+    QUIT; `commands` keeps every command line of every session."""
+
+    def __init__(self, messages, pipelining=True):
+        self.messages = list(messages)
+        self.pipelining = pipelining
+        self.commands = []
+        self.sock = socket.socket()
+        self.sock.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
+        self.sock.bind(('127.0.0.1', 0))
+        self.sock.listen(8)
+        self.port = self.sock.getsockname()[1]
+        self.sock.settimeout(0.2)
+        self._stop = False
+        self._thread = threading.Thread(target=self._serve, daemon=True)
+        self._thread.start()
+
+    def _serve(self):
+        while not self._stop:
+            try:
+                conn, _ = self.sock.accept()
+            except socket.timeout:
+                continue
+            except OSError:
+                return
+            try:
+                self._session(conn)
+            except OSError:
+                pass
+            finally:
+                conn.close()
+
+    def _session(self, conn):
+        conn.settimeout(10)
+        f = conn.makefile('rb')
+        conn.sendall(b'+OK test server ready\r\n')
+        deleted = set()
+        while True:
+            line = f.readline()
+            if not line:
+                return
+            command = line.rstrip(b'\r\n').decode()
+            self.commands.append(command)
+            verb, _, arg = command.partition(' ')
+            verb = verb.upper()
+            if verb in ('USER', 'PASS', 'NOOP'):
+                conn.sendall(b'+OK\r\n')
+            elif verb == 'CAPA':
+                conn.sendall(b'+OK\r\nUIDL\r\n' + (b'PIPELINING\r\n' if self.pipelining else b'') + b'.\r\n')
+            elif verb == 'STAT':
+                conn.sendall(b'+OK %d %d\r\n' % (len(self.messages), sum(len(m) for m, _ in self.messages)))
+            elif verb == 'RETR':
+                text, how = self.messages[int(arg) - 1]
+                data = transmitted(text)
+                if how == 'err':
+                    conn.sendall(b'-ERR message locked\r\n')
+                elif how == 'drop':
+                    conn.sendall(b'+OK %d octets\r\n' % len(text) + data[:len(data) // 2])
+                    conn.shutdown(socket.SHUT_RDWR)
+                    return
+                else:
+                    status = {'ok': b'+OK %d octets' % len(text), 'bare': b'+OK', 'wrong': b'+OK 3 octets'}[how]
+                    conn.sendall(status + b'\r\n' + data)
+            elif verb == 'DELE':
+                deleted.add(int(arg))
+                conn.sendall(b'+OK deleted\r\n')
+            elif verb == 'QUIT':
+                self.messages = [m for n, m in enumerate(self.messages, 1) if n not in deleted]
+                conn.sendall(b'+OK bye\r\n')
+                return
+            else:
+                conn.sendall(b'-ERR unknown\r\n')
+
+    def close(self):
+        self._stop = True
+        self._thread.join(5)
+        self.sock.close()
+
+
+def answer_all(query):
+    return [(response(query, rcode=3), None)]
+
+
+class FetchCase(unittest.TestCase):
+    """A suite whose link is up (its name server answers), debatching only
+    when asked."""
+
+    def start(self, hosts, **keys):
+        self.names = NameServer(test_address(40), answer_all)
+        self.addCleanup(self.names.close)
+        config = {'dns.servers': self.names.address, 'dns.timeout': '1', 'dns.retries': '1',
+                  'mail.debatch.time': '0', 'mail.domains': 'site.example', 'server.name': 'site.example',
+                  'pop.hosts': hosts, 'store.state': str(2 + 8)}
+        config.update(keys)
+        self.suite = Suite(config=config)
+        self.addCleanup(self.suite.cleanup)
+        return self.suite
+
+    def run_suite(self):
+        self.suite.start()
+        self.assertTrue(wait_for(lambda: self.status() & 0x10000), self.suite.log('main'))
+
+    def status(self):
+        rc, out = self.suite.ctl('status', raw=True)
+        return int(out.split('\n')[0][3:]) if rc == 0 else 0
+
+    def fetch(self):
+        """popkick, then waits for the run to end."""
+        self.suite.ctl('clear mqcng')
+        self.suite.ctl('popkick')
+        self.assertTrue(wait_for(lambda: 'POP client dispose' in self.suite.log('main')), self.suite.log('main'))
+        self.assertTrue(wait_for(lambda: not self.status() & RUNNING))
+
+    def queued(self, folder='mail/in'):
+        return numbered(self.suite.path(folder))
+
+    def hidden(self, folder='mail/in'):
+        d = self.suite.path(folder)
+        return [n for n in os.listdir(d) if not n.isdigit()] if os.path.isdir(d) else []
+
+
+class AwkwardServerTest(FetchCase):
+
+    def serve(self, messages, pipelining=True):
+        server = PopServer(messages, pipelining)
+        self.addCleanup(server.close)
+        self.start('acct:secret@127.0.0.1:%d' % server.port)
+        self.run_suite()
+        return server
+
+    def test_sizes_do_not_matter_and_a_refused_message_stays(self):
+        body = lambda n: b'Subject: m%d\r\n\r\nline\r\n.starts with a dot\r\n+OK looks like a reply\r\n' % n
+        messages = [(body(1), 'ok'), (body(2), 'bare'), (body(3) + b'x' * 5000 + b'\r\n', 'wrong'),
+                    (b'', 'ok'), (body(5), 'err')]
+        server = self.serve(messages, pipelining=False)
+        self.fetch()
+        files = self.queued()
+        self.assertEqual(len(files), 4, self.suite.log('main'))
+        # The last message first; each whole, as carried.
+        self.assertEqual([fetched_message(p) for p in files],
+                         [transmitted(m) for m, how in reversed(messages) if how != 'err'])
+        self.assertEqual(server.messages, [messages[4]])  # the refused one is still there
+        self.assertEqual([c for c in server.commands if c.startswith('DELE')], ['DELE 4', 'DELE 3', 'DELE 2', 'DELE 1'])
+        self.assertEqual(self.hidden(), [])
+        self.assertTrue(self.status() & ENDED)
+
+    def test_a_drop_mid_message_leaves_no_file_and_deletes_nothing(self):
+        server = self.serve([(b'Subject: one\r\n\r\nbody\r\n', 'ok'), (b'Subject: two\r\n\r\n' + b'y' * 20000, 'drop'),
+                             (b'Subject: three\r\n\r\nbody\r\n', 'ok')])
+        self.fetch()
+        self.assertEqual(len(server.messages), 3)  # no QUIT: nothing deleted
+        self.assertNotIn('QUIT', server.commands)
+        self.assertEqual(self.hidden(), [])
+        for p in self.queued():
+            self.assertNotIn(b'Subject: two', read(p))
+        # The next run fetches them all.
+        server.messages[1] = (server.messages[1][0], 'ok')
+        before = len(self.queued())
+        self.fetch_again()
+        self.assertEqual(len(self.queued()), before + 3)
+        self.assertEqual(server.messages, [])
+
+    def fetch_again(self):
+        log = self.suite.log('main')
+        self.suite.ctl('popkick')
+        self.assertTrue(wait_for(lambda: self.suite.log('main').count('POP client dispose') > log.count(
+            'POP client dispose')))
+
+
+class FetchedMailDeliveryTest(FetchCase):
+
+    def test_fetched_mail_reaches_local_users_only(self):
+        server = PopServer([(b'Delivered-To: ann@site.example\r\nSubject: for ann\r\n\r\nhi\r\n', 'ok'),
+                            (b'Delivered-To: someone@far.example\r\nSubject: for nobody here\r\n\r\nhi\r\n', 'ok'),
+                            (b'Subject: no header at all\r\n\r\nhi\r\n', 'ok')])
+        self.addCleanup(server.close)
+        self.start('acct:secret@127.0.0.1:%d' % server.port, **{'pop.headers': 'Delivered-To'})
+        home = self.suite.path('home/ann')
+        Suite._run([VELMOR_BIN, '--root', self.suite.root, '--adduser', 'ann', '--password', 'x', '--home', home])
+        self.run_suite()
+        self.fetch()
+        self.assertEqual(len(self.queued()), 3)
+        for _ in range(20):
+            if not self.queued():
+                break
+            self.suite.ctl('maildebatch')
+        self.assertTrue(wait_for(lambda: not self.queued()))
+        self.assertTrue(wait_for(lambda: len(numbered(self.suite.path('mail/odd'))) == 2), self.suite.log('errors'))
+        with open(os.path.join(home, 'mail', 'inbox'), 'rb') as f:
+            inbox = f.read()
+        self.assertIn(b'Subject: for ann', inbox)
+        self.assertNotIn(b'nobody here', inbox)
+        self.assertEqual(numbered(self.suite.path('mail/out')), [])
+        self.assertEqual(self.suite.log('errors').count('Fetched mail for no local user'), 2)
+
+
+def dovecot_messages(count, seed):
+    rnd = random.Random(seed)
+    words = 'fetch queue link modem mail provider header body line dot'.split()
+    out = []
+    for n in range(1, count + 1):
+        lines = [b'From: Sender <s%d@far.example>' % n, b'To: acct@isp.example', b'Subject: number %d' % n,
+                 b'Message-ID: <%d.%d@far.example>' % (seed, n), b'']
+        for _ in range(rnd.randint(3, 300)):
+            lines.append(' '.join(rnd.choice(words) for _ in range(rnd.randint(1, 12))).encode())
+        lines[rnd.randint(6, len(lines) - 1)] = b'.'  # a lone dot inside the body
+        lines.append(b'..two dots')
+        out.append(b'\n'.join(lines) + b'\n')
+    return out
+
+
+@unittest.skipUnless(dovecot.available(), 'dovecot-pop3d is not installed')
+class DovecotTest(FetchCase):
+
+    def setUp(self):
+        self.dovecot = dovecot.Dovecot()
+        self.addCleanup(self.dovecot.close)
+
+    def account(self, user, keep=False):
+        return '%s%s:%s@127.0.0.1:%d' % ('-' if keep else '', user, self.dovecot.password, self.dovecot.port)
+
+    def test_fifty_messages_arrive_whole_and_are_deleted_or_kept(self):
+        take, keep = dovecot_messages(50, 1), dovecot_messages(50, 2)
+        self.dovecot.fill('take', take)
+        self.dovecot.fill('keep', keep)
+        self.start(self.account('take') + ', ' + self.account('keep', keep=True))
+        self.run_suite()
+        self.fetch()
+        self.assertTrue(wait_for(lambda: self.suite.log('main').count('POP client dispose') == 2))
+        self.assertTrue(wait_for(lambda: not self.status() & RUNNING))
+        got = {}
+        for p in self.queued():
+            message = fetched_message(p)
+            got.setdefault(re.search(rb'<(\d+)\.(\d+)@far', message).groups(), message)
+        self.assertEqual(len(self.queued()), 100)
+        for seed, messages in ((1, take), (2, keep)):
+            for n, m in enumerate(messages, 1):
+                self.assertEqual(got[(b'%d' % seed, b'%d' % n)], transmitted(m), (seed, n))
+        self.assertEqual(self.dovecot.left('take'), 0)
+        self.assertEqual(self.dovecot.left('keep'), 50)
+        self.assertEqual(self.hidden(), [])
+
+    def test_a_full_disk_deletes_nothing_that_is_not_queued(self):
+        if os.geteuid() != 0:
+            self.skipTest('mounting a small file system needs root')
+        self.dovecot.fill('take', dovecot_messages(50, 3))
+        suite = self.start(self.account('take'), **{'mail.dir.incoming': 'small/in'})
+        small = suite.path('small')
+        os.makedirs(small)
+        r = subprocess.run(['mount', '-t', 'tmpfs', '-o', 'size=96k,mode=0770', 'velmor-small', small],
+                           capture_output=True)
+        if r.returncode != 0:
+            self.skipTest('cannot mount a tmpfs: %s' % r.stderr.decode(errors='replace'))
+        self.addCleanup(subprocess.run, ['umount', '-l', small])
+        self.run_suite()
+        self.fetch()
+        queued = len(self.queued('small/in'))
+        left = self.dovecot.left('take')
+        self.assertGreater(queued, 0)
+        self.assertGreater(left, 0, self.suite.log('main'))
+        self.assertEqual(queued + left, 50)  # every deleted message is queued, and nothing twice
+        self.assertEqual(self.hidden('small/in'), [])
+        self.assertIn('not queued', self.suite.log('errors'))
+
+
+class MailTransferTest(FetchCase):
+    """"mailtransfer" fetches at once with the link up; with it down it dials
+    (a modem written here), waits until the name server answers, fetches,
+    and hangs up."""
+
+    def test_with_the_link_up(self):
+        server = PopServer([(b'Subject: one\r\n\r\nbody\r\n', 'ok')])
+        self.addCleanup(server.close)
+        self.start('acct:secret@127.0.0.1:%d' % server.port)
+        self.run_suite()
+        self.suite.ctl('mailtransfer')
+        self.assertTrue(wait_for(lambda: server.messages == []), self.suite.log('main'))
+        self.assertEqual(len(self.queued()), 1)
+        self.assertIn('Internal command: mailtransfer', self.suite.log('main'))
+        self.assertNotIn('Mail transfer - connecting...', self.suite.log('main'))
+
+    def test_with_the_link_down_until_the_name_server_answers(self):
+        server = PopServer([(b'Subject: one\r\n\r\nbody\r\n', 'ok'), (b'Subject: two\r\n\r\nbody\r\n', 'ok')])
+        self.addCleanup(server.close)
+        replies = {b'ATZ': b'\r\nOK\r\n', b'ATDT5551234': b'\r\nCONNECT 33600\r\n'}
+        modem = FakeModem(replies.get)
+        self.addCleanup(modem.hang_up)
+        self.link = False
+        names = NameServer(test_address(41), lambda q: answer_all(q) if self.link else [])
+        self.addCleanup(names.close)
+        suite = Suite(config={
+            'dialler.driver': 'modem', 'dialler.script': 'config/dial.script', 'dialler.phone': '5551234',
+            'dns.servers': names.address, 'dns.timeout': '1', 'dns.retries': '1',
+            'mail.debatch.time': '0', 'pop.hosts': 'acct:secret@127.0.0.1:%d' % server.port,
+            'store.state': str(2 + 8 + 16384)})
+        self.suite = suite
+        self.addCleanup(suite.cleanup)
+        os.symlink(modem.path, suite.path('modem'))
+        with open(suite.path('config/dial.script'), 'w') as f:
+            f.write('i ATZ\nd "ATDT%phone"\n')
+        suite.start()
+        suite.ctl('mailtransfer')
+        self.assertTrue(wait_for(lambda: 'Dialler - script complete' in suite.log('main')), suite.log('main'))
+        seen = len(names.queries)
+        self.assertTrue(wait_for(lambda: len(names.queries) >= seen + 2))  # unanswered probes
+        self.assertEqual(len(server.messages), 2)  # nothing fetched while the link is down
+        self.link = True
+        self.assertTrue(wait_for(lambda: 'Mail transfer complete, disconnecting' in suite.log('main')),
+                        suite.log('main') + suite.log('errors') + repr(server.commands))
+        self.assertEqual(server.messages, [])
+        self.assertEqual(len(self.queued()), 2)
+        log = suite.log('main')
+        steps = ['Mail transfer - connecting...', 'Dialler - script complete', 'DNS - Network link established',
+                 'Mail transfer - connected, and starting transfer', 'POP3 client connected to: 127.0.0.1',
+                 'POP client closing connection', 'Mail transfer complete, disconnecting']
+        at = [log.find(step) for step in steps]
+        self.assertNotIn(-1, at, log)
+        self.assertEqual(at, sorted(at), log)
+
+
+if __name__ == '__main__':
+    unittest.main()
