@@ -8,6 +8,9 @@ service is never touched.
     ... fetch from 127.0.0.1:d.port as ann / d.password ...
     d.left('ann')   # messages still on the server
     d.close()
+
+Dovecot(tls=(cert, key)) also listens with TLS from the first byte on
+d.tls_port and offers STARTTLS/STLS on d.port, with that certificate.
 """
 
 import os
@@ -27,12 +30,20 @@ def available():
 
 
 class Dovecot:
-    def __init__(self, password='dove-pass', protocol='pop3', extra=''):
+    def __init__(self, password='dove-pass', protocol='pop3', extra='', tls=None):
         other = 'imap' if protocol == 'pop3' else 'pop3'
         self.password = password
         self.work = tempfile.mkdtemp(prefix='velmor-dovecot-')
         os.chmod(self.work, 0o755)  # the mail processes run as nobody
         self.port = free_port()
+        self.tls_port = free_port() if tls else 0
+        ssl = 'no'
+        if tls:
+            # Dovecot reads the pair as root at start-up; copies keep the
+            # caller's files out of it.
+            for name, source in zip(('cert.pem', 'key.pem'), tls):
+                shutil.copyfile(source, os.path.join(self.work, name))
+            ssl = 'yes\nssl_cert = <{w}/cert.pem\nssl_key = <{w}/key.pem'.format(w=self.work)
         self.proc = None
         conf = os.path.join(self.work, 'dovecot.conf')
         with open(conf, 'w') as f:
@@ -41,7 +52,7 @@ state_dir = {w}/state
 log_path = {w}/dovecot.log
 protocols = {proto}
 listen = 127.0.0.1
-ssl = no
+ssl = {ssl}
 disable_plaintext_auth = no
 auth_mechanisms = plain
 mail_location = maildir:~/Maildir
@@ -60,7 +71,9 @@ service {proto}-login {{
     port = {port}
   }}
   inet_listener {proto}s {{
-    port = 0
+    address = 127.0.0.1
+    port = {tls_port}
+    ssl = yes
   }}
 }}
 service {other}-login {{
@@ -71,7 +84,8 @@ service {other}-login {{
     port = 0
   }}
 }}
-'''.format(w=self.work, p=password, port=self.port, proto=protocol, other=other) + extra)
+'''.format(w=self.work, p=password, port=self.port, proto=protocol, other=other, ssl=ssl,
+           tls_port=self.tls_port) + extra)
         os.makedirs(os.path.join(self.work, 'state'), exist_ok=True)
         os.makedirs(os.path.join(self.work, 'home'), exist_ok=True)
         self.proc = subprocess.Popen([DOVECOT, '-F', '-c', conf], stdout=subprocess.DEVNULL,
