@@ -18,9 +18,11 @@
 #include "core/log.h"
 #include "core/network.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 #include "core/util.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
+#include "mail/queue_text.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -38,6 +40,8 @@ constexpr int kFailedLoginLimit = 3;
 constexpr std::size_t kListingLines = 256;  // listing lines queued at a time
 
 const char* const kBadLogin = "-ERR Invalid username or password, please try again\r\n";
+const char* const kLoginNeedsTls =
+    "-ERR [AUTH] Use STLS first: passwords are not accepted unencrypted from outside the local network\r\n";
 
 std::string short_text(const std::string& value) { return value.substr(0, 200); }
 
@@ -75,6 +79,11 @@ class PopSession final : public Session {
   // Runs one line; false when the rest of the input is to be thrown away.
   bool command(Connection& c, std::string_view line);
   bool pass(Connection& c, std::string_view password);
+  void stls(Connection& c);
+  // STLS may be offered and used now.
+  bool tls_offered(const Connection& c) const {
+    return state_ != State::transaction && !c.secure() && tls_available();
+  }
   void mailbox_command(Connection& c, std::string_view verb, std::string_view arg);
   void retr(Connection& c, std::string_view arg);
   void top(Connection& c, std::string_view args);
@@ -257,6 +266,25 @@ bool PopSession::pass(Connection& c, std::string_view password) {
   log_message("Login:", user->login + " from " + c.peer().text, logfac::pop);
   c.send(strprintf("+OK %zu messages waiting for %s\r\n", count, user->login.c_str()));
   return true;
+}
+
+// STLS (RFC 2595): the ready reply goes in the clear, then the handshake;
+// the connection drops what the client sent behind the command, and the
+// session forgets a user name given in the clear.
+void PopSession::stls(Connection& c) {
+  if (c.secure()) {
+    c.send("-ERR Already using TLS\r\n");
+  } else if (state_ == State::transaction) {
+    c.send("-ERR STLS is only allowed before login\r\n");
+  } else if (!tls_offered(c)) {
+    c.send("-ERR TLS is not available on this server\r\n");
+  } else {
+    c.send("+OK Begin TLS negotiation\r\n");
+    c.start_tls();
+    state_ = State::authorization;
+    user_.clear();
+    user_ok_ = false;
+  }
 }
 
 void PopSession::send_ranges(Connection& c, const std::vector<Range>& ranges, const std::string& trailer) {
@@ -476,6 +504,11 @@ bool PopSession::command(Connection& c, std::string_view line) {
     return false;
   }
   if (is("USER")) {
+    if (!clear_login_allowed(c.peer().ip, c.secure())) {
+      // Refused before the password is sent, so it never crosses the network.
+      c.send(kLoginNeedsTls);
+      return true;
+    }
     arg = trim_blanks(arg);
     user_ok_ = !arg.empty() && arg.size() <= kNameLimit;
     user_.assign(arg.substr(0, kNameLimit));
@@ -485,10 +518,16 @@ bool PopSession::command(Connection& c, std::string_view line) {
   }
   if (is("PASS")) return pass(c, arg);
   if (is("CAPA")) {
-    // In every state; what a client may rely on (RFC 2449).
-    c.send(strprintf("+OK Capability list follows\r\nUSER\r\nUIDL\r\nTOP\r\nPIPELINING\r\nRESP-CODES\r\n"
+    // In every state; what a client may rely on (RFC 2449): USER only where
+    // a password may be sent, STLS only where it can be used.
+    c.send(strprintf("+OK Capability list follows\r\n%s%sUIDL\r\nTOP\r\nPIPELINING\r\nRESP-CODES\r\n"
                      "IMPLEMENTATION Velmor-Server-Suite-%s\r\n.\r\n",
-                     kVersion));
+                     clear_login_allowed(c.peer().ip, c.secure()) ? "USER\r\n" : "",
+                     tls_offered(c) ? "STLS\r\n" : "", kVersion));
+    return true;
+  }
+  if (is("STLS")) {
+    stls(c);
     return true;
   }
   if (is("QUIT")) {

@@ -3,12 +3,15 @@
 // test moves.
 #include "mail/pop_server.h"
 
+#include <arpa/inet.h>
+
 #include <filesystem>
 #include <limits>
 
 #include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/tls.h"
 #include "mail/mailbox.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
@@ -184,6 +187,83 @@ TEST_F(PopSessionTest, LongListingsFollowTheOutputAndPipelinedRetrievalsStayInOr
   EXPECT_NE(out.find("Subject: m5999\r\nStatus: RO\r\nX-Status:   \r\n\r\nbody 5999\r\n.\r\n+OK"), std::string::npos);
   EXPECT_TRUE(out.ends_with("shutdown (5998 messages left)\r\n"));
   EXPECT_TRUE(link->closed());
+}
+
+}  // namespace
+}  // namespace velmor
+
+namespace velmor {
+namespace {
+
+// STLS: offered and accepted only before login while a certificate is
+// loaded; what the client pipelined behind it is never run, and a user name
+// given in the clear is forgotten.
+TEST_F(PopSessionTest, StlsUpgradesBeforeLoginOnlyDropsPipelinedInputAndForgetsTheUser) {
+  mailbox({message(1, "a\r\n")});
+  TestLink off(svc::pop);
+  off.take();
+  EXPECT_EQ(say(off, "CAPA\r\n").find("STLS"), std::string::npos);
+  EXPECT_EQ(say(off, "STLS\r\n"), "-ERR TLS is not available on this server\r\n");
+  EXPECT_FALSE(off.connection().secure());
+
+  config.tls_cert = root + "/cert.pem";
+  config.tls_key = root + "/key.pem";
+  ASSERT_EQ(tls_make_self_signed(root + "/cert.pem", root + "/key.pem", "mail.example.test"), "");
+  ASSERT_EQ(tls_load(), TlsLoad::loaded);
+  TestLink link(svc::pop);
+  link.take();
+  std::string capa = say(link, "CAPA\r\n");
+  EXPECT_NE(capa.find("\r\nUSER\r\nSTLS\r\n"), std::string::npos) << capa;
+  EXPECT_EQ(say(link, "USER alice\r\nSTLS\r\nPASS secret\r\nQUIT\r\n"),
+            "+OK please send PASS command\r\n+OK Begin TLS negotiation\r\n");
+  EXPECT_TRUE(link.connection().secure());
+  EXPECT_FALSE(link.closed());
+  EXPECT_EQ(say(link, "PASS secret\r\n"), "-ERR Invalid command; valid commands:  USER,  QUIT\r\n");
+  EXPECT_EQ(say(link, "CAPA\r\n").find("STLS"), std::string::npos);
+  EXPECT_EQ(say(link, "STLS\r\n"), "-ERR Already using TLS\r\n");
+  EXPECT_EQ(say(link, "USER alice\r\nPASS secret\r\n"),
+            "+OK please send PASS command\r\n+OK 1 messages waiting for alice\r\n");
+  say(link, "QUIT\r\n");
+
+  auto plain = login();
+  EXPECT_EQ(say(*plain, "STLS\r\nSTAT\r\n"), "-ERR STLS is only allowed before login\r\n+OK 1 70\r\n");
+}
+
+// With tls.plain.login off, a peer outside the local networks cannot send a
+// password unencrypted: USER is refused (so PASS never follows), and is
+// neither looked up nor logged. Loopback, the private ranges and TLS may.
+TEST_F(PopSessionTest, PlainLoginIsRefusedToStrangersOnlyWhenSwitchedOffUntilTls) {
+  mailbox({message(1, "a\r\n")});
+  log_parse("2 " + root + "/main\n");
+  log_mask = logfac::pop;
+  const Peer stranger{inet_addr("192.0.2.9"), 4000, "192.0.2.9"};
+  const Peer neighbour{inet_addr("172.16.4.4"), 4000, "172.16.4.4"};
+  TestLink allowed(svc::pop, stranger);
+  allowed.take();
+  EXPECT_EQ(say(allowed, "USER alice\r\n"), "+OK please send PASS command\r\n");
+
+  config.tls_plain_login = false;
+  TestLink local(svc::pop, neighbour);
+  local.take();
+  EXPECT_EQ(say(local, "USER alice\r\nPASS secret\r\n"),
+            "+OK please send PASS command\r\n+OK 1 messages waiting for alice\r\n");
+  say(local, "QUIT\r\n");
+
+  TestLink link(svc::pop, stranger);
+  link.take();
+  EXPECT_EQ(say(link, "CAPA\r\n").find("USER"), std::string::npos);
+  EXPECT_EQ(say(link, "USER alice\r\nPASS secret\r\n"),
+            "-ERR [AUTH] Use STLS first: passwords are not accepted unencrypted from outside the local network\r\n"
+            "-ERR Invalid command; valid commands:  USER,  QUIT\r\n");
+  log_flush_all();
+  EXPECT_EQ(read_file(root + "/main").find("192.0.2.9"), std::string::npos) << read_file(root + "/main");
+  link.connection().start_tls();
+  link.turn();
+  ASSERT_TRUE(link.connection().secure());
+  EXPECT_NE(say(link, "CAPA\r\n").find("\r\nUSER\r\n"), std::string::npos);
+  EXPECT_EQ(say(link, "USER alice\r\nPASS secret\r\n"),
+            "+OK please send PASS command\r\n+OK 1 messages waiting for alice\r\n");
+  log_parse("");
 }
 
 }  // namespace

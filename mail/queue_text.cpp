@@ -89,6 +89,10 @@ bool address_is_private(std::uint32_t peer_nbo) {
   return (a >> 24) == 127 || (a >> 24) == 10 || (a >> 20) == 0xac1 || (a >> 16) == 0xc0a8;
 }
 
+bool clear_login_allowed(std::uint32_t peer_nbo, bool secure) {
+  return secure || config.tls_plain_login || address_is_private(peer_nbo);
+}
+
 bool relay_permitted(std::uint32_t peer_nbo, const AddressList& allow) {
   if (!allow.empty()) return address_list_match(allow, peer_nbo);
   return address_is_private(peer_nbo);

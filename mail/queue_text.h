@@ -62,6 +62,10 @@ std::string_view address_domain(std::string_view address);
 // network: loopback and the private ranges.
 bool relay_permitted(std::uint32_t peer_nbo, const AddressList& allow);
 bool address_is_private(std::uint32_t peer_nbo);
+// May a POP3 or IMAP client send its password in the clear? Always over TLS
+// and from loopback or the private ranges; from anywhere else only while
+// tls.plain.login allows it.
+bool clear_login_allowed(std::uint32_t peer_nbo, bool secure);
 
 // The phrases of a group's mail.filter: comma-separated, each optionally in
 // single quotes, leading blanks skipped, at most 60 characters each.
