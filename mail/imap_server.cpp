@@ -35,10 +35,12 @@
 #include "core/network.h"
 #include "core/safedir.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 #include "core/util.h"
 #include "mail/imap_render.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
+#include "mail/queue_text.h"
 #include "users/groups.h"
 #include "users/users.h"
 
@@ -560,6 +562,7 @@ class ImapSession final : public Session {
   void cmd_noop(Connection&, const std::string&, Args&, bool);
   void cmd_logout(Connection&, const std::string&, Args&, bool);
   void cmd_login(Connection&, const std::string&, Args&, bool);
+  void cmd_starttls(Connection&, const std::string&, Args&, bool);
   void cmd_select(Connection&, const std::string&, Args&, bool);
   void cmd_examine(Connection&, const std::string&, Args&, bool);
   void cmd_create(Connection&, const std::string&, Args&, bool);
@@ -649,6 +652,7 @@ const ImapSession::Command ImapSession::kCommands[] = {
     {"NOOP", &ImapSession::cmd_noop, Command::any, false},
     {"LOGOUT", &ImapSession::cmd_logout, Command::any, false},
     {"LOGIN", &ImapSession::cmd_login, Command::any, false},
+    {"STARTTLS", &ImapSession::cmd_starttls, Command::any, false},
     {"SELECT", &ImapSession::cmd_select, Command::authenticated, false},
     {"EXAMINE", &ImapSession::cmd_examine, Command::authenticated, false},
     {"CREATE", &ImapSession::cmd_create, Command::authenticated, false},
@@ -1155,8 +1159,31 @@ void ImapSession::resubscribe(std::string_view from, std::optional<std::string_v
 
 // ---- commands: any state --------------------------------------------------------------
 
+// STARTTLS before login while TLS can be had; LOGINDISABLED where a
+// password may not be sent in the clear (RFC 2595).
 void ImapSession::cmd_capability(Connection& c, const std::string& tag, Args&, bool) {
-  c.send("* CAPABILITY " + std::string(kCapabilities) + "\r\n" + tag + " OK CAPABILITY completed\r\n");
+  std::string list = kCapabilities;
+  if (auth_ == Auth::none && !c.secure() && tls_available()) list += " STARTTLS";
+  if (!clear_login_allowed(c.peer().ip, c.secure())) list += " LOGINDISABLED";
+  c.send("* CAPABILITY " + list + "\r\n" + tag + " OK CAPABILITY completed\r\n");
+}
+
+// The ready reply goes in the clear, then the handshake; the connection
+// drops what the client sent behind the command. The client asks for the
+// capabilities again once encrypted: none are sent unasked.
+void ImapSession::cmd_starttls(Connection& c, const std::string& tag, Args& a, bool) {
+  if (!a.end()) {
+    c.send(tag + " BAD STARTTLS takes no arguments\r\n");
+  } else if (c.secure()) {
+    c.send(tag + " BAD TLS is already active\r\n");
+  } else if (auth_ != Auth::none) {
+    c.send(tag + " BAD Not in correct auth state\r\n");
+  } else if (!tls_available()) {
+    c.send(tag + " BAD TLS is not available on this server\r\n");
+  } else {
+    c.send(tag + " OK Begin TLS negotiation now\r\n");
+    c.start_tls();
+  }
 }
 
 void ImapSession::cmd_noop(Connection& c, const std::string& tag, Args&, bool) {
@@ -1213,6 +1240,12 @@ void ImapSession::cmd_logout(Connection& c, const std::string& tag, Args&, bool)
 void ImapSession::cmd_login(Connection& c, const std::string& tag, Args& a, bool) {
   if (auth_ != Auth::none) {
     c.send(tag + " BAD Not in correct auth state\r\n");
+    return;
+  }
+  if (!clear_login_allowed(c.peer().ip, c.secure())) {
+    // Neither looked up nor logged: the password crossed the network unencrypted.
+    c.send(tag + " NO [PRIVACYREQUIRED] Use STARTTLS first: passwords are not accepted unencrypted"
+                 " from outside the local network\r\n");
     return;
   }
   auto name = a.astring();

@@ -2,10 +2,14 @@
 // mailboxes in a scratch home, the registered service, a clock the test moves.
 #include "mail/imap_server.h"
 
+#include <arpa/inet.h>
+
 #include <filesystem>
 
+#include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/tls.h"
 #include "core/util.h"
 #include "mail/imap_check.h"
 #include "mail/mailbox.h"
@@ -390,6 +394,54 @@ TEST_F(ImapSessionTest, SubscriptionsAreKeptInTheHomeAndFollowRenameAndDelete) {
   std::filesystem::remove(home + "/mail/.subscriptions");
   std::filesystem::create_symlink(root + "/elsewhere", home + "/mail/.subscriptions");
   EXPECT_EQ(say(*other, "j LSUB \"\" *\r\n"), "j OK LSUB completed\r\n");
+}
+
+}  // namespace
+}  // namespace velmor
+
+namespace velmor {
+namespace {
+
+// STARTTLS is offered and run only before login while a certificate is
+// loaded; a command pipelined behind it is never run; with tls.plain.login
+// off a stranger sees LOGINDISABLED and LOGIN is refused unread and unlogged
+// until the connection is encrypted.
+TEST_F(ImapSessionTest, StartTlsBeforeLoginDropsPipelinedCommandsAndGuardsClearPasswords) {
+  const std::string base = "* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE";
+  TestLink off(svc::imap);
+  off.take();
+  EXPECT_EQ(say(off, "a STARTTLS\r\n"), "a BAD TLS is not available on this server\r\n");
+
+  config.tls_cert = root + "/cert.pem";
+  config.tls_key = root + "/key.pem";
+  ASSERT_EQ(tls_make_self_signed(root + "/cert.pem", root + "/key.pem", "mail.example.test"), "");
+  ASSERT_EQ(tls_load(), TlsLoad::loaded);
+  config.tls_plain_login = false;
+  log_parse("2 " + root + "/main\n");
+  log_mask = logfac::imap;
+  TestLink link(svc::imap, Peer{inet_addr("192.0.2.9"), 4000, "192.0.2.9"});
+  link.take();
+  EXPECT_EQ(say(link, "a CAPABILITY\r\n"), base + " STARTTLS LOGINDISABLED\r\na OK CAPABILITY completed\r\n");
+  EXPECT_EQ(say(link, "b LOGIN alice secret\r\n"),
+            "b NO [PRIVACYREQUIRED] Use STARTTLS first: passwords are not accepted unencrypted from outside the "
+            "local network\r\n");
+  EXPECT_EQ(say(link, "c STARTTLS x\r\n"), "c BAD STARTTLS takes no arguments\r\n");
+  EXPECT_EQ(say(link, "d STARTTLS\r\ne LOGOUT\r\n"), "d OK Begin TLS negotiation now\r\n");
+  EXPECT_TRUE(link.connection().secure());
+  EXPECT_FALSE(link.closed());
+  EXPECT_EQ(say(link, "f CAPABILITY\r\n"), base + "\r\nf OK CAPABILITY completed\r\n");
+  EXPECT_EQ(say(link, "g STARTTLS\r\n"), "g BAD TLS is already active\r\n");
+  EXPECT_EQ(say(link, "h LOGIN alice secret\r\ni STARTTLS\r\n"),
+            "h OK LOGIN completed\r\ni BAD TLS is already active\r\n");
+  log_flush_all();
+  EXPECT_EQ(read_file(root + "/main").find("192.0.2.9"), std::string::npos);
+
+  // From a private address the clear-text login stays; after login STARTTLS is not offered.
+  TestLink local(svc::imap, Peer{inet_addr("10.0.0.7"), 4000, "10.0.0.7"});
+  local.take();
+  EXPECT_EQ(say(local, "a LOGIN alice secret\r\nb CAPABILITY\r\nc STARTTLS\r\n"),
+            "a OK LOGIN completed\r\n" + base + "\r\nb OK CAPABILITY completed\r\nc BAD Not in correct auth state\r\n");
+  log_parse("");
 }
 
 }  // namespace
