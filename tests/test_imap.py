@@ -469,7 +469,7 @@ class BadInput(ImapSuite):
         s.sendall(b'a SELECT INBOX\r\nb DELETE etc/passwd\r\nc CAPABILITY\r\n')
         self.assertEqual([f.readline() for _ in range(4)],
                          [b'a BAD Not in correct auth state\r\n', b'b BAD Not in correct auth state\r\n',
-                          b'* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE\r\n', b'c OK CAPABILITY completed\r\n'])
+                          b'* CAPABILITY IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE STARTTLS\r\n', b'c OK CAPABILITY completed\r\n'])
         m = self.imap()
         before = os.listdir(os.path.dirname(self.home))
         before_home = sorted(os.listdir(self.home))

@@ -312,7 +312,8 @@ class OtherClients(MailSuite):
         self.send(make_message('for fetchmail', extra=b'X-Read-Receipt: yes\r\n'), make_message('second for fetchmail'))
         port = str(self.suite.port('pop'))
         p = poplib.POP3('127.0.0.1', self.suite.port('pop'), timeout=10)
-        self.assertEqual(p.capa(), {'USER': [], 'UIDL': [], 'TOP': [], 'PIPELINING': [], 'RESP-CODES': [],
+        self.assertEqual(p.capa(), {'USER': [], 'STLS': [], 'UIDL': [], 'TOP': [], 'PIPELINING': [],
+                                    'RESP-CODES': [],
                                     'IMPLEMENTATION': ['Velmor-Server-Suite-2.0.49']})
         p.quit()
         url = 'pop3://alice:%s@127.0.0.1:%s' % (PASSWORD, port)
@@ -331,10 +332,11 @@ class OtherClients(MailSuite):
         out = os.path.join(work, 'delivered')
         rc = os.path.join(work, 'fetchmailrc')
         with open(rc, 'w') as f:
-            # fetchmail's defaults: no TLS options at all.
+            # fetchmail's defaults: it asks for STLS and checks the certificate.
             f.write('set no syslog\npoll 127.0.0.1 protocol POP3 port %s timeout 10\n'
                     '  user "alice" password "%s" is root here\n'
-                    '  mda "cat >> %s" no sslcertck\n' % (port, PASSWORD, out))
+                    '  mda "cat >> %s" sslcertfile "%s" sslcommonname "localhost"\n'
+                    % (port, PASSWORD, out, self.suite.path('config/tls/cert.pem')))
         os.chmod(rc, 0o600)
         env = dict(os.environ, HOME=work, FETCHMAILHOME=work)
         r = subprocess.run(['fetchmail', '-f', rc, '--nodetach', '--keep', '-v', '--pidfile',
