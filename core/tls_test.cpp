@@ -5,6 +5,9 @@
 
 #include <gtest/gtest.h>
 #include <fcntl.h>
+#include <openssl/bio.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -13,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "core/log.h"
 #include "core/network.h"
 #include "core/test_files.h"
 #include "core/test_fixture.h"
@@ -390,6 +394,26 @@ TEST_F(TlsTest, CertificatesLoadRenewAndAMissingOrWrongPairLeavesTlsOffOrAsItWas
   EXPECT_EQ(tls_load(), TlsLoad::off);
   config.tls_cert = cert;
   EXPECT_EQ(tls_load(), TlsLoad::loaded);
+
+  // A key under a passphrase is refused with its reason, never asked for.
+  std::string pem = read_file(key);
+  std::unique_ptr<BIO, decltype(&BIO_free)> in{BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free};
+  std::unique_ptr<EVP_PKEY, decltype(&EVP_PKEY_free)> pkey{PEM_read_bio_PrivateKey(in.get(), nullptr, nullptr, nullptr),
+                                                           EVP_PKEY_free};
+  std::unique_ptr<BIO, decltype(&BIO_free)> out{BIO_new(BIO_s_mem()), BIO_free};
+  ASSERT_TRUE(pkey && out);
+  ASSERT_EQ(PEM_write_bio_PrivateKey(out.get(), pkey.get(), EVP_aes_128_cbc(), nullptr, 0, nullptr,
+                                     const_cast<char*>("secret")), 1);
+  char* data = nullptr;
+  long n = BIO_get_mem_data(out.get(), &data);
+  write_file(dir.path() / "locked.key", std::string(data, static_cast<std::size_t>(n)));
+  config.tls_key = (dir.path() / "locked.key").string();
+  log_parse("1 " + (dir.path() / "errors").string() + "\n");
+  EXPECT_EQ(tls_load(), TlsLoad::kept);
+  log_flush_all();
+  EXPECT_NE(read_file(dir.path() / "errors").find("locked.key is protected by a passphrase"), std::string::npos)
+      << read_file(dir.path() / "errors");
+  log_parse("");
 }
 
 TEST_F(TlsTest, TwinServicesShareTheirPlainServicesSessionsUnderTheirOwnKeys) {
