@@ -1,8 +1,10 @@
 // The POP3 session through the test driver, fed arbitrary bytes in
-// arbitrary pieces by a user who knows the password: every reply is a whole
+// arbitrary pieces by a user who knows the password (on loopback, or as a
+// stranger who must use STLS first): every reply is a whole
 // CR LF line (messages included), delayed answers come once the clock moves,
 // and a session that did not QUIT leaves the mailbox as it was.
 #include <sys/stat.h>
+#include <arpa/inet.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -16,6 +18,7 @@
 #include "core/globals.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/tls.h"
 #include "mail/mailbox.h"
 #include "mail/pop_server.h"
 #include "mail/session_fuzz.h"
@@ -50,6 +53,11 @@ struct Scratch {
     groups_parse("#0\n%mail.pop.fetch: yes\n");
     inbox = root + "/alice/mail/inbox";
     original = message(1, "Hello.\r\n..dot\r\n") + message(2, "x\r\n\r\nlast\r\n") + message(3, "");
+    // A certificate, so STLS is offered and taken.
+    config.tls_cert = root + "/cert.pem";
+    config.tls_key = root + "/key.pem";
+    if (!tls_make_self_signed(root + "/cert.pem", root + "/key.pem", "fuzz.example").empty()) std::abort();
+    tls_load();
     pop_register();
   }
   void restore() {
@@ -71,7 +79,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   server_now = 1700000000;
   bool quit = false;
   {
-    TestLink link(svc::pop);
+    // The first byte's low bit: a stranger, with passwords in the clear refused.
+    const bool stranger = data[0] & 1;
+    config.tls_plain_login = !stranger;
+    TestLink link(svc::pop, stranger ? Peer{inet_addr("192.0.2.9"), 4000, "192.0.2.9"} : Peer{});
     link.feed(input, piece);
     for (int i = 0; i < 4 && !link.closed(); ++i) link.advance(std::chrono::seconds(1));
     link.finish();
