@@ -7,7 +7,6 @@ a SINCE UID SEARCH. Prints both times and their ratio.
 Run through bench/imap.sh, which installs Dovecot when it is missing."""
 
 import os
-import socket
 import sys
 import time
 
@@ -43,7 +42,7 @@ class Client:
     their literals counted out."""
 
     def __init__(self, port):
-        self.sock = socket.create_connection(('127.0.0.1', port), timeout=120)
+        self.sock = pop3_bench.connect(port, 120)
         self.buf = b''
         self.tag = 0
         self._line()

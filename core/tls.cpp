@@ -12,6 +12,8 @@
 #include <openssl/ssl.h>
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -210,15 +212,16 @@ class TlsTransport final : public Transport {
     put = 0;
     if (fatal_) return Io::failed;
     if (!established_) return Io::would_block;
-    for (std::string_view part : parts) {
-      if (part.empty()) continue;
+    std::size_t total = 0;
+    for (std::string_view part : parts) total += part.size();
+    while (put < total) {
+      std::string_view chunk = gather(parts, put);
       ERR_clear_error();
       std::size_t n = 0;
-      int rc = SSL_write_ex(ssl_.get(), part.data(), part.size(), &n);
+      int rc = SSL_write_ex(ssl_.get(), chunk.data(), chunk.size(), &n);
       write_needs_read_ = false;
       if (rc == 1) {
         put += n;
-        if (n < part.size()) return Io::ok;  // the socket is full
         continue;
       }
       switch (SSL_get_error(ssl_.get(), rc)) {
@@ -261,8 +264,27 @@ class TlsTransport final : public Transport {
     why_ = !lib.empty() ? lib : why.empty() ? std::string("protocol error") : std::move(why);
   }
 
+  // The next record's bytes, from `skip` bytes into the parts: as much as a
+  // record holds, copied together when they span parts. Parts written one
+  // by one would each go out as a record and a segment of their own, and a
+  // reply's short tail would wait for the peer's delayed acknowledgement.
+  // A write cut off is retried with the same bytes first (maybe more), as
+  // OpenSSL requires.
+  std::string_view gather(std::span<const std::string_view> parts, std::size_t skip) {
+    std::size_t i = 0;
+    while (skip >= parts[i].size()) skip -= parts[i++].size();
+    std::string_view first = parts[i].substr(skip);
+    if (first.size() >= kRecordBytes || i + 1 == parts.size()) return first;
+    stage_.assign(first);
+    for (++i; i < parts.size() && stage_.size() < kRecordBytes; ++i)
+      stage_.append(parts[i].substr(0, kRecordBytes - stage_.size()));
+    return stage_;
+  }
+
+  static constexpr std::size_t kRecordBytes = 16384;
   UniqueFd fd_;
   Owned<SSL> ssl_;
+  std::string stage_;  // a record's bytes gathered from several parts
   Need hs_need_;
   bool established_ = false;
   bool fatal_ = false;
@@ -450,6 +472,11 @@ std::unique_ptr<Transport> tls_transport(UniqueFd fd, const TlsPlan& plan) {
     return nullptr;
   }
   SSL_set_bio(ssl.get(), bio, bio);  // the SSL owns the BIO
+  // Records are already whole writes; Nagle would only hold a reply's record
+  // back behind the handshake's last (the session tickets) until the peer's
+  // delayed acknowledgement. (A socket that is not TCP says no; no matter.)
+  int on = 1;
+  ::setsockopt(fd.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
   if (plan.role == TlsRole::server) {
     SSL_set_accept_state(ssl.get());
   } else {
