@@ -319,6 +319,9 @@ TEST_F(SmtpSessionTest, StartTlsForgetsTheClearTextDialogueAndDropsWhatCameBehin
   auto ehlo = say(*link, "EHLO c\r\n");
   EXPECT_FALSE(offers(ehlo, "STARTTLS"));
   EXPECT_TRUE(offers(ehlo, "AUTH PLAIN LOGIN"));
+  EXPECT_EQ(say(*link, std::string(kEnvelope) + "Subject: s\r\n\r\nx\r\n.\r\n").back(), "250 OK");
+  EXPECT_NE(read_file(stored().at(0)).find("Received: from 127.0.0.1\r\n\tby " + text_of(config.server_name) + " with ESMTPS (Velmor"),
+            std::string::npos);
   // The AUTH before the upgrade counts for nothing.
   EXPECT_EQ(say(*link, "STARTTLS\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\n"),
             (std::vector<std::string>{"503 5.5.1 TLS already active", "235 2.7.0 Authentication successful"}));
@@ -369,6 +372,10 @@ TEST_F(SmtpSessionTest, AuthChecksTheUserDatabaseAndAnswersAWrongPasswordLate) {
   EXPECT_EQ(say(*good, "AUTH LOGIN\r\nYW5u\r\nc2VjcmV0\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\n"),
             (std::vector<std::string>{"334 VXNlcm5hbWU6", "334 UGFzc3dvcmQ6", "235 2.7.0 Authentication successful",
                                       "503 5.5.1 Already authenticated"}));
+  EXPECT_EQ(say(*good, std::string(kEnvelope) + "Subject: s\r\n\r\nx\r\n.\r\n").back(), "250 OK");
+  EXPECT_NE(read_file(stored().at(0)).find("Received: from 127.0.0.1 (authenticated as ann)\r\n\tby "),
+            std::string::npos);
+  EXPECT_NE(read_file(stored().at(0)).find(" with ESMTPA (Velmor"), std::string::npos);
 }
 
 TEST_F(SmtpSessionTest, SubmissionWantsTlsThenAuthAndAnAuthenticatedSenderMayRelay) {
