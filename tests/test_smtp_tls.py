@@ -11,13 +11,12 @@ import base64
 import os
 import re
 import smtplib
-import socket
 import ssl
 import subprocess
-import time
 import unittest
 
 from harness import VELMOR_BIN, Suite, wait_for
+from test_smtp import Conversation
 
 PASSWORD = 'Tr0ub4dor&3'
 CONFIG = {'mail.debatch.time': '0', 'mail.domains': 'localhost, site.example', 'smtp.allow': '192.0.2.1'}
@@ -57,23 +56,12 @@ def client_context(suite):
     return context
 
 
-class TlsDialogue:
+class TlsDialogue(Conversation):
     """A raw SMTP connection that can go over to TLS."""
 
     def __init__(self, suite, service):
         self.suite = suite
-        self.sock = socket.create_connection(('127.0.0.1', suite.port(service)), timeout=10)
-        self.buf = b''
-        self.greeting = self.line()
-
-    def line(self):
-        while b'\r\n' not in self.buf:
-            chunk = self.sock.recv(65536)
-            if not chunk:
-                raise EOFError('connection closed; got %r' % self.buf)
-            self.buf += chunk
-        line, self.buf = self.buf.split(b'\r\n', 1)
-        return line.decode('latin-1')
+        super().__init__(suite.port(service))
 
     def lines(self):
         """One reply, all its lines."""
@@ -81,10 +69,6 @@ class TlsDialogue:
         while out[-1][3:4] == '-':
             out.append(self.line())
         return out
-
-    def cmd(self, text):
-        self.sock.sendall(text.encode('latin-1') + b'\r\n')
-        return self.line()
 
     def secure(self):
         self.sock = ssl.create_default_context(cafile=self.suite.cert).wrap_socket(
