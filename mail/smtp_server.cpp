@@ -212,6 +212,7 @@ void SmtpSession::on_input(Connection& c) {
       // Never acted on in part: what is judged is what gets stored.
       if (auth_step_ != AuthStep::none) {
         auth_step_ = AuthStep::none;
+        login_name_.clear();
         c.send("500 5.5.6 Authentication Exchange line is too long\r\n");
         continue;
       }
