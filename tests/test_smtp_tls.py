@@ -74,11 +74,6 @@ class TlsDialogue(Conversation):
         self.sock = ssl.create_default_context(cafile=self.suite.cert).wrap_socket(
             self.sock, server_hostname=self.suite.host)
 
-    def closed(self):
-        try:
-            return self.sock.recv(1) == b''
-        except (ConnectionResetError, ssl.SSLError):
-            return True
 
 
 class SmtpTlsTest(unittest.TestCase):
@@ -147,6 +142,7 @@ class SmtpTlsTest(unittest.TestCase):
             self.assertEqual(c.sendmail('ann@site.example', ['pal@far.example'], MESSAGE % 'smtplib starttls'), {})
         with smtplib.SMTP_SSL('127.0.0.1', self.suite.port('smtps'), timeout=10,
                               context=client_context(self.suite)) as c:
+            self.assertEqual(c.mail('bob@far.example'), (530, b'5.7.0 Authentication required'))
             c.login('bob', PASSWORD)
             with self.assertRaises(smtplib.SMTPRecipientsRefused) as refused:
                 c.sendmail('bob@far.example', ['pal@far.example'], MESSAGE % 'bob')
@@ -173,11 +169,6 @@ class SmtpTlsTest(unittest.TestCase):
         d.sock.sendall(b'EHLO client.example\r\n')
         self.assertEqual(d.lines()[-1], '250 AUTH PLAIN LOGIN')
         self.assertEqual(d.cmd('MAIL FROM:<ann@site.example>'), '530 5.7.0 Authentication required')
-        # Wrong passwords: each answered late; the third ends the connection.
-        wrong = base64.b64encode(b'\0ann\0guess').decode()
-        for _ in range(3):
-            self.assertEqual(d.cmd('AUTH PLAIN ' + wrong), '535 5.7.8 Authentication credentials invalid')
-        self.assertTrue(d.closed())
         d.sock.close()
 
 
