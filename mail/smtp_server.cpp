@@ -6,15 +6,25 @@
 // later is refused while the client is still there: an unknown local
 // recipient at RCPT, a message over the size limit at MAIL or at the end of
 // its data.
+//
+// STARTTLS upgrades the connection in place, and the session then forgets
+// everything the clear-text part of the dialogue told it. AUTH (PLAIN and
+// LOGIN) checks the user database; it is offered only over TLS, or to a
+// loopback peer on the plain port. The submission listeners (STARTTLS on
+// one, TLS from the first byte on the other) take mail only from an
+// authenticated user; an authenticated user whose group may send may relay.
 #include "mail/smtp_server.h"
 
 #include <unistd.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
+#include <chrono>
 #include <ctime>
 #include <memory>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "core/config.h"
@@ -22,6 +32,7 @@
 #include "core/log.h"
 #include "core/network.h"
 #include "core/strfmt.h"
+#include "core/tls.h"
 #include "core/util.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
@@ -39,6 +50,35 @@ constexpr std::size_t kEchoMax = 200;  // of a client's text echoed in a reply
 constexpr std::size_t kMaxReplyLine = 2048;  // once the roles have swapped
 const char* const kLocalError = "451 Requested action aborted: local error in processing\r\n";
 const char* const kTooBig = "552 Message size exceeds fixed maximum message size\r\n";
+const char* const kNeedTls = "530 5.7.0 Must issue a STARTTLS command first\r\n";
+const char* const kBadCredentials = "535 5.7.8 Authentication credentials invalid\r\n";
+
+constexpr std::size_t kNameLimit = 64;        // of a login name, as POP3 takes it
+constexpr std::size_t kPasswordLimit = 256;
+// A refused password is answered this much later (other clients are served
+// meanwhile), and the connection ends after this many refusals, so guessing
+// is slow.
+constexpr std::chrono::milliseconds kFailedLoginDelay{1000};
+constexpr int kFailedLoginLimit = 3;
+
+// The listeners for mail submission: mail only from an authenticated user.
+bool submission_port(const Connection& c) { return c.service() == svc::submission || c.service() == svc::smtps; }
+
+// A client's base64 answer in an AUTH exchange, strictly: false when the
+// text is not base64 (so junk is refused, never half-read). "=" is the empty
+// answer of an initial response.
+bool sasl_decode(std::string_view text, std::string& out) {
+  out.clear();
+  if (text == "=" || text.empty()) return true;
+  if (text.size() % 4 != 0) return false;
+  std::size_t pad = text.ends_with("==") ? 2 : text.ends_with("=") ? 1 : 0;
+  for (std::size_t i = 0; i + pad < text.size(); ++i) {
+    char ch = text[i];
+    if (!std::isalnum(static_cast<unsigned char>(ch)) && ch != '+' && ch != '/') return false;
+  }
+  out = base64_decode(text);
+  return true;
+}
 
 std::string clip(std::string_view text, std::size_t max) { return std::string(text.substr(0, max)); }
 
@@ -66,6 +106,7 @@ class SmtpSession final : public Session {
   void on_drained(Connection& c) override {
     if (turned_) turned_->on_drained(c);
   }
+  void on_timer(Connection& c) override;
   // The group commit has run for this session's message.
   void committed(int error);
 
@@ -76,8 +117,19 @@ class SmtpSession final : public Session {
     committing,  // the message waits for its group commit; input is paused
   };
 
+  // What the next line of an AUTH exchange answers.
+  enum class AuthStep { none, plain, login_name, login_password };
+
   void command(Connection& c, std::string_view line);
   void ehlo(Connection& c, std::string_view arg);
+  std::vector<std::string> extensions(const Connection& c) const;
+  bool auth_offered(const Connection& c) const;
+  void auth(Connection& c, std::string_view arg);
+  void auth_answer(Connection& c, std::string_view line);
+  void check_plain(Connection& c, const std::string& response);
+  void check_login(Connection& c, std::string_view name, std::string_view password);
+  void starttls(Connection& c, std::string_view arg);
+  std::string received(const Connection& c) const;
   void help(Connection& c);
   void mail(Connection& c, std::string_view arg);
   void rcpt(Connection& c, std::string_view arg);
@@ -106,8 +158,7 @@ class SmtpSession final : public Session {
   const bool id_verify_;
   State state_ = State::command;
   Connection* conn_ = nullptr;
-  std::string received_;  // the Received: text made at the start
-  std::string trace_;     // received_, its date line and the X-Sender line
+  std::string trace_;     // the Received: text, its date line and the X-Sender line
   CacheFile queue_;       // the queue file of the transaction (its hidden name)
   std::string queue_path_;  // the name it gets once committed
   std::string queue_hidden_;
@@ -123,6 +174,12 @@ class SmtpSession final : public Session {
   MessageReceiver receiver_;
   std::string chunk_;
   std::unique_ptr<Session> turned_;  // the client role, after TURN
+  AuthStep auth_step_ = AuthStep::none;
+  std::string login_name_;  // LOGIN: the name, while the password is asked for
+  std::string auth_user_;   // the login name the client proved ("" = none)
+  std::shared_ptr<const GroupOptions> auth_group_;
+  int failed_logins_ = 0;
+  bool hello_needed_ = false;  // after STARTTLS, until the client greets again
 };
 
 void SmtpSession::on_open(Connection& c) {
@@ -132,8 +189,6 @@ void SmtpSession::on_open(Connection& c) {
                    name.c_str(), id_verify_ ? "[ID verify]" : "", kVersion, kPlatform,
                    time_text(std::time(nullptr)).c_str(), admin_address().c_str()));
   log_write(log_tag(c) + " - SMTP Connect from " + c.peer().text, logchan::mail);
-  received_ = strprintf("Received: from %s\r\n\tby %s with SMTP (Velmor Server Suite v%s %s)", c.peer().text.c_str(),
-                        name.c_str(), kVersion, kPlatform);
   log_message("SMTP Server accepting connection from:", c.peer().text, logfac::house);
 }
 
@@ -155,10 +210,20 @@ void SmtpSession::on_input(Connection& c) {
     if (r == LineResult::need_more) return;
     if (r == LineResult::overlong) {
       // Never acted on in part: what is judged is what gets stored.
+      if (auth_step_ != AuthStep::none) {
+        auth_step_ = AuthStep::none;
+        login_name_.clear();
+        c.send("500 5.5.6 Authentication Exchange line is too long\r\n");
+        continue;
+      }
       c.send("500 Line too long\r\n");
       continue;
     }
-    if (!line.empty()) command(c, line);
+    if (auth_step_ != AuthStep::none) {
+      auth_answer(c, line);  // never logged: it carries credentials
+    } else if (!line.empty()) {
+      command(c, line);
+    }
   }
   // The peer's greeting may have come with the TURN.
   if (turned_ && !c.closed()) turned_->on_input(c);
@@ -189,6 +254,18 @@ void SmtpSession::mail(Connection& c, std::string_view arg) {
     c.send("501 Syntax error in SIZE parameter\r\n");
     return;
   }
+  if (hello_needed_) {
+    c.send("503 5.5.1 Send EHLO first\r\n");
+    return;
+  }
+  if (c.service() == svc::submission && !c.secure()) {
+    c.send(kNeedTls);
+    return;
+  }
+  if (submission_port(c) && auth_user_.empty()) {
+    c.send("530 5.7.0 Authentication required\r\n");
+    return;
+  }
   std::string_view sender = path.address;
   discard();
   denial_ = 0;
@@ -198,7 +275,10 @@ void SmtpSession::mail(Connection& c, std::string_view arg) {
     std::optional<std::string> local = mail_local_user(sender);
     bool exists = local && user_exists(*local);
     if (exists) group_ = user_group(*local);
-    if (id_verify_ && local && !exists) {
+    // A peer that must identify itself proves a local sender with AUTH:
+    // only the authenticated user may send in that user's name.
+    const UserRecord* claimed = exists ? user_find(*local) : nullptr;
+    if (id_verify_ && local && (!claimed || !str_iequals(claimed->login, auth_user_))) {
       denial_ = 2;
     } else if (exists && !group_permits(group_, "mail.smtp.send")) {
       // A local sender with no group set (no groups file) is refused too.
@@ -215,7 +295,7 @@ void SmtpSession::mail(Connection& c, std::string_view arg) {
     }
     sender_ = sender;
     std::time_t now = server_now ? server_now : std::time(nullptr);
-    trace_ = received_ + ";\r\n\t" + mail_date_text(now) + "\r\n";
+    trace_ = received(c) + ";\r\n\t" + mail_date_text(now) + "\r\n";
     trace_ += "X-Sender: " + (sender.empty() ? std::string("Unknown") : std::string(sender)) + "\r\n";
     PendingIncoming p = queue_open_incoming_pending();
     if (!p.file) {
@@ -267,9 +347,12 @@ void SmtpSession::rcpt(Connection& c, std::string_view arg) {
       return;
     }
   }
-  // No relaying for strangers: outside recipients only from our own network.
+  // No relaying for strangers: outside recipients only from our own network,
+  // or from a user who proved who they are and whose group may send.
   bool local = mail_local_user(address).has_value();
-  if (!local && !relay_permitted(c.peer().ip, config.smtp_allow)) {
+  bool relay = relay_permitted(c.peer().ip, config.smtp_allow) ||
+               (!auth_user_.empty() && group_permits(auth_group_, "mail.smtp.send"));
+  if (!local && !relay) {
     c.send("550 Posting to this address forbidden\r\n");
     return;
   }
@@ -323,15 +406,22 @@ void SmtpSession::vrfy(Connection& c, std::string_view arg) {
                    mail_primary_domain().c_str()));
 }
 
-// The service extensions EHLO names, one a line. What a later extension
-// (STARTTLS, AUTH) offers is added here, when it applies to this client.
-std::vector<std::string> extensions(const Connection& c) {
+// Passwords travel only encrypted, or inside this host; the submission
+// port on which STARTTLS is offered wants it first from everyone.
+bool SmtpSession::auth_offered(const Connection& c) const {
+  return c.secure() || (c.peer().loopback() && c.service() != svc::submission);
+}
+
+// The service extensions EHLO names, one a line, as they apply to this client.
+std::vector<std::string> SmtpSession::extensions(const Connection& c) const {
   std::vector<std::string> lines{"PIPELINING"};
   // The installation's limit, as it applies to a stranger: the peer's group.
   std::uint32_t limit = group_message_limit(c.group() ? c.group() : group_default());
   lines.push_back(limit ? "SIZE " + std::to_string(limit) : "SIZE");
   lines.push_back("8BITMIME");
   lines.push_back("HELP");
+  if (!c.secure() && tls_available()) lines.push_back("STARTTLS");
+  if (auth_offered(c)) lines.push_back("AUTH PLAIN LOGIN");
   return lines;
 }
 
@@ -344,6 +434,7 @@ void SmtpSession::ehlo(Connection& c, std::string_view arg) {
     return;
   }
   discard();
+  hello_needed_ = false;
   std::vector<std::string> lines = extensions(c);
   lines.insert(lines.begin(), text_of(config.server_name) + " Hello " + clip(arg, kEchoMax) + ", how's life?");
   std::string reply;
@@ -369,6 +460,7 @@ void SmtpSession::command(Connection& c, std::string_view line) {
   if (verb.size() > 8) c.send("500 Bad command - too long\r\n");
   if (verb.empty()) return;
   if (str_iequals(verb, "helo")) {
+    hello_needed_ = false;
     c.send("250 Hello " + clip(arg, kEchoMax) + ", how's life?\r\n");
   } else if (str_iequals(verb, "ehlo")) {
     ehlo(c, arg);
@@ -392,6 +484,10 @@ void SmtpSession::command(Connection& c, std::string_view line) {
     c.close_after_send();
   } else if (str_iequals(verb, "vrfy")) {
     vrfy(c, arg);
+  } else if (str_iequals(verb, "starttls")) {
+    starttls(c, arg);
+  } else if (str_iequals(verb, "auth")) {
+    auth(c, arg);
   } else if (str_iequals(verb, "turn")) {
     // Only a peer we relay for may take the queue: the roles swap, and from
     // now on this connection is an SMTP client waiting for their greeting.
@@ -410,6 +506,178 @@ void SmtpSession::command(Connection& c, std::string_view line) {
   } else {
     c.send("500 Unknown command:" + std::string(verb) + "\r\n");
   }
+}
+
+// The Received: text of a message: the protocol word says how it came
+// (ESMTPS under TLS, ESMTPA with AUTH, ESMTPSA with both), and an
+// authenticated sender is named.
+std::string SmtpSession::received(const Connection& c) const {
+  const bool authed = !auth_user_.empty();
+  const char* word = c.secure() ? (authed ? "ESMTPSA" : "ESMTPS") : (authed ? "ESMTPA" : "SMTP");
+  std::string who = authed ? " (authenticated as " + auth_user_ + ")" : "";
+  return strprintf("Received: from %s%s\r\n\tby %s with %s (Velmor Server Suite v%s %s)", c.peer().text.c_str(),
+                   who.c_str(), text_of(config.server_name).c_str(), word, kVersion, kPlatform);
+}
+
+void SmtpSession::starttls(Connection& c, std::string_view arg) {
+  if (!trim_blanks(arg).empty()) {
+    c.send("501 5.5.4 Syntax: STARTTLS\r\n");
+    return;
+  }
+  if (c.secure()) {
+    c.send("503 5.5.1 TLS already active\r\n");
+    return;
+  }
+  if (!tls_available()) {
+    c.send("454 4.7.0 TLS not available due to temporary reason\r\n");
+    return;
+  }
+  c.send("220 2.0.0 Ready to start TLS\r\n");
+  if (c.start_tls() != Connection::TlsStart::started) {
+    // The client was told to start: it cannot be told otherwise now.
+    c.close_after_send();
+    return;
+  }
+  // Nothing the clear-text dialogue said carries over: the client greets
+  // again, starts its transaction again, and proves who it is again.
+  discard();
+  denial_ = 0;
+  group_.reset();
+  auth_user_.clear();
+  auth_group_.reset();
+  c.set_user("");
+  c.set_group(group_default());
+  hello_needed_ = true;
+  log_write(log_tag(c) + " - TLS started", logchan::mail);
+}
+
+void SmtpSession::auth(Connection& c, std::string_view arg) {
+  if (hello_needed_) {
+    c.send("503 5.5.1 Send EHLO first\r\n");
+    return;
+  }
+  if (!auth_user_.empty()) {
+    c.send("503 5.5.1 Already authenticated\r\n");
+    return;
+  }
+  if (queue_) {
+    c.send("503 5.5.1 AUTH not permitted during a mail transaction\r\n");
+    return;
+  }
+  if (!auth_offered(c)) {
+    c.send(c.service() == svc::submission
+               ? kNeedTls
+               : "538 5.7.11 Encryption required for requested authentication mechanism\r\n");
+    return;
+  }
+  arg = trim_blanks(arg);
+  std::size_t blank = std::min(arg.find(' '), arg.size());
+  std::string_view mechanism = arg.substr(0, blank);
+  std::string_view initial = trim_blanks(arg.substr(blank));
+  if (mechanism.empty()) {
+    c.send("501 5.5.4 Syntax: AUTH mechanism\r\n");
+    return;
+  }
+  const bool plain = str_iequals(mechanism, "plain");
+  if (!plain && !str_iequals(mechanism, "login")) {
+    c.send("504 5.5.4 Unrecognized authentication type\r\n");
+    return;
+  }
+  if (initial.empty()) {
+    auth_step_ = plain ? AuthStep::plain : AuthStep::login_name;
+    c.send(plain ? "334 \r\n" : "334 VXNlcm5hbWU6\r\n");  // "Username:"
+    return;
+  }
+  // The initial response: PLAIN's whole answer, or LOGIN's name.
+  auth_step_ = plain ? AuthStep::plain : AuthStep::login_name;
+  auth_answer(c, initial);
+}
+
+// One answer of an AUTH exchange.
+void SmtpSession::auth_answer(Connection& c, std::string_view line) {
+  AuthStep step = auth_step_;
+  auth_step_ = AuthStep::none;
+  line = trim_blanks(line);
+  if (line == "*") {
+    login_name_.clear();
+    c.send("501 5.7.0 Authentication cancelled\r\n");
+    return;
+  }
+  std::string decoded;
+  if (!sasl_decode(line, decoded)) {
+    login_name_.clear();
+    c.send("501 5.5.2 Cannot decode response\r\n");
+    return;
+  }
+  switch (step) {
+    case AuthStep::plain:
+      check_plain(c, decoded);
+      break;
+    case AuthStep::login_name:
+      login_name_ = std::move(decoded);
+      auth_step_ = AuthStep::login_password;
+      c.send("334 UGFzc3dvcmQ6\r\n");  // "Password:"
+      break;
+    case AuthStep::login_password:
+      check_login(c, std::exchange(login_name_, {}), decoded);
+      break;
+    case AuthStep::none:
+      break;
+  }
+}
+
+// PLAIN: "authorisation identity NUL name NUL password"; a client may act
+// only as itself, so the identity is empty or the name.
+void SmtpSession::check_plain(Connection& c, const std::string& response) {
+  std::size_t first = response.find('\0');
+  std::size_t second = first == std::string::npos ? first : response.find('\0', first + 1);
+  if (second == std::string::npos) {
+    check_login(c, "", "");
+    return;
+  }
+  std::string_view text(response);
+  std::string_view identity = text.substr(0, first);
+  std::string_view name = text.substr(first + 1, second - first - 1);
+  std::string_view password = text.substr(second + 1);
+  if (!identity.empty() && !str_iequals(identity, name)) password = {};  // refused below, as any wrong password
+  check_login(c, name, password);
+}
+
+void SmtpSession::check_login(Connection& c, std::string_view name, std::string_view password) {
+  const UserRecord* user = !name.empty() && name.size() <= kNameLimit ? user_find(name) : nullptr;
+  if (!user || password.empty() || password.size() > kPasswordLimit ||
+      user_check_password(user->login, password) != 0) {
+    // The name and the peer are logged; the password never is.
+    std::string shown(name.substr(0, kNameLimit));
+    for (char& ch : shown) {
+      if (static_cast<unsigned char>(ch) < ' ' || ch == 0x7f) ch = '?';
+    }
+    log_write("SMTP: Login failed for: " + shown + " from " + c.peer().text, logchan::main, kLogUnbuffered);
+    ++failed_logins_;
+    c.pause_input();  // nothing more is read until the late answer
+    c.wake_after(kFailedLoginDelay);
+    return;
+  }
+  auth_user_ = user->login;
+  auth_group_ = user_group(user->login);
+  c.set_user(user->login);
+  c.set_group(auth_group_);
+  log_write(log_tag(c) + " - authenticated as " + user->login, logchan::mail);
+  c.send("235 2.7.0 Authentication successful\r\n");
+}
+
+// The answer to a refused password, a second late.
+void SmtpSession::on_timer(Connection& c) {
+  if (turned_) {
+    turned_->on_timer(c);
+    return;
+  }
+  c.send(kBadCredentials);
+  if (failed_logins_ >= kFailedLoginLimit) {
+    c.close_after_send();
+    return;
+  }
+  c.resume_input();
 }
 
 void SmtpSession::data_phase(Connection& c) {

@@ -5,12 +5,15 @@
 
 #include <arpa/inet.h>
 
+#include <algorithm>
+
 #include <limits>
 #include <set>
 
 #include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/tls.h"
 #include "mail/alias.h"
 #include "mail/queue_test_fixture.h"
 #include "users/groups.h"
@@ -51,6 +54,15 @@ class SmtpSessionTest : public QueueFixture {
   std::vector<std::string> say(TestLink& link, std::string_view text, std::size_t piece = 0) {
     link.feed(text, piece);
     return reply_lines(link.take());
+  }
+  void set_password(const std::string& name, const std::string& password) {
+    ASSERT_EQ(user_set_password(name, password), UserChange::done);
+  }
+  void use_certificate() {
+    ASSERT_EQ(tls_make_self_signed(root + "/cert.pem", root + "/key.pem", "mx.site.example"), "");
+    config.tls_cert = root + "/cert.pem";
+    config.tls_key = root + "/key.pem";
+    ASSERT_EQ(tls_load(), TlsLoad::loaded);
   }
   std::vector<std::string> stored() { return folder_names(root + "/in", true); }
   std::vector<std::string> hidden() {
@@ -219,7 +231,12 @@ TEST_F(SmtpSessionTest, TheAcceptRuleRefusesBlocksAndAsksStrangersToIdentify) {
   EXPECT_NE(verify.take().find("SMTP Server [ID verify] (v"), std::string::npos);
   EXPECT_EQ(say(verify, "MAIL FROM:<made_up@site.example>\r\nRCPT TO:<ann@site.example>\r\n").back(),
             "550 posting denied");
-  for (const char* real : {"MAIL FROM:<ann@site.example>\r\n", "MAIL FROM:<someone@far.example>\r\n"})
+  // A local sender must prove it is that user; mail from outside comes as ever.
+  EXPECT_EQ(say(verify, "MAIL FROM:<ann@site.example>\r\nRCPT TO:<ann@site.example>\r\n").back(),
+            "550 posting denied");
+  set_password("ann", "secret");
+  EXPECT_EQ(say(verify, "RSET\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\n").back(), "235 2.7.0 Authentication successful");
+  for (const char* real : {"MAIL FROM:<someone@far.example>\r\n", "MAIL FROM:<ann@site.example>\r\n"})
     EXPECT_EQ(say(verify, std::string(real) + "RCPT TO:<ann@site.example>\r\n").back(),
               "250 OK Recipient syntactically correct");
 }
@@ -233,7 +250,7 @@ TEST_F(SmtpSessionTest, EhloNamesItsExtensionsAndTheLimitCountsTheWholeQueueFile
   auto link = open();
   EXPECT_EQ(say(*link, "EHLO client.example\r\nEHLO\r\n"),
             (std::vector<std::string>{"250-mx.site.example Hello client.example, how's life?", "250-PIPELINING",
-                                      "250-SIZE 1024", "250-8BITMIME", "250 HELP",
+                                      "250-SIZE 1024", "250-8BITMIME", "250-HELP", "250 AUTH PLAIN LOGIN",
                                       "501 Syntax: EHLO hostname"}));
   EXPECT_EQ(say(*link, "HELP\r\n").back(), "214 Report problems to postmaster@site.example");
   EXPECT_EQ(say(*link, "MAIL FROM:<x@far.example> SIZE=12x\r\n"),
@@ -275,6 +292,70 @@ TEST_F(SmtpSessionTest, RecipientsAreCheckedAlongDebatchsRoute) {
   EXPECT_EQ(say(*link, "MAIL FROM:<boss@site.example>\r\nRCPT TO:<+0@site.example>\r\n").back(),
             "250 OK Recipient syntactically correct");
   alias_table().clear();
+}
+
+bool offers(const std::vector<std::string>& ehlo, const std::string& extension) {
+  return std::any_of(ehlo.begin(), ehlo.end(), [&](const std::string& l) { return l.substr(4) == extension; });
+}
+
+TEST_F(SmtpSessionTest, StartTlsForgetsTheClearTextDialogue) {
+  auto link = open();
+  EXPECT_EQ(say(*link, "STARTTLS\r\n"), std::vector<std::string>{"454 4.7.0 TLS not available due to temporary reason"});
+  use_certificate();
+  set_password("ann", "secret");
+  say(*link, "EHLO c\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\nMAIL FROM:<x@far.example>\r\n");
+  EXPECT_EQ(say(*link, "STARTTLS\r\n"), std::vector<std::string>{"220 2.0.0 Ready to start TLS"});
+  EXPECT_EQ(hidden(), std::vector<std::string>{});  // the clear-text transaction is gone
+  auto lines = say(*link, "MAIL FROM:<x@far.example>\r\nEHLO c\r\n");
+  EXPECT_EQ(lines.front(), "503 5.5.1 Send EHLO first");
+  EXPECT_FALSE(offers(lines, "STARTTLS"));
+  EXPECT_EQ(say(*link, std::string(kEnvelope) + "Subject: s\r\n\r\nx\r\n.\r\n").back(), "250 OK");
+  EXPECT_NE(read_file(stored().at(0)).find("Received: from 127.0.0.1\r\n\tby " + text_of(config.server_name) +
+                                           " with ESMTPS (Velmor"),
+            std::string::npos);
+  // The AUTH before the upgrade counts for nothing.
+  EXPECT_EQ(say(*link, "STARTTLS\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\n"),
+            (std::vector<std::string>{"503 5.5.1 TLS already active", "235 2.7.0 Authentication successful"}));
+}
+
+TEST_F(SmtpSessionTest, AuthChecksTheUserDatabaseAndAnswersAWrongPasswordLate) {
+  set_password("ann", "secret");
+  // A remote peer may not send a password in the clear, nor is it offered.
+  TestLink remote(svc::smtp, Peer{inet_addr("192.0.2.9"), 4000, "192.0.2.9"});
+  remote.take();
+  EXPECT_FALSE(offers(say(remote, "EHLO c\r\n"), "AUTH PLAIN LOGIN"));
+  EXPECT_EQ(say(remote, "AUTH PLAIN AGFubgBzZWNyZXQ=\r\n"),
+            std::vector<std::string>{"538 5.7.11 Encryption required for requested authentication mechanism"});
+  auto link = open();
+  EXPECT_EQ(say(*link, "AUTH\r\nAUTH CRAM-MD5\r\nAUTH LOGIN\r\n*\r\nAUTH PLAIN\r\n%%%%\r\n"),
+            (std::vector<std::string>{"501 5.5.4 Syntax: AUTH mechanism", "504 5.5.4 Unrecognized authentication type",
+                                      "334 VXNlcm5hbWU6", "501 5.7.0 Authentication cancelled", "334 ",
+                                      "501 5.5.2 Cannot decode response"}));
+  // Wrong: a second late, the third ends the connection. PLAIN as another
+  // identity than the name is refused like a wrong password.
+  const std::string wrong[] = {"AUTH LOGIN YW5u\r\nd3Jvbmc=\r\n",      // ann / wrong
+                               "AUTH PLAIN Ym9iAGFubgBzZWNyZXQ=\r\n",  // bob as ann / secret
+                               "AUTH PLAIN AGFubgB3cm9uZw==\r\n"};     // ann / wrong
+  for (int i = 0; i < 3; ++i) {
+    link->feed(wrong[i] + "NOOP\r\n");
+    EXPECT_EQ(reply_lines(link->take()).size(), i == 0 ? 1u : 0u);  // LOGIN's "Password:"
+    link->advance(std::chrono::milliseconds(999));
+    EXPECT_EQ(link->take(), "");
+    link->advance(std::chrono::milliseconds(1));
+    std::vector<std::string> late{"535 5.7.8 Authentication credentials invalid"};
+    if (i < 2) late.push_back("250 OK");  // the third ends the connection
+    EXPECT_EQ(reply_lines(link->take()), late);
+  }
+  EXPECT_EQ(link->reason(), CloseReason::requested);
+  // Right, with LOGIN: once only; its messages name the user.
+  auto good = open();
+  EXPECT_EQ(say(*good, "AUTH LOGIN\r\nYW5u\r\nc2VjcmV0\r\nAUTH PLAIN AGFubgBzZWNyZXQ=\r\n"),
+            (std::vector<std::string>{"334 VXNlcm5hbWU6", "334 UGFzc3dvcmQ6", "235 2.7.0 Authentication successful",
+                                      "503 5.5.1 Already authenticated"}));
+  EXPECT_EQ(say(*good, std::string(kEnvelope) + "Subject: s\r\n\r\nx\r\n.\r\n").back(), "250 OK");
+  EXPECT_NE(read_file(stored().at(0)).find("Received: from 127.0.0.1 (authenticated as ann)\r\n\tby "),
+            std::string::npos);
+  EXPECT_NE(read_file(stored().at(0)).find(" with ESMTPA (Velmor"), std::string::npos);
 }
 
 TEST_F(SmtpSessionTest, CredentialsNeverReachTheMailLog) {

@@ -1,11 +1,17 @@
 // The SMTP session through the test driver, fed arbitrary bytes in
-// arbitrary pieces. As a command stream: every reply is a whole CR LF line
-// and nothing is left half-written in the queue. As a message: whatever its
+// arbitrary pieces. As a command stream (on the SMTP port from loopback or
+// from afar, or on a submission port, with a certificate loaded so STARTTLS
+// and AUTH run, and the clock moved past every late answer to a wrong
+// password): every reply is a whole CR LF line and nothing is left
+// half-written in the queue. As a message: whatever its
 // lines, the message stored is the one sent.
 #include <dirent.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <arpa/inet.h>
+
+#include <chrono>
 #include <cstdint>
 #include <cstdlib>
 #include <filesystem>
@@ -16,6 +22,8 @@
 #include "core/globals.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/tls.h"
+#include "core/util.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/session_fuzz.h"
@@ -44,10 +52,17 @@ struct Scratch {
     for (const char* d : {"/in", "/out", "/odd", "/tmp"}) mkdir((root + d).c_str(), 0700);
     filecache_init();
     queue_init(1000);
-    write_all(root + "/users", "ann,x,Ann," + root + "/ann,0\n");
+    // ann's password is "secret" (AUTH PLAIN AGFubgBzZWNyZXQ=).
+    write_all(root + "/users", "ann," + md5_crypt("secret", "$1$fuzzsalt$") + ",Ann," + root + "/ann,0\n");
     user_load(root + "/users");
     groups_parse("#0\n%mail.smtp.send: yes\n");
+    if (tls_make_self_signed(root + "/cert.pem", root + "/key.pem", "fuzz.example").empty()) {
+      config.tls_cert = root + "/cert.pem";
+      config.tls_key = root + "/key.pem";
+      tls_load();
+    }
     smtp_register();
+    tls_register_services();
   }
   // Every queue file the input made (name and content), removed.
   std::vector<std::pair<std::string, std::string>> take_files() {
@@ -72,8 +87,13 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   server_now = 1700000000;
   if (!as_message) {
     {
-      TestLink link(svc::smtp);
+      const int where = (data[0] >> 1) & 3;
+      const int service[] = {svc::smtp, svc::submission, svc::smtps, svc::smtp};
+      Peer peer{};
+      if (where == 3) peer = Peer{inet_addr("192.0.2.9"), 4000, "192.0.2.9"};
+      TestLink link(service[where], peer);
       link.feed(input, piece);
+      for (int i = 0; i < 4 && !link.closed(); ++i) link.advance(std::chrono::seconds(1));
       link.finish();
       check_lines(link.output());
     }

@@ -84,8 +84,8 @@ class SmtpServerTest(SuiteTestCase):
             refused = c.sendmail('ann@far.example', ['postmaster@localhost', 'bob@remote.example'], message)
             self.assertEqual(refused, {})
             # EHLO names the extensions; SIZE is the default group's limit (10240 kB).
-            self.assertEqual(c.esmtp_features,
-                             {'pipelining': '', 'size': '10485760', '8bitmime': '', 'help': ''})
+            self.assertEqual(c.esmtp_features, {'pipelining': '', 'size': '10485760', '8bitmime': '', 'help': '',
+                                                'starttls': '', 'auth': ' PLAIN LOGIN'})
         files = queue_files(self.suite)
         self.assertEqual(len(files), 1)
         data = read(files[0])
@@ -111,7 +111,8 @@ class SmtpServerTest(SuiteTestCase):
         self.assertRegex(c.greeting, r'^220 \S+ Velmor Server Suite SMTP Server  \(v2\.0\.49 \[Linux/i386\]\) ready at '
                                      r'\d\d:\d\d:\d\d, \d\d \w{3} - Report problems to \S+$')
         self.assertRegex(c.cmd('EHLO me.example'), r"^250-\S+ Hello me.example, how's life\?$")
-        self.assertEqual([c.line() for _ in range(4)], ['250-PIPELINING', '250-SIZE 10485760', '250-8BITMIME', '250 HELP'])
+        self.assertEqual([c.line() for _ in range(6)], ['250-PIPELINING', '250-SIZE 10485760', '250-8BITMIME', '250-HELP',
+                                                        '250-STARTTLS', '250 AUTH PLAIN LOGIN'])
         self.assertEqual(c.cmd('HELO me.example'), "250 Hello me.example, how's life?")
         self.assertEqual(c.cmd('VERYLONGVERB x'), '500 Bad command - too long')
         self.assertEqual(c.line(), '500 Unknown command:VERYLONGVE')
