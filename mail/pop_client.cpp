@@ -484,18 +484,12 @@ std::vector<PopAccount> pop_accounts_parse(std::string_view text) {
     a.password = std::string(entry.substr(colon + 1, at - colon - 1));
     std::string_view host = entry.substr(at + 1);
     if (std::size_t port_at = host.find(':'); port_at != std::string_view::npos) {
-      std::string_view port = host.substr(port_at + 1);
+      const int port = port_number(host.substr(port_at + 1));
       host = host.substr(0, port_at);
-      unsigned value = 0;
-      bool ok = !port.empty() && port.size() <= 5;
-      for (char ch : port) {
-        ok = ok && ch >= '0' && ch <= '9';
-        if (ok) value = value * 10 + static_cast<unsigned>(ch - '0');
-      }
-      if (!ok || value == 0 || value > 65535) continue;
-      a.port = static_cast<std::uint16_t>(value);
+      if (port == 0) continue;
+      a.port = static_cast<std::uint16_t>(port);
     }
-    if (host.empty()) continue;
+    if (host.empty() || host.find_first_of(" \t") != std::string_view::npos) continue;  // no name holds a blank
     a.host = std::string(host);
     accounts.push_back(std::move(a));
   }

@@ -19,7 +19,7 @@ TEST(PopAccounts, ParseWithoutLoss) {
   const std::string long_user(40, 'u'), long_password(40, 'p');
   auto a = pop_accounts_parse(" -ann:secret@pop.one.example , *bob@site.example:p@ss:w@pop.two.example:1110\r\n" +
                               long_user + ":" + long_password + "@h\n" +
-                              "no-colon@h, :nouser@h, x:y@, x:y@h:0, x:y@h:99999, x:y@h:11o");
+                              "no-colon@h, :nouser@h, x:y@, x:y@h:0, x:y@h:99999, x:y@h:11o, x:y@h\t:110");
   ASSERT_EQ(a.size(), 3u);
   EXPECT_TRUE(a[0].keep);
   EXPECT_EQ(a[0].user, "ann");

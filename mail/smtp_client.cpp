@@ -809,13 +809,9 @@ RelayParse smtp_relay_parse(std::string_view text, SmtpRelay& relay) {
     text.remove_prefix(at + 1);
   }
   if (std::size_t colon = text.find(':'); colon != std::string_view::npos) {
-    std::string_view port = text.substr(colon + 1);
-    unsigned value = 0;
-    if (port.empty() || port.size() > 5 || port.find_first_not_of("0123456789") != std::string_view::npos)
-      return RelayParse::bad;
-    for (char ch : port) value = value * 10 + static_cast<unsigned>(ch - '0');
-    if (value == 0 || value > 65535) return RelayParse::bad;
-    relay.port = static_cast<std::uint16_t>(value);
+    const int port = port_number(text.substr(colon + 1));
+    if (port == 0) return RelayParse::bad;
+    relay.port = static_cast<std::uint16_t>(port);
     text = text.substr(0, colon);
   }
   if (text.empty()) return RelayParse::bad;
