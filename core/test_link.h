@@ -78,7 +78,7 @@ class TestLink final : public ConnectionHost {
 
  private:
   struct Memory final : Transport {
-    explicit Memory(TestLink& l, bool tls = false) : link(l), tls(tls) {}
+    explicit Memory(TestLink& l, bool encrypted = false) : link(l), tls(encrypted) {}
     TestLink& link;
     bool tls;
     Io read(char* to, std::size_t room, std::size_t& got) override;
