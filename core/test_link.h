@@ -13,13 +13,15 @@
 // dialogue goes on in the clear, so a session's STARTTLS can be tested for
 // what it answers, what it forgets and what pipelined input it drops.
 // tls_plan() tells what the last upgrade asked for (a client's host and
-// verification); after refuse_tls() an upgrade fails as a handshake would.
+// verification) and clear_output() what the peer received before it; after
+// refuse_tls() an upgrade fails as a handshake would.
 //
 // After every piece of input the after-pass hooks run (as at the end of a
 // pass of the loop), so work they carry (the mail queue's group commit)
 // happens as in the suite.
 #pragma once
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -68,6 +70,7 @@ class TestLink final : public ConnectionHost {
   int writes() const { return writes_; }
   std::optional<CloseReason> reason() const { return reason_; }
   const std::optional<TlsPlan>& tls_plan() const { return tls_plan_; }
+  std::string_view clear_output() const { return std::string_view(to_peer_).substr(0, clear_end_); }
   void refuse_tls() { refuse_tls_ = true; }
 
   // ConnectionHost
@@ -87,6 +90,7 @@ class TestLink final : public ConnectionHost {
     bool can_upgrade(const TlsPlan&) const override { return !tls; }
     std::unique_ptr<Transport> upgrade(const TlsPlan& plan) override {
       link.tls_plan_ = plan;
+      link.clear_end_ = std::min(link.clear_end_, link.to_peer_.size());
       return link.refuse_tls_ ? nullptr : std::make_unique<Memory>(link, true);
     }
   };
@@ -103,6 +107,7 @@ class TestLink final : public ConnectionHost {
   std::optional<CloseReason> reason_;
   std::optional<TlsPlan> tls_plan_;
   bool refuse_tls_ = false;
+  std::size_t clear_end_ = std::numeric_limits<std::size_t>::max();
   bool touched_ = false;
   std::int64_t due_ = 0;
   std::int64_t now_ms_ = 1'000'000;
