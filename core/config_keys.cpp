@@ -338,10 +338,13 @@ std::string_view config_key_reader(std::string_view key) {
       {"mail.auto.send", "the mail queue: outgoing messages that start a mail transfer (0 = never)"},
       {"mail.from.force", "mail debatch: the sender written into every outgoing file"},
       {"pop.headers", "mail debatch: header lines that name the recipient of fetched mail"},
-      {"pop.hosts", "the POP3 client: the accounts it collects from, read at each collection"},
+      {"pop.hosts", "the POP3 client: the accounts it collects from ([-][pop3s:// or pop3+stls://]user:password@"
+                    "host[:port]; pop3s: TLS from the first byte, port 995; pop3+stls: STLS; a TLS account's "
+                    "server must verify), read at each collection"},
       {"pop.time", "the POP3 client: minutes between collections while the link is up"},
       {"smtp.direct", "mail debatch: domains whose recipients get an outgoing file each"},
-      {"smtp.hosts", "the SMTP client: the relay host outgoing mail goes to, read at each transfer"},
+      {"smtp.hosts", "the SMTP client: the relay host outgoing mail goes to ([user:password@]host[:port]; the "
+                     "login only under STARTTLS with a verified certificate), read at each transfer"},
       {"smtp.time", "the SMTP client: minutes between transfers while the link is up (-1: as soon as there is mail)"},
       {"news.dir.", "start-up makes the folder; news (still to come)"},
       {"news.", "news (still to come)"},

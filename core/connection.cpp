@@ -265,7 +265,7 @@ void Connection::resume_input() {
 
 void Connection::send(std::string_view bytes) {
   if (closed_ || close_pending_ || phase_ == Phase::closing || bytes.empty()) return;
-  if (!out_.empty() && !out_.back().is_file && out_.back().bytes.size() < kChunkJoin) {
+  if (!out_.empty() && !out_.back().is_file && !out_.back().upgrade && out_.back().bytes.size() < kChunkJoin) {
     out_.back().bytes.append(bytes);
   } else {
     out_.emplace_back().bytes.assign(bytes);

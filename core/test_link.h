@@ -12,12 +12,16 @@
 // bytes queued before it are out, the connection counts as secure() and the
 // dialogue goes on in the clear, so a session's STARTTLS can be tested for
 // what it answers, what it forgets and what pipelined input it drops.
+// tls_plan() tells what the last upgrade asked for (a client's host and
+// verification) and clear_output() what the peer received before it; after
+// refuse_tls() an upgrade fails as a handshake would.
 //
 // After every piece of input the after-pass hooks run (as at the end of a
 // pass of the loop), so work they carry (the mail queue's group commit)
 // happens as in the suite.
 #pragma once
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <functional>
@@ -65,6 +69,9 @@ class TestLink final : public ConnectionHost {
   // How many writes the connection made (each one a segment on a socket).
   int writes() const { return writes_; }
   std::optional<CloseReason> reason() const { return reason_; }
+  const std::optional<TlsPlan>& tls_plan() const { return tls_plan_; }
+  std::string_view clear_output() const { return std::string_view(to_peer_).substr(0, clear_end_); }
+  void refuse_tls() { refuse_tls_ = true; }
 
   // ConnectionHost
   void touch(Connection&) override { touched_ = true; }
@@ -81,7 +88,11 @@ class TestLink final : public ConnectionHost {
     Io write(std::span<const std::string_view> parts, std::size_t& put) override;
     bool secure() const override { return tls; }
     bool can_upgrade(const TlsPlan&) const override { return !tls; }
-    std::unique_ptr<Transport> upgrade(const TlsPlan&) override { return std::make_unique<Memory>(link, true); }
+    std::unique_ptr<Transport> upgrade(const TlsPlan& plan) override {
+      link.tls_plan_ = plan;
+      link.clear_end_ = std::min(link.clear_end_, link.to_peer_.size());
+      return link.refuse_tls_ ? nullptr : std::make_unique<Memory>(link, true);
+    }
   };
   void begin(Peer peer);
   void pump();
@@ -94,6 +105,9 @@ class TestLink final : public ConnectionHost {
   bool eof_ = false, reset_ = false;
   int writes_ = 0;
   std::optional<CloseReason> reason_;
+  std::optional<TlsPlan> tls_plan_;
+  bool refuse_tls_ = false;
+  std::size_t clear_end_ = std::numeric_limits<std::size_t>::max();
   bool touched_ = false;
   std::int64_t due_ = 0;
   std::int64_t now_ms_ = 1'000'000;

@@ -515,6 +515,14 @@ int url_port(std::string_view url) {
   return (port >= 1 && port <= 65535) ? static_cast<int>(port) : 0;
 }
 
+int port_number(std::string_view digits) {
+  if (digits.empty() || digits.size() > 5 || digits.find_first_not_of("0123456789") != std::string_view::npos)
+    return 0;
+  int value = 0;
+  for (char ch : digits) value = value * 10 + (ch - '0');
+  return value <= 65535 ? value : 0;
+}
+
 std::string url_path(std::string_view url) {
   url = url.substr(0, url.find_first_of(" \t\r\n"));
   if (!url.empty() && url[0] == '/') return std::string(url);

@@ -62,6 +62,9 @@ int url_scheme_code(std::string_view url);  // http 1, ftp 2, gopher 3, wais/tel
 std::optional<std::string> url_host(std::string_view url);
 // The port after the host's ":" (host order), 0 when none or outside 1-65535.
 int url_port(std::string_view url);
+// A port written as decimal digits alone (host order), 0 when it is not
+// one from 1 to 65535.
+int port_number(std::string_view digits);
 std::string url_path(std::string_view url);
 std::optional<std::string> url_user(std::string_view url);
 std::optional<std::string> url_password(std::string_view url);

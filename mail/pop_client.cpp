@@ -78,7 +78,7 @@ class PopClientSession final : public Session {
   std::uint64_t serial() const { return serial_; }
 
  private:
-  enum class Command { greeting, user, pass, capa, stat, retr, dele, quit };
+  enum class Command { greeting, stls, user, pass, capa, stat, retr, dele, quit };
   enum class Reading {
     reply,         // status lines
     capabilities,  // the lines of a CAPA answer, up to "."
@@ -159,6 +159,11 @@ void PopClientSession::discard_unsettled() {
 
 void PopClientSession::on_open(Connection& c) {
   conn_ = &c;
+  if (account_.tls == PopTls::implicit &&
+      c.start_tls_client(account_.host, TlsVerify::peer) != Connection::TlsStart::started) {
+    c.close_now(CloseReason::tls_failed);
+    return;
+  }
   sent_.emplace_back(Command::greeting, 0);
   trace_ = strprintf("Received: from %s [%s]\r\n\tby %s with POP3 (Velmor %s);\r\n\t", account_.host.c_str(),
                      c.peer().text.c_str(), text_of(config.server_name).c_str(), kVersion);
@@ -169,6 +174,10 @@ void PopClientSession::on_close(Connection&, CloseReason reason) {
   if (reason == CloseReason::lookup_failed || reason == CloseReason::connect_failed) {
     log_message("POP client fail", {}, logfac::pop);
     log_message("POP3 client hostname lookup failed", {}, logfac::house);
+  } else if (reason == CloseReason::tls_failed) {
+    log_message(strprintf("POP client - TLS with %s failed (is its certificate trusted and for that name?); the "
+                          "password is not sent",
+                          account_.host.c_str()));
   } else if (!quit_sent_ && reason != CloseReason::requested) {
     log_message(strprintf("POP client - connection to %s ended (%s) after %u messages", account_.host.c_str(),
                           close_reason_text(reason), fetched_));
@@ -235,6 +244,19 @@ void PopClientSession::reply(Connection& c, std::string_view line) {
         c.close_now();
         return;
       }
+      if (account_.tls == PopTls::stls && !c.secure()) {
+        send(c, Command::stls, "STLS\r\n");
+        break;
+      }
+      send(c, Command::user, "USER " + account_.user + "\r\n");
+      break;
+    case Command::stls:
+      if (!positive || c.start_tls_client(account_.host, TlsVerify::peer) != Connection::TlsStart::started) {
+        log_message(strprintf("POP client - %s refused STLS; the password is not sent", account_.host.c_str()));
+        give_up(c);
+        return;
+      }
+      // Goes out under TLS, once the handshake is done.
       send(c, Command::user, "USER " + account_.user + "\r\n");
       break;
     case Command::user:
@@ -424,6 +446,16 @@ void PopClientSession::pump(Connection& c) {
 
 // ---- accounts ---------------------------------------------------------------
 
+namespace {
+
+constexpr std::uint16_t kPop3sPort = 995;
+// "pop3://" says what no scheme says; a user named like a scheme ("pop3s:"
+// then a password starting "//") is the one line these forms change.
+constexpr std::pair<std::string_view, PopTls> kSchemes[] = {
+    {"pop3s://", PopTls::implicit}, {"pop3+stls://", PopTls::stls}, {"pop3://", PopTls::none}};
+
+}  // namespace
+
 std::vector<PopAccount> pop_accounts_parse(std::string_view text) {
   std::vector<PopAccount> accounts;
   std::size_t pos = 0;
@@ -437,6 +469,14 @@ std::vector<PopAccount> pop_accounts_parse(std::string_view text) {
       if (entry.front() == '-') a.keep = true;
       entry.remove_prefix(1);
     }
+    for (const auto& [scheme, tls] : kSchemes) {
+      if (entry.size() > scheme.size() && str_iequals(entry.substr(0, scheme.size()), scheme)) {
+        a.tls = tls;
+        entry.remove_prefix(scheme.size());
+        break;
+      }
+    }
+    if (a.tls == PopTls::implicit) a.port = kPop3sPort;
     std::size_t colon = entry.find(':');
     std::size_t at = entry.rfind('@');
     if (colon == std::string_view::npos || at == std::string_view::npos || at < colon || colon == 0) continue;
@@ -444,18 +484,12 @@ std::vector<PopAccount> pop_accounts_parse(std::string_view text) {
     a.password = std::string(entry.substr(colon + 1, at - colon - 1));
     std::string_view host = entry.substr(at + 1);
     if (std::size_t port_at = host.find(':'); port_at != std::string_view::npos) {
-      std::string_view port = host.substr(port_at + 1);
+      const int port = port_number(host.substr(port_at + 1));
       host = host.substr(0, port_at);
-      unsigned value = 0;
-      bool ok = !port.empty() && port.size() <= 5;
-      for (char ch : port) {
-        ok = ok && ch >= '0' && ch <= '9';
-        if (ok) value = value * 10 + static_cast<unsigned>(ch - '0');
-      }
-      if (!ok || value == 0 || value > 65535) continue;
-      a.port = static_cast<std::uint16_t>(value);
+      if (port == 0) continue;
+      a.port = static_cast<std::uint16_t>(port);
     }
-    if (host.empty()) continue;
+    if (host.empty() || host.find_first_of(" \t") != std::string_view::npos) continue;  // no name holds a blank
     a.host = std::string(host);
     accounts.push_back(std::move(a));
   }
@@ -466,8 +500,10 @@ std::string pop_accounts_show(const std::vector<PopAccount>& accounts) {
   std::string out;
   for (const PopAccount& a : accounts) {
     out += a.keep ? "-*" : "*";
+    if (a.tls == PopTls::implicit) out += "pop3s://";
+    if (a.tls == PopTls::stls) out += "pop3+stls://";
     out += a.user + ":" + a.password + "@" + a.host;
-    if (a.port != 110) out += ":" + std::to_string(a.port);
+    if (a.port != (a.tls == PopTls::implicit ? kPop3sPort : 110)) out += ":" + std::to_string(a.port);
     out += "\n";
   }
   return out;

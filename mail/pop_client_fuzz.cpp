@@ -2,7 +2,8 @@
 // server sends arbitrary bytes in arbitrary pieces (after a login, when the
 // first byte asks for one). Every command sent is a whole CR LF line, no
 // message is deleted that is not in the queue, every queued file is a whole
-// message, and a connection that ends leaves no half-written file.
+// message, and a connection that ends leaves no half-written file. An
+// account that asks for STLS never sends its login in the clear.
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -66,14 +67,20 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
             "+OK 3 0\r\n" + input;
   server_now = 1700000000;
   std::string sent;
+  const bool stls = (data[0] & 8) != 0;
+  if (stls && (data[0] & 1)) input = "+OK\r\n" + input;  // the answer to STLS
   {
-    TestLink link(pop_client_session(PopAccount{"u", "p", "h.example", 110, (data[0] & 4) != 0}));
+    TestLink link(pop_client_session(
+        PopAccount{"u", "p", "h.example", 110, (data[0] & 4) != 0, stls ? PopTls::stls : PopTls::none}));
+    if (data[0] & 16) link.refuse_tls();
     link.feed(input, piece);
     link.advance(std::chrono::seconds(1));  // a batch waiting for more is committed
     link.finish();
     link.advance(std::chrono::seconds(1));
     check(link.closed());
     sent = link.output();
+    if (stls) check(link.clear_output().find("USER") == std::string_view::npos &&
+                    link.clear_output().find("PASS") == std::string_view::npos);
   }
   check_lines(sent);
   std::size_t files = 0;

@@ -19,7 +19,7 @@ TEST(PopAccounts, ParseWithoutLoss) {
   const std::string long_user(40, 'u'), long_password(40, 'p');
   auto a = pop_accounts_parse(" -ann:secret@pop.one.example , *bob@site.example:p@ss:w@pop.two.example:1110\r\n" +
                               long_user + ":" + long_password + "@h\n" +
-                              "no-colon@h, :nouser@h, x:y@, x:y@h:0, x:y@h:99999, x:y@h:11o");
+                              "no-colon@h, :nouser@h, x:y@, x:y@h:0, x:y@h:99999, x:y@h:11o, x:y@h\t:110");
   ASSERT_EQ(a.size(), 3u);
   EXPECT_TRUE(a[0].keep);
   EXPECT_EQ(a[0].user, "ann");
@@ -36,6 +36,27 @@ TEST(PopAccounts, ParseWithoutLoss) {
   EXPECT_EQ(a[2].password, long_password);
   std::string shown = pop_accounts_show(a);
   EXPECT_EQ(shown.substr(0, shown.find('\n')), "-*ann:secret@pop.one.example");
+  EXPECT_EQ(pop_accounts_show(pop_accounts_parse(shown)), shown);
+}
+
+// The TLS forms: a scheme after the marks, its own default port.
+TEST(PopAccounts, SchemesAskForTls) {
+  auto a = pop_accounts_parse("-POP3S://ann:pw@isp.example, pop3+stls://bob:p:w@isp.example:1110,"
+                              "pop3s://cy:pw@isp.example:110, pop3://dee:pw@isp.example");
+  ASSERT_EQ(a.size(), 4u);
+  EXPECT_TRUE(a[0].keep);
+  EXPECT_EQ(a[0].tls, PopTls::implicit);
+  EXPECT_EQ(a[0].user, "ann");
+  EXPECT_EQ(a[0].port, 995);
+  EXPECT_EQ(a[1].tls, PopTls::stls);
+  EXPECT_EQ(a[1].password, "p:w");
+  EXPECT_EQ(a[1].port, 1110);
+  EXPECT_EQ(a[2].port, 110);
+  EXPECT_EQ(a[3].tls, PopTls::none);
+  EXPECT_EQ(a[3].user, "dee");
+  std::string shown = pop_accounts_show(a);
+  EXPECT_EQ(shown, "-*pop3s://ann:pw@isp.example\n*pop3+stls://bob:p:w@isp.example:1110\n"
+                   "*pop3s://cy:pw@isp.example:110\n*dee:pw@isp.example\n");
   EXPECT_EQ(pop_accounts_show(pop_accounts_parse(shown)), shown);
 }
 
@@ -181,6 +202,35 @@ TEST_F(PopClientTest, RefusalsAndStrayRepliesEndTheConnection) {
   EXPECT_TRUE(third->closed());
   EXPECT_EQ(third->take(), "");
   EXPECT_EQ(queued().size(), 1u);
+}
+
+// A TLS account logs in only once TLS (checked for the account's host) has
+// started: from the first byte, or after STLS; a refusal or a failed
+// handshake ends the connection with no password sent.
+TEST_F(PopClientTest, TlsAccountsLogInOnlyUnderVerifiedTls) {
+  for (PopTls tls : {PopTls::implicit, PopTls::stls}) {
+    TestLink link(pop_client_session(PopAccount{"acct", "secret", "pop.isp.example", 995, false, tls}));
+    ASSERT_EQ(link.tls_plan().has_value(), tls == PopTls::implicit);
+    link.feed("+OK ready\r\n");
+    if (tls == PopTls::stls) {
+      EXPECT_EQ(link.take(), "STLS\r\n");
+      link.feed("+OK begin\r\n+OK stray\r\n");
+    }
+    EXPECT_EQ(link.take(), "USER acct\r\n");
+    EXPECT_TRUE(link.connection().secure());
+    EXPECT_EQ(link.tls_plan()->host, "pop.isp.example");
+    EXPECT_EQ(link.tls_plan()->verify, TlsVerify::peer);
+    link.feed("+OK\r\n");
+    EXPECT_EQ(link.take(), "PASS secret\r\n");
+  }
+  TestLink refused(pop_client_session(PopAccount{"acct", "secret", "h", 110, false, PopTls::stls}));
+  refused.feed("+OK ready\r\n-ERR no TLS here\r\n");
+  EXPECT_EQ(refused.output(), "STLS\r\nQUIT\r\n");
+  TestLink broken(pop_client_session(PopAccount{"acct", "secret", "h", 110, false, PopTls::stls}));
+  broken.refuse_tls();
+  broken.feed("+OK ready\r\n+OK begin\r\n");
+  EXPECT_EQ(broken.reason(), CloseReason::tls_failed);
+  EXPECT_EQ(broken.output(), "STLS\r\n");
 }
 
 TEST_F(PopClientTest, ARunConnectsEachAccountOnceWhileTheLinkIsUp) {

@@ -64,12 +64,37 @@ bool offers(std::string_view reply, std::string_view extension) {
   return false;
 }
 
+// The SASL mechanisms an EHLO reply lists ("AUTH PLAIN LOGIN", or the
+// older "AUTH=LOGIN"), upper-cased.
+std::vector<std::string> auth_mechanisms(std::string_view reply) {
+  std::vector<std::string> found;
+  while (!reply.empty()) {
+    std::string_view line = reply.substr(0, reply.find('\n'));
+    reply.remove_prefix(std::min(reply.size(), line.size() + 1));
+    if (line.size() < 9 || !str_iequals(line.substr(4, 4), "AUTH") || (line[8] != ' ' && line[8] != '=')) continue;
+    line.remove_prefix(9);
+    while (!line.empty()) {
+      std::size_t start = line.find_first_not_of(" =");
+      if (start == std::string_view::npos) break;
+      line.remove_prefix(start);
+      std::string_view word = line.substr(0, line.find_first_of(" ="));
+      line.remove_prefix(word.size());
+      std::string upper(word);
+      for (char& ch : upper) ch = static_cast<char>(std::toupper(static_cast<unsigned char>(ch)));
+      found.push_back(std::move(upper));
+    }
+  }
+  return found;
+}
+
 // ---- routes ------------------------------------------------------------------
 
 struct Route {
   std::string name;  // as the entries write it
   int id = 0;        // the claim of its connection on the entries
   std::vector<std::string> hosts;
+  std::uint16_t port = kSmtpPort;
+  std::string user, password;  // the relay's login (none for mail exchangers)
   std::size_t next_host = 0;
   bool awaiting_mx = false;
   std::uint64_t lookup = 0;
@@ -125,6 +150,7 @@ void end_route(const std::string& key, bool failed) {
 }
 
 void connect_next(const std::string& key);
+bool connect_host(Route& r, const std::string& host, bool plain_only);
 
 // Every message of a route no connection holds goes back to its sender.
 void return_route(const std::string& key, const std::string& text) {
@@ -179,16 +205,20 @@ bool start_route(const std::string& name) {
   r.id = cl.next_id++;
   note_running();
   if (str_iequals(name, "default")) {
-    std::string_view relay = text_of(config.smtp_hosts);
-    std::size_t start = relay.find_first_not_of(" \t,");
-    relay = start == std::string_view::npos ? std::string_view{} : relay.substr(start);
-    relay = relay.substr(0, relay.find_first_of(" \t,\r\n"));
-    if (relay.empty()) {
-      log_message("SMTP client: no relay host (smtp.hosts) for the default route", {}, logfac::smtp);
+    SmtpRelay relay;
+    RelayParse parsed = smtp_relay_parse(text_of(config.smtp_hosts), relay);
+    if (parsed != RelayParse::ok) {
+      if (parsed == RelayParse::none)
+        log_message("SMTP client: no relay host (smtp.hosts) for the default route", {}, logfac::smtp);
+      else
+        log_write("SMTP client: smtp.hosts is not [user:password@]host[:port]; the mail stays queued", logchan::mail);
       end_route(key, true);
       return false;
     }
-    r.hosts = {std::string(relay)};
+    r.hosts = {std::move(relay.host)};
+    r.port = relay.port;
+    r.user = std::move(relay.user);
+    r.password = std::move(relay.password);
     connect_next(key);
   } else {
     r.awaiting_mx = true;
@@ -306,9 +336,17 @@ Load load_message(Message& m, std::string& reason) {
 
 // ---- the session -------------------------------------------------------------
 
+// Where a route's connection goes, and how it may log in there.
+struct Target {
+  std::string host;  // the name connected to: SNI, and checked in the certificate
+  std::string user, password;
+  bool plain_only = false;  // the retry after a failed handshake: no STARTTLS
+};
+
 class SmtpClientSession final : public Session {
  public:
-  SmtpClientSession(std::string route, int id, bool turned) : route_(std::move(route)), id_(id), turned_(turned) {}
+  SmtpClientSession(std::string route, int id, bool turned, Target target = {})
+      : route_(std::move(route)), id_(id), turned_(turned), target_(std::move(target)) {}
 
   void on_open(Connection& c) override {
     if (!turned_)
@@ -318,9 +356,13 @@ class SmtpClientSession final : public Session {
   void on_close(Connection& c, CloseReason reason) override;
 
  private:
-  enum class Step { greeting, ehlo, helo, mail, rcpt, data, dot, rset, quit };
+  enum class Step { greeting, ehlo, helo, starttls, auth, auth_user, auth_password, mail, rcpt, data, dot, rset, quit };
 
   void answer(Connection& c);
+  // After the EHLO (or HELO) reply: STARTTLS, the login, or the first message.
+  void greeted(Connection& c, bool ehlo);
+  // The relay's login cannot go on: no password goes, the mail stays queued.
+  void no_login(Connection& c, std::string_view why);
   void next_message(Connection& c);
   void send_rcpt(Connection& c);
   void send_body(Connection& c);
@@ -336,7 +378,9 @@ class SmtpClientSession final : public Session {
   std::string route_;
   int id_;
   bool turned_;
+  Target target_;
   bool reached_ = false;  // the server greeted us
+  bool failed_ = false;   // ended for a reason a retry soon would not mend
   bool pipelining_ = false;  // MAIL, RCPT and DATA go out together
   bool mail_ok_ = false;     // the transaction's MAIL was taken
   Step step_ = Step::greeting;
@@ -390,14 +434,45 @@ void SmtpClientSession::answer(Connection& c) {
         step_ = Step::helo;
         return;
       }
-      pipelining_ = kind == 2 && offers(reply_.text(), "PIPELINING");
       [[fallthrough]];
     case Step::helo:
       if (kind != 2) {
         quit(c);
         return;
       }
-      next_message(c);
+      greeted(c, step_ == Step::ehlo);
+      return;
+    case Step::starttls:
+      if (reply_.code() == 220 &&
+          c.start_tls_client(target_.host, target_.user.empty() ? TlsVerify::none : TlsVerify::peer) ==
+              Connection::TlsStart::started) {
+        c.send("EHLO " + text_of(config.server_name) + "\r\n");
+        step_ = Step::ehlo;
+      } else if (!target_.user.empty()) {
+        no_login(c, "STARTTLS was refused: " + reply_.text());
+      } else {
+        next_message(c);  // on in plain text, as before
+      }
+      return;
+    case Step::auth_user:
+    case Step::auth_password:
+      if (reply_.code() == 334) {
+        c.send(base64_encode(step_ == Step::auth_user ? target_.user : target_.password) + "\r\n");
+        step_ = step_ == Step::auth_user ? Step::auth_password : Step::auth;
+        return;
+      }
+      [[fallthrough]];
+    case Step::auth:
+      if (reply_.code() == 235) {
+        log_message("SMTP client logged in as: ", target_.user, logfac::smtp);
+        next_message(c);
+        return;
+      }
+      log_write(strprintf("SMTP client: %s refused the login of %s: %s; the mail stays queued",
+                          c.peer().text.c_str(), target_.user.c_str(), reply_.text().c_str()),
+                logchan::mail);
+      failed_ = true;
+      quit(c);
       return;
     case Step::mail:
       mail_ok_ = kind == 2;
@@ -469,6 +544,43 @@ void SmtpClientSession::answer(Connection& c) {
       c.close_after_send();
       return;
   }
+}
+
+void SmtpClientSession::greeted(Connection& c, bool ehlo) {
+  const std::string& text = reply_.text();
+  pipelining_ = ehlo && offers(text, "PIPELINING");
+  if (ehlo && !turned_ && !target_.plain_only && !c.secure() && offers(text, "STARTTLS")) {
+    c.send("STARTTLS\r\n");
+    step_ = Step::starttls;
+    return;
+  }
+  if (target_.user.empty()) {
+    next_message(c);
+    return;
+  }
+  if (!c.secure()) {
+    no_login(c, "it offers no STARTTLS");
+    return;
+  }
+  std::vector<std::string> mechanisms = auth_mechanisms(text);
+  auto has = [&](std::string_view m) { return std::find(mechanisms.begin(), mechanisms.end(), m) != mechanisms.end(); };
+  if (has("PLAIN")) {
+    c.send("AUTH PLAIN " + base64_encode(std::string(1, '\0') + target_.user + '\0' + target_.password) + "\r\n");
+    step_ = Step::auth;
+  } else if (has("LOGIN")) {
+    c.send("AUTH LOGIN\r\n");
+    step_ = Step::auth_user;
+  } else {
+    no_login(c, "it offers neither AUTH PLAIN nor AUTH LOGIN");
+  }
+}
+
+void SmtpClientSession::no_login(Connection& c, std::string_view why) {
+  log_write(strprintf("SMTP client: no login to %s: %.*s; the password is not sent and the mail stays queued",
+                      c.peer().text.c_str(), static_cast<int>(why.size()), why.data()),
+            logchan::mail);
+  failed_ = true;
+  quit(c);
 }
 
 bool SmtpClientSession::refused(Connection& c, std::size_t recipient, std::string_view after) {
@@ -626,14 +738,29 @@ void SmtpClientSession::on_close(Connection& c, CloseReason reason) {
   auto it = cl.routes.find(key);
   if (it == cl.routes.end() || it->second.id != id_) return;
   log_message("SMTP client closing connection: ", close_reason_text(reason), logfac::house);
+  if (reason == CloseReason::tls_failed) {
+    // Without a password at stake, mail goes on in plain text: one new
+    // connection to the same host that does not ask for TLS.
+    if (target_.user.empty() && !target_.plain_only && !quit_flag) {
+      log_write(strprintf("SMTP client: TLS with %s (%s) failed; trying again without it", target_.host.c_str(),
+                          c.peer().text.c_str()),
+                logchan::mail);
+      if (connect_host(it->second, target_.host, true)) return;
+    } else if (!target_.user.empty()) {
+      log_write(strprintf("SMTP client: no login to %s (%s): TLS failed (is its certificate trusted and for that "
+                          "name?); the password is not sent and the mail stays queued",
+                          target_.host.c_str(), c.peer().text.c_str()),
+                logchan::mail);
+    }
+    failed_ = true;
+  }
   // A host that could not be reached, or would not greet: the next one.
-  if (!reached_ && reason != CloseReason::shutdown && !quit_flag &&
+  if (!reached_ && !failed_ && reason != CloseReason::shutdown && !quit_flag &&
       it->second.next_host < it->second.hosts.size()) {
     connect_next(key);
     return;
   }
-  end_route(key, !reached_);
-  (void)c;
+  end_route(key, !reached_ || failed_);
 }
 
 void connect_next(const std::string& key) {
@@ -642,12 +769,17 @@ void connect_next(const std::string& key) {
   if (it == cl.routes.end()) return;
   Route& r = it->second;
   while (r.next_host < r.hosts.size()) {
-    const std::string& host = r.hosts[r.next_host++];
-    log_message("SMTP client connecting to: ", host, logfac::house);
-    if (connect_to(svc::smtp_client, host, kSmtpPort, std::make_unique<SmtpClientSession>(r.name, r.id, false)))
-      return;
+    const std::string host = r.hosts[r.next_host++];
+    if (connect_host(r, host, false)) return;
   }
   end_route(key, true);
+}
+
+bool connect_host(Route& r, const std::string& host, bool plain_only) {
+  log_message("SMTP client connecting to: ", host, logfac::house);
+  Target target{host, r.user, r.password, plain_only};
+  return connect_to(svc::smtp_client, host, r.port,
+                    std::make_unique<SmtpClientSession>(r.name, r.id, false, std::move(target))) != nullptr;
 }
 
 void note_running() {
@@ -661,6 +793,31 @@ void note_running() {
 }
 
 }  // namespace
+
+RelayParse smtp_relay_parse(std::string_view text, SmtpRelay& relay) {
+  relay = SmtpRelay{};
+  std::size_t start = text.find_first_not_of(" \t,\r\n");
+  if (start == std::string_view::npos) return RelayParse::none;
+  text.remove_prefix(start);
+  text = text.substr(0, text.find_first_of(" \t,\r\n"));
+  if (std::size_t at = text.rfind('@'); at != std::string_view::npos) {
+    std::string_view login = text.substr(0, at);
+    std::size_t colon = login.find(':');
+    if (colon == 0 || colon == std::string_view::npos) return RelayParse::bad;
+    relay.user = std::string(login.substr(0, colon));
+    relay.password = std::string(login.substr(colon + 1));
+    text.remove_prefix(at + 1);
+  }
+  if (std::size_t colon = text.find(':'); colon != std::string_view::npos) {
+    const int port = port_number(text.substr(colon + 1));
+    if (port == 0) return RelayParse::bad;
+    relay.port = static_cast<std::uint16_t>(port);
+    text = text.substr(0, colon);
+  }
+  if (text.empty()) return RelayParse::bad;
+  relay.host = std::string(text);
+  return RelayParse::ok;
+}
 
 bool smtp_send_run(bool by_poll) {
   Client& cl = client();
@@ -701,6 +858,11 @@ std::unique_ptr<Session> smtp_turn_session() {
   ++cl.turn_sessions;
   note_running();
   return std::make_unique<SmtpClientSession>("default", cl.next_id++, true);
+}
+
+std::unique_ptr<Session> smtp_client_session(const SmtpRelay& relay) {
+  return std::make_unique<SmtpClientSession>("default", client().next_id++, false,
+                                             Target{relay.host, relay.user, relay.password, false});
 }
 
 void smtp_client_reset() {

@@ -6,16 +6,38 @@
 // overlapping runs never send a message twice. A message leaves the queue
 // only after the server's 2xx to its final dot, or when it was refused for
 // good and has gone back to its sender; a temporary refusal keeps it.
+//
+// TLS: a server that lists STARTTLS in its EHLO reply gets it, and EHLO is
+// said again under TLS. Without credentials the encryption is opportunistic
+// (the certificate is not checked), and a failed handshake is followed by one
+// new plain connection to the same host, so mail keeps flowing to a server
+// whose TLS is broken. A relay given with credentials is logged in to (AUTH
+// PLAIN, else LOGIN) only under TLS with a certificate that verifies against
+// the system's trusted roots: otherwise no password is sent, one line in the
+// mail log says why, and the mail stays queued for a later run.
 #pragma once
 
 #include <cstdint>
 #include <memory>
+#include <string>
+#include <string_view>
 #include <vector>
 
 namespace velmor {
 
 class ByteSource;
 class Session;
+
+// The relay host: the first entry of smtp.hosts, "[user:password@]host[:port]"
+// (entries end at a blank or a comma). The host follows the last '@' and the
+// user ends at the first ':' before it, so a password may hold ':' and '@'.
+struct SmtpRelay {
+  std::string user, password, host;
+  std::uint16_t port = 25;
+  bool login() const { return !user.empty(); }
+};
+enum class RelayParse { ok, none, bad };
+RelayParse smtp_relay_parse(std::string_view text, SmtpRelay& relay);
 
 // Registers service 21, the "smtpkick" hook and the client count.
 void smtp_client_register();
@@ -30,6 +52,9 @@ int smtp_client_count();
 // The client role on a connection a peer opened and handed us by TURN: it
 // waits for the peer's greeting and sends the "default" route's mail.
 std::unique_ptr<Session> smtp_turn_session();
+// The session of the default route's connection to `relay`, outside any run
+// (tests drive it over a TestLink).
+std::unique_ptr<Session> smtp_client_session(const SmtpRelay& relay);
 // Where the lines holding only "." start in bytes [from, to) of a stored
 // message (each goes out with another "." in front, so no file can end its
 // message early). `whole` is false when the source could not be read.

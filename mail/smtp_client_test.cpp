@@ -11,6 +11,7 @@
 
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/util.h"
 #include "mail/queue_test_fixture.h"
 #include "mail/smtp_reply.h"
 #include "mail/smtp_server.h"
@@ -335,6 +336,97 @@ TEST_F(SmtpClientTest, TurnHandsTheQueueToAllowedPeersOnly) {
   link.feed("250 hi\r\n");
   EXPECT_EQ(link.take(), "MAIL FROM:<ann@site.example>\r\n");
   EXPECT_EQ(smtp_client_count(), 1);
+}
+
+// smtp.hosts as it always was (a host) still names the relay; a login
+// splits at the last '@' and the first ':' before it.
+TEST(SmtpRelay, ParsesOldAndLoginForms) {
+  SmtpRelay r;
+  ASSERT_EQ(smtp_relay_parse(" relay.example, other", r), RelayParse::ok);
+  EXPECT_EQ(r.host, "relay.example");
+  EXPECT_EQ(r.port, 25);
+  EXPECT_FALSE(r.login());
+  ASSERT_EQ(smtp_relay_parse("ann@site:p@ss:w@relay.example:587", r), RelayParse::ok);
+  EXPECT_EQ(r.user, "ann@site");
+  EXPECT_EQ(r.password, "p@ss:w");
+  EXPECT_EQ(r.host, "relay.example");
+  EXPECT_EQ(r.port, 587);
+  EXPECT_EQ(smtp_relay_parse(" \t", r), RelayParse::none);
+  for (const char* bad : {"ann@relay", ":pw@relay", "a:b@", "relay:0", "relay:65536", "relay:2x", "relay:"})
+    EXPECT_EQ(smtp_relay_parse(bad, r), RelayParse::bad) << bad;
+}
+
+// The password goes only after STARTTLS, to a certificate checked for the
+// relay's name, and only by PLAIN or LOGIN; anything else ends the
+// connection with the mail queued and nothing sent back to its sender.
+TEST_F(SmtpClientTest, TheRelayLoginGoesOnlyUnderVerifiedTls) {
+  const std::string text = message("bob@far.example");
+  std::string path = queue("1", text);
+  const SmtpRelay relay{"ann", "p@ss:w", "relay.example", 587};
+  auto start = [&](std::string_view ehlo) {
+    auto link = std::make_unique<TestLink>(smtp_client_session(relay));
+    link->feed("220 there\r\n");
+    EXPECT_EQ(link->take(), "EHLO here.example\r\n");
+    link->feed(ehlo);
+    return link;
+  };
+  auto secured = [&](std::string_view ehlo) {
+    auto link = start("250-hi\r\n250-STARTTLS\r\n250 SIZE\r\n");
+    EXPECT_EQ(link->take(), "STARTTLS\r\n");
+    link->feed("220 go ahead\r\n");
+    EXPECT_EQ(link->take(), "EHLO here.example\r\n");
+    EXPECT_TRUE(link->connection().secure());
+    EXPECT_EQ(link->tls_plan()->host, "relay.example");
+    EXPECT_EQ(link->tls_plan()->verify, TlsVerify::peer);
+    link->feed(ehlo);
+    return link;
+  };
+  {
+    auto link = secured("250-hi\r\n250-AUTH LOGIN PLAIN\r\n250 PIPELINING\r\n");
+    EXPECT_EQ(link->take(), "AUTH PLAIN " + base64_encode(std::string("\0ann\0p@ss:w", 11)) + "\r\n");
+    link->feed("235 welcome\r\n");
+    EXPECT_EQ(link->take(), "MAIL FROM:<ann@site.example>\r\nRCPT TO:<bob@far.example>\r\nDATA\r\n");
+  }
+  {
+    auto link = secured("250-hi\r\n250 AUTH=LOGIN\r\n");
+    EXPECT_EQ(link->take(), "AUTH LOGIN\r\n");
+    link->feed("334 VXNlcm5hbWU6\r\n");
+    EXPECT_EQ(link->take(), base64_encode("ann") + "\r\n");
+    link->feed("334 UGFzc3dvcmQ6\r\n");
+    EXPECT_EQ(link->take(), base64_encode("p@ss:w") + "\r\n");
+    link->feed("535 bad credentials\r\n");
+    EXPECT_EQ(link->take(), "QUIT\r\n");
+  }
+  // STARTTLS refused, no usable mechanism (no STARTTLS at all and a failed
+  // handshake are shown against real servers end to end).
+  auto refused = start("250-hi\r\n250 STARTTLS\r\n");
+  refused->feed("454 not now\r\n");
+  EXPECT_EQ(refused->output(), "EHLO here.example\r\nSTARTTLS\r\nQUIT\r\n");
+  auto strange = secured("250-hi\r\n250 AUTH CRAM-MD5\r\n");
+  EXPECT_EQ(strange->take(), "QUIT\r\n");
+  EXPECT_EQ(read_file(path), text);
+  EXPECT_TRUE(error_mails().empty());
+}
+
+// Without a login, STARTTLS is taken when offered, unverified (as an MX
+// would need), and mail still goes when the server will not start it.
+TEST_F(SmtpClientTest, WithoutALoginTlsIsOpportunistic) {
+  queue("1", message("bob@far.example"));
+  const SmtpRelay relay{"", "", "mx.far.example", 25};
+  {
+    TestLink refused(smtp_client_session(relay));
+    refused.feed("220 there\r\n250-hi\r\n250 STARTTLS\r\n454 no\r\n");
+    EXPECT_EQ(refused.take(), "EHLO here.example\r\nSTARTTLS\r\nMAIL FROM:<ann@site.example>\r\n");
+    EXPECT_FALSE(refused.tls_plan().has_value());
+    refused.vanish();
+  }
+  TestLink link(smtp_client_session(relay));
+  link.feed("220 there\r\n250-hi\r\n250 STARTTLS\r\n220 go\r\nstray bytes\r\n");
+  EXPECT_EQ(link.take(), "EHLO here.example\r\nSTARTTLS\r\nEHLO here.example\r\n");
+  EXPECT_EQ(link.tls_plan()->host, "mx.far.example");
+  EXPECT_EQ(link.tls_plan()->verify, TlsVerify::none);
+  link.feed("250 hi\r\n");
+  EXPECT_EQ(link.take(), "MAIL FROM:<ann@site.example>\r\n");
 }
 
 TEST(SmtpReply, ContinuationLinesKeepTheirCode) {

@@ -1,7 +1,7 @@
 # Sourced by demo.sh and test.sh: the Debian packages that building and
 # testing Velmor need, in one list. Add a package here when a test starts to
 # use a new client.
-VELMOR_PACKAGES="build-essential cmake ninja-build ccache clang libclang-rt-14-dev googletest libgtest-dev libgmock-dev python3 curl swaks libnet-ssleay-perl openssl fetchmail dovecot-pop3d dnsmasq-base bind9-dnsutils util-linux postfix isync offlineimap3 neomutt tmux"
+VELMOR_PACKAGES="build-essential cmake ninja-build ccache clang libclang-rt-14-dev googletest libgtest-dev libgmock-dev libssl-dev python3 curl swaks libnet-ssleay-perl openssl fetchmail dovecot-pop3d dnsmasq-base bind9-dnsutils util-linux postfix isync offlineimap3 neomutt tmux"
 
 # Installs whatever in the list is missing (as root, or through sudo).
 velmor_install_deps() {
