@@ -166,16 +166,36 @@ class Suite:
         """Starts the daemon and waits until it is ready: the pid file names
         it (written after the listeners are open) and, when velmorctl is built,
         the control channel answers "test"."""
-        self.spawn()
-        deadline = time.monotonic() + timeout
-        while time.monotonic() < deadline:
-            if self.proc.poll() is not None:
-                raise RuntimeError('velmor exited with %d:\n%s' % (self.proc.returncode, self.output()))
-            if self._pid_file_is_ours() and self._answers():
-                return self
-            time.sleep(0.05)
-        self.kill()
-        raise RuntimeError('velmor did not become ready:\n' + self.output())
+        for attempt in range(3):
+            seen = len(self.output())
+            self.spawn()
+            deadline = time.monotonic() + timeout
+            while time.monotonic() < deadline:
+                if self.proc.poll() is not None:
+                    # A free port is only free until somebody takes it: another
+                    # test running beside this one may have, so choose again.
+                    if attempt < 2 and 'Address already in use' in self.output()[seen:]:
+                        self._choose_ports_again()
+                        break
+                    raise RuntimeError('velmor exited with %d:\n%s' % (self.proc.returncode, self.output()))
+                if self._pid_file_is_ours() and self._answers():
+                    return self
+                time.sleep(0.05)
+            else:
+                self.kill()
+                raise RuntimeError('velmor did not become ready:\n' + self.output())
+        raise RuntimeError('velmor found no free ports:\n' + self.output())
+
+    def _choose_ports_again(self):
+        master = self.path('config/master')
+        with open(master, encoding='utf-8', errors='surrogateescape') as f:
+            text = f.read()
+        values = {}
+        for name, port in self.ports.items():
+            if re.search(r'(?m)^%%%s\.sock\.port\s*:\s*%d\s*$' % (re.escape(name), port), text):
+                self.ports[name] = free_port()
+                values['%s.sock.port' % name] = str(self.ports[name])
+        set_keys(master, values)
 
     def _pid_file_is_ours(self):
         # A file left by a killed suite names another process until it is replaced.
