@@ -18,6 +18,7 @@ import signal
 import socket
 import subprocess
 import tempfile
+import threading
 import time
 import unittest
 
@@ -93,6 +94,48 @@ def set_keys(path, values):
     out.extend('%%%s: %s' % (k, v) for k, v in wanted.values())
     with open(path, 'w', encoding='utf-8', errors='surrogateescape') as f:
         f.write('\n'.join(out) + '\n')
+
+
+class FakeServer:
+    """A TCP server of a test's own, in a thread: each connection it accepts
+    on `address` (a free port of 127.0.0.1 unless given) goes to
+    session(conn) in turn, with a 10-s time-out, and is closed after it; a
+    connection that breaks ends its session quietly. Subclasses set their
+    fields before calling this constructor, which starts serving."""
+
+    def __init__(self, address=('127.0.0.1', 0)):
+        self.sock = socket.socket()
+        self.sock.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
+        self.sock.bind(address)
+        self.sock.listen(8)
+        self.sock.settimeout(0.2)
+        self.port = self.sock.getsockname()[1]
+        self._stop = False
+        self._thread = threading.Thread(target=self._serve, daemon=True)
+        self._thread.start()
+
+    def _serve(self):
+        while not self._stop:
+            try:
+                conn, _ = self.sock.accept()
+            except socket.timeout:
+                continue
+            except OSError:
+                return
+            with conn:
+                conn.settimeout(10)
+                try:
+                    self.session(conn)
+                except (OSError, EOFError):  # ssl.SSLError is an OSError
+                    pass
+
+    def session(self, conn):
+        raise NotImplementedError
+
+    def close(self):
+        self._stop = True
+        self._thread.join(5)
+        self.sock.close()
 
 
 class Suite:

@@ -9,13 +9,12 @@ import random
 import re
 import socket
 import subprocess
-import threading
 import unittest
 
 import dovecot
 from dns_server import NameServer, response, test_address
 from fake_modem import FakeModem
-from harness import Suite, VELMOR_BIN, wait_for as wait_briefly
+from harness import FakeServer, Suite, VELMOR_BIN, wait_for as wait_briefly
 
 RUNNING, ENDED = 0x400, 16  # status bits: a POP3 client runs / a run ended
 
@@ -53,7 +52,7 @@ def fetched_message(path):
     return text[text.index(b'\r\n', date_at) + 2:]
 
 
-class PopServer:
+class PopServer(FakeServer):
     """A POP3 server on 127.0.0.1 for one account. `messages` is a list of
     (bytes, how): how is 'ok' ("+OK n octets"), 'bare' ("+OK" alone),
     'wrong' (a size far too small), 'err' (RETR refused) or 'drop' (the
@@ -64,33 +63,9 @@ class PopServer:
         self.messages = list(messages)
         self.pipelining = pipelining
         self.commands = []
-        self.sock = socket.socket()
-        self.sock.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
-        self.sock.bind(('127.0.0.1', 0))
-        self.sock.listen(8)
-        self.port = self.sock.getsockname()[1]
-        self.sock.settimeout(0.2)
-        self._stop = False
-        self._thread = threading.Thread(target=self._serve, daemon=True)
-        self._thread.start()
+        super().__init__()
 
-    def _serve(self):
-        while not self._stop:
-            try:
-                conn, _ = self.sock.accept()
-            except socket.timeout:
-                continue
-            except OSError:
-                return
-            try:
-                self._session(conn)
-            except OSError:
-                pass
-            finally:
-                conn.close()
-
-    def _session(self, conn):
-        conn.settimeout(10)
+    def session(self, conn):
         f = conn.makefile('rb')
         conn.sendall(b'+OK test server ready\r\n')
         deleted = set()
@@ -129,11 +104,6 @@ class PopServer:
                 return
             else:
                 conn.sendall(b'-ERR unknown\r\n')
-
-    def close(self):
-        self._stop = True
-        self._thread.join(5)
-        self.sock.close()
 
 
 def answer_all(query):

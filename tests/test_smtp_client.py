@@ -9,12 +9,11 @@ import signal
 import socket
 import subprocess
 import tempfile
-import threading
 import time
 import unittest
 
 from dns_server import NameServer, response, rr, test_address
-from harness import Suite, wait_for
+from harness import FakeServer, Suite, wait_for
 
 LINK = 0x10000
 SINK = shutil.which('smtp-sink') or '/usr/sbin/smtp-sink'
@@ -245,43 +244,19 @@ class SmtpClientTest(unittest.TestCase):
         self.assertIn(b'The domain nxd.test does not exist.', mails[0])
 
 
-class ScriptedServer:
+class ScriptedServer(FakeServer):
     """An SMTP server on port 25 of `address` that runs `script(conn)` for
     each connection it accepts."""
 
     def __init__(self, address, script):
-        self.sock = socket.socket()
-        self.sock.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
-        self.sock.bind((address, 25))
-        self.sock.listen(5)
-        self.sock.settimeout(0.2)
         self.script = script
         self.connections = 0
-        self.stop = False
-        self.thread = threading.Thread(target=self.serve, daemon=True)
-        self.thread.start()
+        super().__init__((address, 25))
 
-    def serve(self):
-        while not self.stop:
-            try:
-                conn, _ = self.sock.accept()
-            except socket.timeout:
-                continue
-            except OSError:
-                return
-            self.connections += 1
-            with conn:
-                conn.settimeout(10)
-                conn.setsockopt(socket.IPPROTO_TCP, socket.TCP_NODELAY, 1)
-                try:
-                    self.script(Peer(conn))
-                except (OSError, EOFError):
-                    pass
-
-    def close(self):
-        self.stop = True
-        self.thread.join(5)
-        self.sock.close()
+    def session(self, conn):
+        self.connections += 1
+        conn.setsockopt(socket.IPPROTO_TCP, socket.TCP_NODELAY, 1)
+        self.script(Peer(conn))
 
 
 class Peer:

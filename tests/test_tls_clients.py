@@ -12,12 +12,11 @@ import socket
 import ssl
 import subprocess
 import tempfile
-import threading
 import unittest
 
 import dovecot
 from dns_server import NameServer, response, test_address
-from harness import Suite, set_keys, wait_for
+from harness import FakeServer, Suite, set_keys, wait_for
 
 POSTFIX = shutil.which('postfix') or '/usr/sbin/postfix'
 FACILITIES = ('house', 'smtp', 'pop', 'imap', 'maildebatch', 'newsfetch', 'newsserver', 'newsdebatch', 'web',
@@ -42,7 +41,7 @@ def queue_text(n):
             'Subject: tls %d\r\n\r\nbody %d\r\n.\r\n' % (n, n)).encode()
 
 
-class Recorder:
+class Recorder(FakeServer):
     """An SMTP server on 127.0.0.1 that greets, lists `ehlo` extensions,
     answers STARTTLS with `starttls` ('garbage': a broken handshake the
     first time; an SSLContext: real TLS with its certificate), takes mail,
@@ -50,31 +49,12 @@ class Recorder:
 
     def __init__(self, ehlo, starttls=None):
         self.ehlo, self.starttls = ehlo, starttls
-        self.sock = socket.socket()
-        self.sock.bind(('127.0.0.1', 0))
-        self.sock.listen(8)
-        self.port = self.sock.getsockname()[1]
         self.connections, self.delivered = [], 0
-        self.done = False
-        threading.Thread(target=self._serve, daemon=True).start()
+        super().__init__()
 
-    def _serve(self):
-        while not self.done:
-            try:
-                conn, _ = self.sock.accept()
-            except OSError:
-                return
-            got = []
-            self.connections.append(got)
-            try:
-                self._session(conn, got)
-            except (OSError, ssl.SSLError):
-                pass
-            finally:
-                conn.close()
-
-    def _session(self, conn, got):
-        conn.settimeout(10)
+    def session(self, conn):
+        got = []
+        self.connections.append(got)
         f = conn.makefile('rb')
         conn.sendall(b'220 recorder\r\n')
         in_data = False
@@ -109,10 +89,6 @@ class Recorder:
 
     def received(self):
         return b''.join(b''.join(c) for c in self.connections)
-
-    def close(self):
-        self.done = True
-        self.sock.close()
 
 
 class TlsClientCase(unittest.TestCase):
