@@ -28,12 +28,6 @@ struct SuiteHooks {
   std::function<void()> maildebatch;   // debatch one incoming file now
   std::function<void()> newsdebatch;
 
-  // Work a subsystem has in hand between ticks, run for a short slice after
-  // each dispatcher pass; true while more remains, so the next pass does
-  // not wait for the tick. Called once more when quit_flag is set, to
-  // settle what it holds.
-  std::function<bool()> background;
-
   // Control channel.
   std::function<int()> reload_users;
   std::function<int()> reload_groups;

@@ -24,6 +24,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/background.h"
 #include "core/commands.h"
 #include "core/config.h"
 #include "core/control.h"
@@ -478,10 +479,10 @@ void poll() {
       tick();
     }
     busy = false;
-    if (hooks.background && !quit_flag) guarded_poll("background", [&busy] { busy = hooks.background(); });
+    if (!quit_flag) guarded_poll("background", [&busy] { busy = background_round(); });
   }
   // Told that the suite stops, background work settles what it holds.
-  if (hooks.background) guarded_poll("background", [] { hooks.background(); });
+  guarded_poll("background", [] { background_settle(); });
   progress_code = 0;
 }
 

@@ -19,6 +19,7 @@
 #include <memory>
 #include <set>
 
+#include "core/background.h"
 #include "core/config.h"
 #include "core/globals.h"
 #include "core/hooks.h"
@@ -542,6 +543,7 @@ void debatch_settle() {
 }
 
 bool g_commit_due = false;  // a slice wrote local copies; its commit runs in the next pass
+BackgroundWork g_mail_work;  // debatch slices and mailbox upkeep between passes
 
 DebatchStep step_in_slice(Clock::time_point deadline, bool settle);
 
@@ -635,7 +637,7 @@ int mail_init() {
     queue_scan_incoming();
   };
   hooks.maildebatch = [] { mail_debatch_one(); };
-  hooks.background = mail_background;
+  g_mail_work = BackgroundWork("mail", mail_background);
   hooks.list_mail_queue = queue_list;
   hooks.outgoing_mail_count = [] { return queue_outgoing().size(); };
   hooks.incoming_mail_count = [] {
