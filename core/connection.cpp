@@ -388,6 +388,31 @@ void Connection::note_fullness() {
   if (partner_ && !partner_->closed_) host_.touch(*partner_);
 }
 
+// The stage for `raw` with each line of a lone "." (a dot, then CR or LF)
+// doubled; a line's first "." at the end of `raw` is settled by the next.
+void Connection::stuff_lone_dots(OutItem& item, std::string_view raw) {
+  std::string& out = item.stage;
+  out.clear();
+  out.reserve(raw.size() + 8);
+  auto line_end = [](char ch) { return ch == '\r' || ch == '\n'; };
+  if (item.dot_ahead && line_end(raw.front())) out += '.';
+  std::size_t copied = 0;
+  auto next_line = [&raw](std::size_t from) {
+    std::size_t lf = raw.find('\n', from);
+    return lf == std::string_view::npos ? raw.size() : lf + 1;
+  };
+  for (std::size_t at = item.line_start ? 0 : next_line(0); at < raw.size(); at = next_line(at)) {
+    if (raw[at] == '.' && at + 1 < raw.size() && line_end(raw[at + 1])) {
+      out.append(raw.substr(copied, at + 1 - copied));
+      out += '.';
+      copied = at + 1;
+    }
+  }
+  out.append(raw.substr(copied));
+  item.dot_ahead = raw.back() == '.' && (raw.size() > 1 ? raw[raw.size() - 2] == '\n' : item.line_start);
+  item.line_start = raw.back() == '\n';
+}
+
 // Reads the next part of a file range into its stage, transformed.
 bool Connection::fill_stage(OutItem& item) {
   FileRange& f = item.file;
@@ -403,6 +428,8 @@ bool Connection::fill_stage(OutItem& item) {
   item.done = 0;
   if (f.transform == FileRange::Transform::none) {
     item.stage = std::move(raw);
+  } else if (f.transform == FileRange::Transform::stuff_lone_dots) {
+    stuff_lone_dots(item, raw);
   } else {
     item.stage.clear();
     item.stage.reserve(raw.size() + raw.size() / 32);

@@ -157,6 +157,9 @@ struct FileRange {
     none,
     dot_stuff,    // a line that starts with "." gets another one in front
     dot_unstuff,  // a line that starts with "." loses it (transmission form to plain)
+    // Text already in transmission form whose line of a lone "." would end
+    // it early (a damaged file): that line alone gets another dot.
+    stuff_lone_dots,
   };
   std::shared_ptr<const UniqueFd> file{};
   std::uint64_t offset = 0;
@@ -312,6 +315,7 @@ class Connection {
     std::size_t done = 0;   // of `bytes`, or of `stage`
     std::string stage;      // the file's next bytes, transformed
     bool line_start = true; // the transform's position
+    bool dot_ahead = false; // stuff_lone_dots: the stage ended in a line's first "."
   };
 
   bool gate_open() const;
@@ -323,6 +327,7 @@ class Connection {
   void swallow_lf();
   void note_line();
   bool fill_stage(OutItem& item);
+  static void stuff_lone_dots(OutItem& item, std::string_view raw);
   void flush();
   void read_some();
   void deliver();

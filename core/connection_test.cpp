@@ -156,21 +156,26 @@ TEST_F(OutputQueue, APipeliningClientThatDoesNotReadCostsBoundedMemory) {
 TEST_F(OutputQueue, FileRangesLargerThanTheBufferWithTheirTransforms) {
   testing_files::ScratchDir dir;
   const std::string path = (dir.path() / "f").string();
+  // A lone "." line whose dot ends the first 64 KB read and whose line end
+  // begins the next one.
   std::string text;
-  for (int i = 0; text.size() < 300000; ++i) text += (i % 3 ? "line " : ".dot ") + std::to_string(i) + "\r\n";
+  while (text.size() < 65535) text += "p\r\n";
+  for (int i = 0; text.size() < 300000; ++i) text += i % 5 == 0 ? ".\r\n" : (i % 3 ? "line " : ".dot ") + std::to_string(i) + "\r\n";
   testing_files::write_file(path, text);
   auto file = std::make_shared<const UniqueFd>(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  std::string stuffed, unstuffed;
+  std::string stuffed, unstuffed, lone_stuffed;
   for (std::size_t at = 0; at < text.size();) {
     std::size_t end = text.find('\n', at) + 1;
     std::string line = text.substr(at, end - at);
     stuffed += (line[0] == '.' ? "." : "") + line;
     unstuffed += line[0] == '.' ? line.substr(1) : line;
+    lone_stuffed += (line == ".\r\n" ? "." : "") + line;
     at = end;
   }
   for (auto [transform, expected] : {std::pair{FileRange::Transform::none, text},
                                      {FileRange::Transform::dot_stuff, stuffed},
-                                     {FileRange::Transform::dot_unstuff, unstuffed}}) {
+                                     {FileRange::Transform::dot_unstuff, unstuffed},
+                                     {FileRange::Transform::stuff_lone_dots, lone_stuffed}}) {
     open();
     link->peer_window(1000);  // a slow reader: the stage refills many times
     Connection& c = link->connection();

@@ -1368,7 +1368,15 @@ bool mailbox_share(Mailbox& box, std::uint64_t owner, std::function<void()> chan
   return true;
 }
 
+bool mailbox_share_pop(Mailbox& box, std::uint64_t owner) {
+  if (box.pop_holder != 0 && box.pop_holder != owner) return false;
+  if (!mailbox_share(box, owner, nullptr)) return false;
+  box.pop_holder = owner;
+  return true;
+}
+
 void mailbox_release(Mailbox& box, std::uint64_t owner) {
+  if (box.pop_holder == owner) box.pop_holder = 0;
   if (!box.sharers.empty()) {
     std::erase_if(box.sharers, [owner](const Mailbox::Sharer& s) { return s.owner == owner; });
     if (box.sharers.empty()) box.flags &= ~boxflag::in_use;

@@ -92,8 +92,10 @@ struct Mailbox {
   std::string home;
   std::uint32_t flags = 0;
   std::uint64_t in_use_by = 0;  // Connection::id() of the in-use mark's holder; 0 = none
-  // IMAP sessions share a mailbox among themselves (the in-use mark is then
-  // set with in_use_by 0, so POP3 and web mail stay out); each is told when
+  // The POP3 session among the sharers (one at a time: RFC 1939's lock); 0 = none.
+  std::uint64_t pop_holder = 0;
+  // IMAP sessions and one POP3 session share a mailbox (the in-use mark is
+  // then set with in_use_by 0, so web mail stays out); each is told when
   // the mailbox changes under it (new mail, flags, an expunge), so that its
   // own view of the mailbox can catch up.
   struct Sharer {
@@ -153,16 +155,20 @@ Mailbox* mailbox_lookup(const std::string& path);
 // The mailbox file opened for reading the safe way; an empty descriptor
 // when it is missing or refused.
 UniqueFd mailbox_open(const Mailbox& box);
-// The in-use mark shared by POP3, IMAP and web mail: true when taken (or
-// already held by `owner`). The owner is a connection's never-reused id, so
+// The exclusive in-use mark (web mail): true when taken (or already held
+// by `owner`), never while sessions share the mailbox. The owner is a connection's never-reused id, so
 // a mark can never pass to a later connection on the same descriptor.
 bool mailbox_take(Mailbox& box, std::uint64_t owner);
 void mailbox_release(Mailbox& box, std::uint64_t owner);
-// The shared form for IMAP sessions: any number of them hold a mailbox at
+// The shared form for IMAP (and POP3) sessions: any number of them hold a mailbox at
 // once, never together with an exclusive holder. `changed` is called (it
 // must only take note) whenever the mailbox changes. mailbox_release lets
 // go of either form.
 bool mailbox_share(Mailbox& box, std::uint64_t owner, std::function<void()> changed);
+// A POP3 session's hold: shared with IMAP sessions (it hears no changes:
+// it works on the messages present when it took the mailbox), but one POP3
+// session at a time. mailbox_release lets go of it.
+bool mailbox_share_pop(Mailbox& box, std::uint64_t owner);
 // Tells every sharer that the mailbox changed.
 void mailbox_notify(Mailbox& box);
 // Drops the cached mailbox `path` and every one in a folder of that path

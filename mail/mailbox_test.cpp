@@ -361,7 +361,7 @@ TEST_F(TempDir, ExpungeSyncsTheNewMailboxBeforeItReplacesTheOld) {
   EXPECT_EQ(sysio::count(sysio::Op::sync), 4u);  // the new mailbox and its folder, the overview and its folder
 }
 
-TEST_F(TempDir, InUseMarkBelongsToOneSession) {
+TEST_F(TempDir, InUseMarksExclusiveOrSharedWithOnePop3Session) {
   write_file(inbox(), message("a@x", "Subject: one\r\n", "1\r\n"));
   Mailbox* box = mailbox_lookup(inbox());
   EXPECT_TRUE(mailbox_take(*box, 7));
@@ -369,8 +369,20 @@ TEST_F(TempDir, InUseMarkBelongsToOneSession) {
   EXPECT_FALSE(mailbox_take(*box, 8));
   mailbox_release(*box, 8);  // not the holder: no effect
   EXPECT_FALSE(mailbox_take(*box, 8));
+  EXPECT_FALSE(mailbox_share(*box, 8, nullptr));
+  EXPECT_FALSE(mailbox_share_pop(*box, 8));
   mailbox_release(*box, 7);
-  EXPECT_TRUE(mailbox_take(*box, 8));
+  // IMAP sessions and one POP3 session at a time share it; the exclusive
+  // mark waits for all of them.
+  EXPECT_TRUE(mailbox_share(*box, 1, nullptr));
+  EXPECT_TRUE(mailbox_share_pop(*box, 2));
+  EXPECT_FALSE(mailbox_share_pop(*box, 3));
+  EXPECT_TRUE(mailbox_share(*box, 4, nullptr));
+  EXPECT_FALSE(mailbox_take(*box, 5));
+  mailbox_release(*box, 2);
+  EXPECT_TRUE(mailbox_share_pop(*box, 3));
+  for (std::uint64_t owner : {1, 3, 4}) mailbox_release(*box, owner);
+  EXPECT_TRUE(mailbox_take(*box, 5));
 }
 
 }  // namespace

@@ -49,14 +49,6 @@ bool starts_status(std::string_view line) {
   return str_istarts_with(line, "Status:") || str_istarts_with(line, "X-Status:");
 }
 
-// The stored message ends with its "." line; one that lost it (a damaged
-// file) gets one, so the client never waits for an end that never comes.
-std::string missing_terminator(const std::string& tail) {
-  if (tail.size() == 5 && (tail == "\r\n.\r\n" || tail.substr(2) == "\n.\n")) return {};
-  if (!tail.empty() && tail.back() == '\n') return ".\r\n";
-  return "\r\n.\r\n";
-}
-
 class PopSession final : public Session {
  public:
   void on_open(Connection& c) override;
@@ -75,6 +67,15 @@ class PopSession final : public Session {
   struct Range {
     std::uint64_t offset = 0, length = 0;
   };
+  // A message as it was when the session took the mailbox. The session
+  // keeps that file open, so its numbers, offsets and bytes stay valid
+  // whatever other sessions expunge meanwhile.
+  struct Entry {
+    std::uint64_t offset = 0;        // of its separator line
+    std::uint64_t total_length = 0;  // with the separator line
+    std::uint64_t length = 0;        // without it
+    std::uint32_t uid = 0;
+  };
 
   // Runs one line; false when the rest of the input is to be thrown away.
   bool command(Connection& c, std::string_view line);
@@ -89,14 +90,13 @@ class PopSession final : public Session {
   void top(Connection& c, std::string_view args);
   void quit(Connection& c);
   void list_more(Connection& c);
-  void send_ranges(Connection& c, const std::vector<Range>& ranges, const std::string& trailer);
+  void send_ranges(Connection& c, const std::vector<Range>& ranges, std::uint64_t end);
 
-  void sync_index();
-  bool visible(std::size_t i) const { return !deleted_[i] && !(index_[i]->flags & msgflag::deleted); }
+  void take_snapshot();
   std::optional<std::size_t> message_number(std::string_view arg, bool include_deleted = false) const;
   void totals(std::size_t& count, std::uint64_t& octets) const;
-  std::string message_tail(std::size_t i) const;
-  bool message_readable(std::size_t i) const;
+  std::uint64_t text_start(std::size_t i) const { return index_[i].offset + index_[i].total_length - index_[i].length; }
+  std::optional<std::uint64_t> text_end(std::size_t i) const;
   void drop_mailbox(Connection& c);
 
   State state_ = State::authorization;
@@ -109,8 +109,7 @@ class PopSession final : public Session {
   // This session's deletions, by message number - 1; nobody else sees them
   // until QUIT applies them.
   std::vector<char> deleted_;
-  std::vector<MessageRecord*> index_;
-  std::vector<std::uint64_t> offsets_;
+  std::vector<Entry> index_;
   Listing listing_ = Listing::none;
   std::size_t list_next_ = 0;
 };
@@ -145,24 +144,19 @@ void PopSession::on_timer(Connection& c) {
   c.resume_input();
 }
 
-// The message list as the session sees it: numbered from 1 in mailbox
-// order; messages delivered meanwhile join at the end.
-void PopSession::sync_index() {
-  if (!box_ || !file_) {
-    index_.clear();
-    offsets_.clear();
-    return;
-  }
-  if (index_.size() == box_->messages.size()) return;
+// The messages present now, numbered from 1 in mailbox order, are the
+// session's for good (RFC 1939): mail delivered later waits for the next
+// session, and what IMAP sessions expunge meanwhile is still read from the
+// file this session holds. Messages an IMAP client has marked deleted are
+// left out.
+void PopSession::take_snapshot() {
   index_.clear();
-  offsets_.clear();
   std::uint64_t off = 0;
-  for (auto& m : box_->messages) {
-    index_.push_back(&m);
-    offsets_.push_back(off);
+  for (const MessageRecord& m : box_->messages) {
+    if (!(m.flags & msgflag::deleted)) index_.push_back({off, m.total_length, m.length, m.uid});
     off += m.total_length;
   }
-  deleted_.resize(index_.size(), 0);
+  deleted_.assign(index_.size(), 0);
 }
 
 // Message number n (1-based) when it exists and is not deleted.
@@ -171,7 +165,7 @@ std::optional<std::size_t> PopSession::message_number(std::string_view arg, bool
   std::size_t n = 0;
   auto r = std::from_chars(arg.data(), arg.data() + arg.size(), n);
   if (r.ec != std::errc() || n == 0 || n > index_.size()) return std::nullopt;
-  if (!include_deleted && !visible(n - 1)) return std::nullopt;
+  if (!include_deleted && deleted_[n - 1]) return std::nullopt;
   return n - 1;
 }
 
@@ -179,9 +173,9 @@ void PopSession::totals(std::size_t& count, std::uint64_t& octets) const {
   count = 0;
   octets = 0;
   for (std::size_t i = 0; i < index_.size(); ++i) {
-    if (!visible(i)) continue;
+    if (deleted_[i]) continue;
     ++count;
-    octets += index_[i]->length;
+    octets += index_[i].length;
   }
 }
 
@@ -191,25 +185,27 @@ void PopSession::drop_mailbox(Connection& c) {
   file_.reset();
   deleted_.clear();
   index_.clear();
-  offsets_.clear();
   listing_ = Listing::none;
 }
 
-// The last bytes of message i, to see whether it carries its terminator.
-std::string PopSession::message_tail(std::size_t i) const {
-  const MessageRecord& m = *index_[i];
-  std::uint64_t end = offsets_[i] + m.total_length;
-  std::size_t want = static_cast<std::size_t>(std::min<std::uint64_t>(5, m.length));
-  std::string tail(want, '\0');
-  ssize_t n = ::pread(file_->get(), tail.data(), want, static_cast<off_t>(end - want));
-  if (n != static_cast<ssize_t>(want)) return {};
-  return tail;
-}
-
-bool PopSession::message_readable(std::size_t i) const {
+// Where message i's text ends: before the "." line that closes it (with or
+// without its line end), or at its end when a damaged file lost that line.
+// Nothing when the message is not all in the file.
+std::optional<std::uint64_t> PopSession::text_end(std::size_t i) const {
+  const Entry& e = index_[i];
+  const std::uint64_t end = e.offset + e.total_length;
   struct stat st {};
-  return ::fstat(file_->get(), &st) == 0 &&
-         static_cast<std::uint64_t>(st.st_size) >= offsets_[i] + index_[i]->total_length;
+  if (::fstat(file_->get(), &st) != 0 || static_cast<std::uint64_t>(st.st_size) < end) return std::nullopt;
+  const std::size_t want = static_cast<std::size_t>(std::min<std::uint64_t>(4, e.length));
+  char tail[4];
+  if (::pread(file_->get(), tail, want, static_cast<off_t>(end - want)) != static_cast<ssize_t>(want))
+    return std::nullopt;
+  std::size_t n = want;
+  if (n > 0 && tail[n - 1] == '\n') --n;
+  if (n > 0 && tail[n - 1] == '\r') --n;
+  // The dot opens its line: behind a line end, or first in the message.
+  if (n > 0 && tail[n - 1] == '.' && (n == 1 ? want == e.length : tail[n - 2] == '\n')) return end - (want - n + 1);
+  return end;
 }
 
 bool PopSession::pass(Connection& c, std::string_view password) {
@@ -246,9 +242,9 @@ bool PopSession::pass(Connection& c, std::string_view password) {
     c.send("+OK 0 messages waiting\r\n");
     return true;
   }
-  if (!mailbox_take(*box, c.id())) {
+  if (!mailbox_share_pop(*box, c.id())) {
     state_ = State::authorization;
-    c.send("-ERR mailbox already in use: another POP or IMAP session is currently active\r\n");
+    c.send("-ERR [IN-USE] mailbox already in use: another POP or IMAP session is currently active\r\n");
     return false;
   }
   box_ = box;
@@ -259,7 +255,7 @@ bool PopSession::pass(Connection& c, std::string_view password) {
     return true;
   }
   file_ = std::make_shared<const UniqueFd>(std::move(fd));
-  sync_index();
+  take_snapshot();
   std::size_t count;
   std::uint64_t octets;
   totals(count, octets);
@@ -287,14 +283,23 @@ void PopSession::stls(Connection& c) {
   }
 }
 
-void PopSession::send_ranges(Connection& c, const std::vector<Range>& ranges, const std::string& trailer) {
+// The ranges of a message's text, then the "." line that ends the reply.
+// The stored text is in transmission form already; a lone "." line inside
+// it (a damaged file) is stuffed, so the reply never ends early. `end` is
+// where the text ends when the ranges reach it.
+void PopSession::send_ranges(Connection& c, const std::vector<Range>& ranges, std::uint64_t end) {
   for (const Range& r : ranges) {
     // The client cannot tell a cut message from a whole one unless the
     // connection ends there.
     c.send_file({.file = file_, .offset = r.offset, .length = r.length,
+                 .transform = FileRange::Transform::stuff_lone_dots,
                  .failure_text = "-ERR Internal error occured whilst sending message"});
   }
-  c.send(trailer);
+  char last = '\n';
+  if (!ranges.empty() && ranges.back().offset + ranges.back().length == end &&
+      ::pread(file_->get(), &last, 1, static_cast<off_t>(end - 1)) != 1)
+    last = '\n';
+  c.send(last == '\n' ? ".\r\n" : "\r\n.\r\n");
 }
 
 void PopSession::retr(Connection& c, std::string_view arg) {
@@ -303,15 +308,16 @@ void PopSession::retr(Connection& c, std::string_view arg) {
     c.send("-ERR message does not exist or has been deleted\r\n");
     return;
   }
-  const MessageRecord& m = *index_[*i];
-  std::string tail = message_tail(*i);
-  if (!message_readable(*i) || (tail.empty() && m.length)) {
+  auto end = text_end(*i);
+  if (!end) {
     c.send("-ERR bad message in mailbox (TOP)\r\n");
     return;
   }
-  c.send(strprintf("+OK %llu octets\r\n", static_cast<unsigned long long>(m.length)));
+  c.send(strprintf("+OK %llu octets\r\n", static_cast<unsigned long long>(index_[*i].length)));
   // A download is not a reading: no seen mark, and no read receipt.
-  send_ranges(c, {{offsets_[*i] + (m.total_length - m.length), m.length}}, missing_terminator(tail));
+  std::vector<Range> ranges;
+  if (*end > text_start(*i)) ranges.push_back({text_start(*i), *end - text_start(*i)});
+  send_ranges(c, ranges, *end);
 }
 
 void PopSession::top(Connection& c, std::string_view args) {
@@ -334,13 +340,12 @@ void PopSession::top(Connection& c, std::string_view args) {
     c.send("-ERR syntax is `TOP <msg no> <lines>', eg. TOP 1 7\r\n");
     return;
   }
-  if (!message_readable(*i)) {
+  auto text_stop = text_end(*i);
+  if (!text_stop) {
     c.send("-ERR bad message in mailbox (TOP)\r\n");
     return;
   }
-  const MessageRecord& m = *index_[*i];
-  std::uint64_t start = offsets_[*i] + (m.total_length - m.length);
-  std::uint64_t end = offsets_[*i] + m.total_length;
+  std::uint64_t start = text_start(*i), end = *text_stop;
   // The header without the mailbox's own status lines, its empty line, then
   // the first `lines` lines of the body.
   FileSource in(file_->get());
@@ -360,13 +365,8 @@ void PopSession::top(Connection& c, std::string_view args) {
     if (line.length == 0) break;
     std::uint64_t len = std::min(line.length, end - pos);
     if (in_header) {
-      if (line_body(line.text).empty() || is_terminator_line(line.text)) {
+      if (line_body(line.text).empty()) {
         in_header = false;
-        if (is_terminator_line(line.text)) {
-          add(pos, len);
-          pos += len;
-          break;
-        }
         add(pos, len);
       } else {
         bool folded = line.text.front() == ' ' || line.text.front() == '\t';
@@ -383,27 +383,34 @@ void PopSession::top(Connection& c, std::string_view args) {
   std::uint64_t total = 0;
   for (const Range& rg : ranges) total += rg.length;
   c.send(strprintf("+OK %llu octets\r\n", static_cast<unsigned long long>(total)));
-  send_ranges(c, ranges, pos < end ? ".\r\n" : missing_terminator(message_tail(*i)));
+  send_ranges(c, ranges, end);
 }
 
+// The session's deletions are applied to the mailbox as it is now, by
+// identifier: a message an IMAP session expunged meanwhile is simply gone,
+// and IMAP sessions hear of those removed here.
 void PopSession::quit(Connection& c) {
   std::size_t left = 0;
   bool failed = false;
   if (box_) {
-    sync_index();
-    std::vector<MessageRecord*> marked;
+    std::vector<std::uint32_t> gone;
     for (std::size_t i = 0; i < index_.size(); ++i) {
-      if (deleted_[i] && !(index_[i]->flags & msgflag::deleted)) {
-        index_[i]->flags |= msgflag::deleted;
-        marked.push_back(index_[i]);
+      if (deleted_[i]) gone.push_back(index_[i].uid);
+    }
+    std::sort(gone.begin(), gone.end());
+    auto ours = [&gone](const MessageRecord& m) { return std::binary_search(gone.begin(), gone.end(), m.uid); };
+    std::vector<MessageRecord*> marked;
+    for (MessageRecord& m : box_->messages) {
+      if (ours(m) && !(m.flags & msgflag::deleted)) {
+        m.flags |= msgflag::deleted;
+        marked.push_back(&m);
       }
     }
     file_.reset();  // messages still being sent keep their own hold on the file
-    if (!marked.empty() && mailbox_expunge(*box_) != 0) {
+    if (!gone.empty() && mailbox_expunge(*box_, ours) != 0) {
       for (MessageRecord* m : marked) m->flags &= ~msgflag::deleted;
       failed = true;
     }
-    index_.clear();
     left = static_cast<std::size_t>(box_->count);
     drop_mailbox(c);
   }
@@ -422,8 +429,8 @@ void PopSession::list_more(Connection& c) {
   while (listing_ != Listing::none && !c.output_full() && !c.closed()) {
     std::string part;
     for (std::size_t n = 0; n < kListingLines && list_next_ < index_.size(); ++list_next_) {
-      if (!visible(list_next_)) continue;
-      const MessageRecord& m = *index_[list_next_];
+      if (deleted_[list_next_]) continue;
+      const Entry& m = index_[list_next_];
       part += strprintf("%zu %llu\r\n", list_next_ + 1,
                         static_cast<unsigned long long>(listing_ == Listing::list ? m.length : m.uid));
       ++n;
@@ -438,7 +445,6 @@ void PopSession::list_more(Connection& c) {
 
 void PopSession::mailbox_command(Connection& c, std::string_view verb, std::string_view arg) {
   auto is = [&](std::string_view name) { return str_iequals(verb, name); };
-  sync_index();
   std::size_t count;
   std::uint64_t octets;
   if (is("STAT") || is("RSET")) {
@@ -453,7 +459,7 @@ void PopSession::mailbox_command(Connection& c, std::string_view verb, std::stri
         c.send("-ERR no such message\r\n");
       } else {
         c.send(strprintf("+OK %zu %llu\r\n", *i + 1,
-                         static_cast<unsigned long long>(list ? index_[*i]->length : index_[*i]->uid)));
+                         static_cast<unsigned long long>(list ? index_[*i].length : index_[*i].uid)));
       }
       return;
     }
@@ -476,7 +482,7 @@ void PopSession::mailbox_command(Connection& c, std::string_view verb, std::stri
     retr(c, arg);
   } else if (is("DELE")) {
     auto i = message_number(arg, true);
-    if (!i || (index_[*i]->flags & msgflag::deleted)) {
+    if (!i) {
       c.send("-ERR no such message\r\n");
     } else {
       deleted_[*i] = 1;

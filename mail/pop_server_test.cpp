@@ -104,11 +104,38 @@ TEST_F(PopSessionTest, RsetUndeletesAndADroppedSessionDeletesNothing) {
   second.take();
   EXPECT_EQ(say(second, "USER alice\r\nPASS secret\r\nSTAT\r\n"),
             "+OK please send PASS command\r\n"
-            "-ERR mailbox already in use: another POP or IMAP session is currently active\r\n");
+            "-ERR [IN-USE] mailbox already in use: another POP or IMAP session is currently active\r\n");
   other->vanish();
   EXPECT_EQ(other->reason(), CloseReason::peer_reset);
   EXPECT_TRUE(say(second, "USER alice\r\nPASS secret\r\n").ends_with("+OK 3 messages waiting for alice\r\n"));
   EXPECT_EQ(read_file(home + "/mail/inbox"), before);
+}
+
+// A damaged mailbox (a message whose "." line is missing, or a lone "."
+// line inside one) never ends a reply early or leaves it without its end.
+TEST_F(PopSessionTest, DamagedMessagesAreSentWholeAndEnded) {
+  struct Case {
+    std::string stored, sent;
+  } cases[] = {
+      {"a\r\n.\r\nb\r\n.\r\n", "a\r\n..\r\nb\r\n"},
+      {".\n..\r\n.\r\n.\r\n.\r\n", "..\n..\r\n..\r\n..\r\n"},
+      {"a\r\nb", "a\r\nb\r\n"},
+      {"a\r\n.", "a\r\n"},
+      {"a\r\n.\n", "a\r\n"},
+      {"", ""},
+  };
+  for (const Case& k : cases) {
+    const std::string head = "Subject: x\r\n\r\n";
+    write_file(home + "/mail/inbox", mailbox_separator("MAIL FROM:<b@far.example>", 1700000000) + head + k.stored);
+    std::filesystem::remove(home + "/mail/overview/inbox");
+    mailbox_cache_clear();
+    auto link = login();
+    std::string retr = say(*link, "RETR 1\r\n");
+    EXPECT_EQ(retr.substr(retr.find("\r\n") + 2), head + k.sent + ".\r\n") << k.stored;
+    std::string top = say(*link, "TOP 1 9\r\n");
+    EXPECT_EQ(top.substr(top.find("\r\n") + 2), head + k.sent + ".\r\n") << k.stored;
+    say(*link, "QUIT\r\n");
+  }
 }
 
 TEST_F(PopSessionTest, AFailedPasswordIsAnsweredASecondLateAndTheThirdEndsTheSession) {

@@ -168,13 +168,11 @@ class RoundTrip(ImapSuite):
 
 
 class SharedBox(ImapSuite):
-    def test_two_connections_each_keep_their_numbers_and_pop3_waits(self):
+    def test_two_connections_each_keep_their_numbers(self):
         self.send(make_message('one'), make_message('two'), make_message('three'))
         a, b = self.imap(), self.imap()
         a.select('INBOX')
         b.select('INBOX')
-        with self.assertRaises(poplib.error_proto):
-            self.pop(password=TRICKY)
         a.store('2', '+FLAGS', '(\\Deleted)')
         a.expunge()
         # b still numbers message 3 as 3 during its FETCH; the EXPUNGE comes at NOOP.
@@ -189,13 +187,6 @@ class SharedBox(ImapSuite):
         self.assertEqual(b.search(None, 'RECENT'), ('OK', [b'3']))
         a.logout()
         b.logout()
-        p = self.pop3()
-        self.assertEqual(p.stat()[0], 3)
-        s, f = self.raw()
-        s.sendall(b'l LOGIN alice "pa\\"ss\\\\word"\r\ns SELECT INBOX\r\n')
-        self.assertEqual(f.readline(), b'l OK LOGIN completed\r\n')
-        self.assertEqual(f.readline(), b's NO [INUSE] mailbox in use by a POP3 session\r\n')
-        p.quit()
 
 
 class Extensions(ImapSuite):

@@ -1,6 +1,7 @@
 """Mail from SMTP to the mailbox and out through POP3, with real clients:
 smtplib in, poplib, fetchmail and curl out."""
 
+import imaplib
 import os
 import poplib
 import select
@@ -174,7 +175,7 @@ class RoundTrip(MailSuite):
         with self.assertRaises(poplib.error_proto) as refused:
             self.pop()
         self.assertEqual(str(refused.exception),
-                         str(b'-ERR mailbox already in use: another POP or IMAP session is currently active'))
+                         str(b'-ERR [IN-USE] mailbox already in use: another POP or IMAP session is currently active'))
         first.close()  # gone without QUIT
         again = self.pop_when_free()
         self.assertEqual(again.stat()[0], 2)
@@ -194,16 +195,17 @@ class RoundTrip(MailSuite):
         s.close()
         self.assertEqual(self.pop_when_free().stat()[0], 1)  # the mark went with the connection
 
-    def test_mail_arriving_during_a_session_joins_at_the_end(self):
+    def test_mail_arriving_during_a_session_waits_for_the_next(self):
         self.send(make_message('early'))
         p = self.pop()
         self.assertEqual(p.stat()[0], 1)
         self.send(make_message('late'))
-        self.assertEqual(p.stat()[0], 2)
-        self.assertIn(b'Subject: late', p.retr(2)[1])
+        self.assertEqual(p.stat()[0], 1)
         p.dele(1)
         p.quit()
-        self.assertEqual(self.delivered(), 1)
+        p = self.pop_when_free()
+        self.assertEqual(p.stat()[0], 1)
+        self.assertIn(b'Subject: late', p.retr(1)[1])
 
 
 class BadInput(MailSuite):
@@ -351,6 +353,80 @@ class OtherClients(MailSuite):
         self.assertIn(b'\n.\nFrom here on the body goes on\n', got.replace(b'\r\n', b'\n'))
         for queue in ('mail/in', 'mail/out'):
             self.assertEqual([n for n in os.listdir(self.suite.path(queue)) if not n.startswith('.')], [], queue)
+
+
+class BesideImap(MailSuite):
+    """A desktop collecting over POP3 while a phone idles on the same INBOX
+    over IMAP and another client moves a message: nobody is locked out."""
+
+    def imap(self):
+        m = imaplib.IMAP4('127.0.0.1', self.suite.port('imap'), timeout=20)
+        self.addCleanup(m.sock.close)
+        m.login('alice', PASSWORD)
+        return m
+
+    @staticmethod
+    def untagged(m, word):
+        """The next untagged line carrying `word` (the others are skipped)."""
+        while True:
+            line = m.readline()
+            if not line or word in line:
+                return line
+
+    def test_fetchmail_collects_while_imap_idles_and_moves(self):
+        if not shutil.which('fetchmail'):
+            self.skipTest('fetchmail is not installed')
+        self.send(*(make_message(s) for s in ('one', 'two', 'three')))
+        phone = self.imap()
+        phone.select('INBOX')
+        phone.send(b'i IDLE\r\n')
+        self.assertEqual(phone.readline(), b'+ idling\r\n')
+        phone.sock.settimeout(10)
+        work = tempfile.mkdtemp(prefix='velmor-fetchmail-')
+        self.addCleanup(shutil.rmtree, work, True)
+        out, started, moved, mda = (os.path.join(work, n) for n in ('delivered', 'started', 'moved', 'mda'))
+        # The delivery agent holds fetchmail inside its POP3 session, after
+        # the first message, until the move is done (20 s at most).
+        with open(mda, 'w') as f:
+            f.write('#!/bin/sh\ncat >> %s\ntouch %s\nn=0\n'
+                    'while [ ! -e %s ] && [ $n -lt 400 ]; do sleep 0.05; n=$((n+1)); done\n' % (out, started, moved))
+        os.chmod(mda, 0o755)
+        rc = os.path.join(work, 'fetchmailrc')
+        with open(rc, 'w') as f:
+            f.write('set no syslog\npoll 127.0.0.1 protocol POP3 port %d timeout 30\n'
+                    '  user "alice" password "%s" is root here fetchall\n'
+                    '  mda "%s" sslcertfile "%s" sslcommonname "localhost"\n'
+                    % (self.suite.port('pop'), PASSWORD, mda, self.suite.path('config/tls/cert.pem')))
+        os.chmod(rc, 0o600)
+        env = dict(os.environ, HOME=work, FETCHMAILHOME=work)
+        fetch = subprocess.Popen(['fetchmail', '-f', rc, '--nodetach', '--keep', '-v', '--pidfile',
+                                  os.path.join(work, 'pid')], stdout=subprocess.PIPE, stderr=subprocess.STDOUT,
+                                 env=env, stdin=subprocess.DEVNULL)
+        self.addCleanup(fetch.kill)
+        self.assertTrue(wait_for(lambda: os.path.exists(started) or fetch.poll() is not None, 30))
+        self.assertIsNone(fetch.poll(), fetch.communicate()[0] if fetch.poll() is not None else '')
+        # Inside that session another client moves message 2, and the phone hears it.
+        mover = self.imap()
+        self.assertEqual(mover.select('INBOX')[0], 'OK')
+        mover.create('Archive')
+        self.assertEqual(mover.uid('MOVE', '2', 'Archive')[0], 'OK')
+        self.assertEqual(self.untagged(phone, b'EXPUNGE'), b'* 2 EXPUNGE\r\n')
+        open(moved, 'w').close()
+        output = fetch.communicate(timeout=60)[0]
+        self.assertEqual(fetch.returncode, 0, output.decode(errors='replace'))
+        # fetchmail had the three present at its login, the moved one too.
+        with open(out, 'rb') as f:
+            got = f.read()
+        for subject in (b'one', b'two', b'three'):
+            self.assertIn(b'Subject: ' + subject + b'\r\n', got.replace(b'\n', b'\r\n').replace(b'\r\r', b'\r'))
+        # Deletions at a POP3 QUIT reach the idling phone.
+        p = self.pop()
+        self.assertEqual(p.stat()[0], 2)
+        p.dele(1)
+        self.assertIn(b'(1 messages left)', p.quit())
+        self.assertEqual(self.untagged(phone, b'EXPUNGE'), b'* 1 EXPUNGE\r\n')
+        phone.send(b'DONE\r\n')
+        self.assertEqual(self.untagged(phone, b'i '), b'i OK IDLE terminated\r\n')
 
 
 class Faults(MailSuite):
