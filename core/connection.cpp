@@ -263,6 +263,12 @@ void Connection::resume_input() {
   if (!in_callback_ && !closed_) host_.touch(*this);
 }
 
+void Connection::yield_turn() {
+  if (closed_ || yielded_) return;
+  yielded_ = true;
+  host_.next_pass(*this);
+}
+
 void Connection::send(std::string_view bytes) {
   if (closed_ || close_pending_ || phase_ == Phase::closing || bytes.empty()) return;
   if (!out_.empty() && !out_.back().is_file && !out_.back().upgrade && out_.back().bytes.size() < kChunkJoin) {
@@ -553,12 +559,12 @@ void Connection::read_some() {
 // Offers the input to the session while it may take it.
 void Connection::deliver() {
   for (int round = 0; round < kInputRounds; ++round) {
-    if (closed_ || close_pending_ || phase_ != Phase::open || !dirty_ || paused_ || was_full_) return;
+    if (closed_ || close_pending_ || phase_ != Phase::open || !dirty_ || paused_ || was_full_ || yielded_) return;
     dirty_ = false;
     gated_ = false;
     call("input", [&](Session& s) { s.on_input(*this); });
     if (gated_) dirty_ = true;  // offered again once the gate opens
-    if (peer_eof_ && !gated_ && !paused_ && phase_ == Phase::open && !close_pending_) {
+    if (peer_eof_ && !gated_ && !paused_ && !yielded_ && phase_ == Phase::open && !close_pending_) {
       // The peer has finished: what it asked for is sent, then the end.
       after_send_reason_ = CloseReason::peer_closed;
       close_after_send();
@@ -608,10 +614,16 @@ void ConnectionCore::serve(Connection& c, bool readable) {
   // Input still waiting after this turn's rounds: another turn soon (the
   // buffer may be full, so no readiness would bring one). The same for
   // bytes a transport holds decrypted: the descriptor will not say so.
-  if (c.dirty_ && c.gate_open()) c.host_.touch(c);
+  if (c.dirty_ && c.gate_open() && !c.yielded_) c.host_.touch(c);
   else if (c.transport_ && c.transport_->read_ready() && c.transport_->needs() == Transport::Need::none &&
            wants_read(c))
     c.host_.touch(c);
+}
+
+void ConnectionCore::resume_turn(Connection& c) {
+  if (!c.yielded_) return;
+  c.yielded_ = false;
+  c.dirty_ = true;
 }
 
 void ConnectionCore::fire_timer(Connection& c) {

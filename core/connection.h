@@ -249,6 +249,13 @@ class Connection {
   void pause_input();
   void resume_input();
   bool input_paused() const { return paused_; }
+  // The session has used its share of this pass (a client pipelining
+  // hundreds of commands) and stops with input left: on_input is offered
+  // again at the loop's next pass, after the other connections had their
+  // turn, whether or not more input arrives meanwhile. Until then it is not
+  // offered input, and a peer that finished sending is not closed on.
+  void yield_turn();
+  bool yielded() const { return yielded_; }
 
   // ---- output --------------------------------------------------------------
   // Queues bytes; the core sends them in order with the queued file ranges.
@@ -360,6 +367,7 @@ class Connection {
   bool dirty_ = false;       // something changed since on_input last ran
   bool gated_ = false;       // on_input stopped because input was held back
   bool paced_by_lines_ = true;
+  bool yielded_ = false;     // yield_turn(): on_input again at the next pass
 
   // TLS in place: queued = the upgrade waits in the output queue (nothing is
   // read meanwhile); handshaking = the new transport works on it.

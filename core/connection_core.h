@@ -25,6 +25,9 @@ class ConnectionHost {
   // (the object itself lives until the pass ends).
   virtual void release(Connection& c) = 0;
   virtual std::int64_t now_ms() const = 0;
+  // The session yielded its turn (Connection::yield_turn): call
+  // ConnectionCore::resume_turn and serve it at the start of the next pass.
+  virtual void next_pass(Connection& c) = 0;
 };
 
 struct ConnectionCore {
@@ -52,6 +55,8 @@ struct ConnectionCore {
   // One turn: send what is queued, read when `readable`, offer the input to
   // the session, send again, and close a connection that is done.
   static void serve(Connection& c, bool readable);
+  // The next pass came for a connection that yielded: its input is offered again.
+  static void resume_turn(Connection& c);
   // The wake-up time came: on_timer, then a turn without reading.
   static void fire_timer(Connection& c);
   // What the connection waits for now.

@@ -93,6 +93,7 @@ class Network final : public ConnectionHost {
   std::map<int, int> counts;
   std::map<std::pair<int, std::uint32_t>, int> peers;  // connections per (service, peer)
   std::unordered_set<std::uint64_t> touched;
+  std::vector<std::uint64_t> yielded;  // served again at the next pass
   std::priority_queue<std::pair<std::int64_t, std::uint64_t>, std::vector<std::pair<std::int64_t, std::uint64_t>>,
                       std::greater<>>
       timers;
@@ -107,6 +108,7 @@ class Network final : public ConnectionHost {
 
   // ConnectionHost
   void touch(Connection& c) override { touched.insert(c.id()); }
+  void next_pass(Connection& c) override { yielded.push_back(c.id()); }
   void timer_changed(Connection& c, std::int64_t due) override {
     if (due) timers.emplace(due, c.id());
   }
@@ -561,6 +563,7 @@ void net_reset() {
   n.tick_hooks.clear();
   n.resolver = {};
   n.touched.clear();
+  n.yielded.clear();
   n.timers = {};
   n.lookups_done.clear();
   n.counts.clear();
@@ -576,6 +579,12 @@ void net_pass(int timeout_ms) {
   progress_code = 140100;
   n.settle_lookups();
   const int timer_ms = n.run_timers();
+  for (std::uint64_t id : std::exchange(n.yielded, {})) {
+    auto it = n.entries.find(id);
+    if (it == n.entries.end()) continue;
+    ConnectionCore::resume_turn(*it->second.connection);
+    n.touched.insert(id);
+  }
   n.serve_touched();
   for (auto& [id, e] : n.entries)
     if (e.connection->phase() == Phase::listening) n.sync(*e.connection);

@@ -11,6 +11,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <functional>
 #include <stdexcept>
@@ -91,6 +92,7 @@ struct Seen {
   std::vector<CloseReason> closes;
   Connection* last = nullptr;
   bool consume = true;
+  int per_turn = 0;  // lines read before the session yields its turn (0: all)
 };
 
 // Greets, echoes each line, and understands a few words: "quit" closes at
@@ -105,7 +107,12 @@ class Echo : public Session {
   void on_input(Connection& c) override {
     if (!seen_.consume) return;
     std::string_view line;
-    while (c.read_line(line) == LineResult::line) {
+    for (int n = 0;; ++n) {
+      if (seen_.per_turn && n == seen_.per_turn) {
+        c.yield_turn();
+        return;
+      }
+      if (c.read_line(line) != LineResult::line) return;
       if (line == "quit") {
         c.close_now();
         c.send("ignored");  // the connection stays valid until the callback returns
@@ -169,6 +176,29 @@ TEST_F(NetworkTest, AcceptReadWriteAndPeerClose) {
   EXPECT_EQ(seen.closes[0], CloseReason::peer_closed);
   EXPECT_EQ(connection_count(svc::smtp), 0);
   EXPECT_GT(accepted_total(), 0u);
+}
+
+// A session that yields its turn is served again at the next pass, after
+// the others: a client pipelining fifty lines, one a pass, does not keep a
+// second client waiting, and having finished sending it still gets all
+// fifty answers before the close.
+TEST_F(NetworkTest, AYieldedTurnComesBackAtTheNextPassAfterTheOthers) {
+  seen.per_turn = 1;
+  Client a(port), b(port);
+  ASSERT_TRUE(a.wait_for("hello"));
+  ASSERT_TRUE(b.wait_for("hello"));
+  std::string lines;
+  for (int i = 0; i < 50; ++i) lines += "line " + std::to_string(i) + "\n";
+  a.send(lines);
+  ::shutdown(a.fd, SHUT_WR);
+  b.send("x\n");
+  ASSERT_TRUE(b.wait_for("echo x\n"));
+  a.poll_in();
+  auto echoes = [&] { return std::count(a.got.begin(), a.got.end(), '\n'); };
+  EXPECT_LT(echoes(), 10);
+  ASSERT_TRUE(a.wait_eof());
+  EXPECT_EQ(echoes(), 51);  // the greeting and every line
+  EXPECT_NE(a.got.find("echo line 49\n"), std::string::npos);
 }
 
 TEST_F(NetworkTest, CloseFromInsideTheSessionAndAfterSending) {

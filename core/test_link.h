@@ -18,7 +18,11 @@
 //
 // After every piece of input the after-pass hooks run (as at the end of a
 // pass of the loop), so work they carry (the mail queue's group commit)
-// happens as in the suite.
+// happens as in the suite. A session that yields its turn
+// (Connection::yield_turn) is served again at the next pass: by default the
+// driver runs those passes at once, until none is asked for; after
+// hold_passes() the test runs them one at a time with pass(), and sees
+// what other connections got in between.
 #pragma once
 
 #include <algorithm>
@@ -63,6 +67,10 @@ class TestLink final : public ConnectionHost {
   void advance(std::chrono::milliseconds by);
   // One more turn (after something outside changed the connection).
   void turn();
+  // Passes yielded turns wait for (see above); pass() runs one, false when
+  // none was asked for.
+  void hold_passes() { hold_passes_ = true; }
+  bool pass();
 
   Connection& connection() { return *connection_; }
   bool closed() const { return connection_->closed(); }
@@ -78,6 +86,7 @@ class TestLink final : public ConnectionHost {
   void timer_changed(Connection&, std::int64_t due) override { due_ = due; }
   void release(Connection& c) override;
   std::int64_t now_ms() const override { return now_ms_; }
+  void next_pass(Connection&) override { yielded_ = true; }
 
  private:
   struct Memory final : Transport {
@@ -109,6 +118,7 @@ class TestLink final : public ConnectionHost {
   bool refuse_tls_ = false;
   std::size_t clear_end_ = std::numeric_limits<std::size_t>::max();
   bool touched_ = false;
+  bool yielded_ = false, hold_passes_ = false;
   std::int64_t due_ = 0;
   std::int64_t now_ms_ = 1'000'000;
 };
