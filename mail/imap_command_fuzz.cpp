@@ -11,6 +11,7 @@
 #include <filesystem>
 #include <string>
 
+#include "core/background.h"
 #include "core/config.h"
 #include "core/filecache.h"
 #include "core/globals.h"
@@ -97,10 +98,22 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   server_now = 1700000000;
   {
     TestLink link(svc::imap);
+    auto background = [&] {  // a long SEARCH goes on there
+      while (background_round()) {
+      }
+      link.turn();
+    };
     link.feed(input, piece);
-    for (int i = 0; i < 4 && !link.closed(); ++i) link.advance(std::chrono::seconds(1));
+    background();
+    for (int i = 0; i < 4 && !link.closed(); ++i) {
+      link.advance(std::chrono::seconds(1));
+      background();
+    }
     link.finish();
-    for (int i = 0; i < 4 && !link.closed(); ++i) link.advance(std::chrono::seconds(1));
+    for (int i = 0; i < 4 && !link.closed(); ++i) {
+      link.advance(std::chrono::seconds(1));
+      background();
+    }
     check(link.closed());
     check_responses(link.output());
   }

@@ -7,11 +7,13 @@
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
+#include <functional>
 
 #include "core/strfmt.h"
 #include "core/util.h"
 #include "mail/imap_address.h"
 #include "mail/mailfile.h"
+#include "mail/mime_text.h"
 
 namespace velmor {
 
@@ -22,9 +24,12 @@ constexpr std::size_t kWindow = 64 * 1024;
 constexpr std::size_t kFieldKeep = 64 * 1024;
 // How far before a MIME part's body its header is looked for.
 constexpr std::uint64_t kPartHeaderWindow = 64 * 1024;
-// Structures nest at most this deep; deeper parts are shown as leaves.
+// Structures nest at most this deep and show at most this many parts: a
+// multipart past either bound is shown, and addressed, as one opaque body.
 constexpr int kDepthLimit = 32;
+constexpr std::size_t kPartLimit = 1000;
 constexpr std::uint64_t kUnknown = ~std::uint64_t{0};
+const std::vector<std::size_t> kNoParts;
 
 bool is_blank(char c) { return c == ' ' || c == '\t'; }
 
@@ -365,6 +370,8 @@ struct Tree {
   std::vector<const MimePart*> parts;
   std::vector<std::vector<std::size_t>> children;
   std::vector<std::size_t> top;
+  std::vector<char> opaque;    // a multipart past the bounds: one body
+  bool whole_opaque = false;   // the message's own body is one
 
   explicit Tree(const std::list<MimePart>& list) {
     std::vector<std::size_t> stack;
@@ -380,7 +387,28 @@ struct Tree {
       }
       stack.push_back(i);
     }
+    bound();
   }
+
+  // Which multiparts are shown as one body: one nested too deep, and one
+  // whose own parts would take the count past the limit (the parts are
+  // counted level by level in order, a multipart's parts before what lies
+  // below them). A message whose parts alone pass it is one body.
+  void bound() {
+    opaque.assign(parts.size(), 0);
+    std::size_t shown = 0;
+    std::function<bool(const std::vector<std::size_t>&, int)> expand = [&](const std::vector<std::size_t>& kids,
+                                                                           int depth) {
+      if (shown + kids.size() > kPartLimit) return false;
+      shown += kids.size();
+      for (std::size_t k : kids) {
+        if (!children[k].empty() && (depth + 1 >= kDepthLimit || !expand(children[k], depth + 1))) opaque[k] = 1;
+      }
+      return true;
+    };
+    whole_opaque = !top.empty() && !expand(top, 0);
+  }
+  bool structured() const { return !top.empty() && !whole_opaque; }
 };
 
 // A message, or a message inside a message/rfc822 part: header [start, body),
@@ -438,22 +466,60 @@ class Renderer {
   }
 
   void structure(std::string& o, bool ext) {
-    if (!tree_.top.empty()) {
+    if (tree_.structured()) {
       multipart(o, tree_.top, msg_.start, msg_.body, ext, 0);
       return;
     }
     Span body = range(msg_.body, msg_.end);
     body.plain = body_plain();
-    leaf(o, msg_.start, msg_.body, body, m_.body_lines, ext, 0, false);
+    leaf(o, msg_.start, msg_.body, body, m_.body_lines, ext, 0, false, nullptr, tree_.whole_opaque);
   }
 
   const Extent& message() const { return msg_; }
+
+  // The header's fields for SEARCH: values unfolded, encoded words decoded,
+  // folded to one case; at most kSearchHeaderKeep of them in all.
+  void header_fields(SearchText& t) {
+    std::size_t kept = 0;
+    each_field(f_, msg_.start, msg_.body, [&](std::string_view name, std::string_view value) {
+      std::string decoded = header_words_decode(value);
+      std::replace_if(decoded.begin(), decoded.end(), [](char c) { return c == '\r' || c == '\n'; }, ' ');
+      t.fields.emplace_back(std::string(name), utf8_fold(decoded));
+      kept += name.size() + value.size() + 4;
+      return kept < kSearchHeaderKeep;
+    });
+    t.cost += kept;
+  }
+
+  // The body's text for SEARCH: its text parts (and attached messages) in
+  // order, decoded, in UTF-8 and folded, up to `cap` bytes; the stored bytes
+  // read are added to `read`.
+  void body_text(std::string& out, std::size_t cap, std::uint64_t& read) {
+    if (tree_.whole_opaque) return;
+    if (tree_.top.empty()) {
+      part_text(msg_.start, msg_.body, range(msg_.body, msg_.end), nullptr, out, cap, read);
+      return;
+    }
+    std::function<void(const std::vector<std::size_t>&)> walk = [&](const std::vector<std::size_t>& kids) {
+      for (std::size_t k : kids) {
+        if (out.size() >= cap) return;
+        if (!tree_.children[k].empty()) {
+          if (!tree_.opaque[k]) walk(tree_.children[k]);
+          continue;
+        }
+        const MimePart& p = *tree_.parts[k];
+        auto [hs, he] = part_header(p);
+        part_text(hs, he, part_body(p), &p, out, cap, read);
+      }
+    };
+    walk(tree_.top);
+  }
 
   // The content of a section; nullopt when the message has no such part.
   std::optional<Content> section(const FetchSection& sec) {
     using Kind = FetchSection::Kind;
     if (sec.part.empty()) return message_section(sec, msg_, true);
-    if (tree_.top.empty()) {  // a single part: part 1 is the body
+    if (!tree_.structured()) {  // a single part: part 1 is the body
       if (sec.part.size() != 1 || sec.part[0] != 1) return std::nullopt;
       if (sec.kind == Kind::mime) return Content{range(msg_.start, msg_.body)};
       if (sec.kind != Kind::all) return std::nullopt;
@@ -466,7 +532,7 @@ class Renderer {
     for (std::size_t i = 0; i < sec.part.size(); ++i) {
       if (sec.part[i] > level->size()) return std::nullopt;
       node = (*level)[sec.part[i] - 1];
-      level = &tree_.children[node];
+      level = tree_.opaque[node] ? &kNoParts : &tree_.children[node];
     }
     auto [hs, he] = part_header(*tree_.parts[node]);
     Span body = part_body(*tree_.parts[node]);
@@ -685,6 +751,50 @@ class Renderer {
     return h + "\r\n";
   }
 
+  // One part's text (see body_text); a part that is not text adds nothing.
+  void part_text(std::uint64_t hs, std::uint64_t he, const Span& body, const MimePart* record, std::string& out,
+                 std::size_t cap, std::uint64_t& read) {
+    Fields h{"Content-Type", "Content-Transfer-Encoding"};
+    if (hs == he && record) {
+      std::string made = part_header_text(*record);
+      TextSource t(made);
+      h.read(t, 0, t.size());
+    } else {
+      h.read(f_, hs, he);
+    }
+    std::optional<MediaType> mt = h["Content-Type"] ? parse_media(*h["Content-Type"]) : std::nullopt;
+    // (A multipart reaches here only when its parts could not be told apart.)
+    if (mt && mt->type != "TEXT" && mt->type != "MESSAGE" && mt->type != "MULTIPART") return;
+    std::string charset;
+    for (const auto& [name, value] : mt ? mt->params : std::vector<std::pair<std::string, std::string>>{})
+      if (name == "CHARSET") charset = value;
+    const auto& encoding = h["Content-Transfer-Encoding"];
+    TransferDecoder decoder(encoding ? transfer_kind(MimeValue(*encoding).token()) : TransferDecoder::Kind::identity);
+    const std::size_t room = cap - std::min(cap, out.size());
+    std::string raw, plain;
+    bool at_start = body.line_start;
+    each_piece(f_, body.s, body.e, [&](std::string_view v) {
+      read += v.size();
+      if (stuffed_) {
+        plain.clear();
+        for (char c : v) {
+          if (!(at_start && c == '.')) plain += c;
+          at_start = c == '\n';
+        }
+        v = plain;
+      }
+      decoder.feed(v, raw);
+      return raw.size() < room;
+    });
+    decoder.finish(raw);
+    raw.resize(std::min(raw.size(), room));
+    std::string text;
+    charset_to_utf8(charset, raw, text);
+    utf8_fold_append(out, text);
+    if (out.size() > cap) out.resize(cap);
+    out += '\n';
+  }
+
   std::optional<MediaType> media_of(std::uint64_t hs, std::uint64_t he, const MimePart& p) {
     if (hs == he) return parse_media(p.content_type);
     Fields h{"Content-Type"};
@@ -717,10 +827,10 @@ class Renderer {
     for (std::size_t k : kids) {
       const MimePart& p = *tree_.parts[k];
       auto [phs, phe] = part_header(p);
-      if (!tree_.children[k].empty() && depth + 1 < kDepthLimit) {
+      if (!tree_.children[k].empty() && !tree_.opaque[k]) {
         multipart(o, tree_.children[k], phs, phe, ext, depth + 1);
       } else {
-        leaf(o, phs, phe, part_body(p), p.lines, ext, depth + 1, digest, &p);
+        leaf(o, phs, phe, part_body(p), p.lines, ext, depth + 1, digest, &p, tree_.opaque[k] != 0);
       }
     }
     o += ' ';
@@ -734,7 +844,7 @@ class Renderer {
   }
 
   void leaf(std::string& o, std::uint64_t hs, std::uint64_t he, Span body, std::uint64_t lines, bool ext, int depth,
-            bool in_digest, const MimePart* record = nullptr) {
+            bool in_digest, const MimePart* record = nullptr, bool opaque = false) {
     Fields h{"Content-Type", "Content-ID", "Content-Description", "Content-Transfer-Encoding"};
     if (hs == he && record) {
       // No header found: what the record knows of it.
@@ -747,8 +857,8 @@ class Renderer {
     std::optional<MediaType> parsed = h["Content-Type"] ? parse_media(*h["Content-Type"]) : std::nullopt;
     MediaType mt = parsed ? *parsed : default_media(in_digest);
     bool message = mt.type == "MESSAGE" && mt.subtype == "RFC822";
-    if (message && depth + 1 >= kDepthLimit) mt = {"APPLICATION", "OCTET-STREAM", {}};
-    message = message && depth + 1 < kDepthLimit;
+    if (opaque || (message && depth + 1 >= kDepthLimit)) mt = {"APPLICATION", "OCTET-STREAM", {}};
+    message = message && !opaque && depth + 1 < kDepthLimit;
     std::string encoding = "7BIT";
     if (h["Content-Transfer-Encoding"]) {
       std::string token = upper(MimeValue(*h["Content-Transfer-Encoding"]).token());
@@ -1064,43 +1174,20 @@ std::optional<std::uint64_t> imap_message_size(ByteSource& file, MessageRecord& 
   return Renderer(file, message, offset).size();
 }
 
-bool imap_header_contains(ByteSource& file, const MessageRecord& message, std::uint64_t offset, std::string_view name,
-                          std::string_view needle) {
-  if (!within(file, message, offset)) return false;
-  std::uint64_t start = offset + (message.total_length - message.length);
-  std::uint64_t body = offset + std::clamp<std::uint64_t>(message.header_length, message.total_length - message.length,
-                                                          message.total_length);
-  bool found = false;
-  each_field(file, start, body, [&](std::string_view n, std::string_view value) {
-    found = str_iequals(n, name) && (needle.empty() || str_casestr(value, needle));
-    return !found;
-  });
-  return found;
-}
-
-bool imap_text_contains(ByteSource& file, MessageRecord& message, std::uint64_t offset, std::string_view needle,
-                        TextScope scope) {
+bool imap_search_text(ByteSource& file, MessageRecord& message, std::uint64_t offset, bool with_body,
+                      SearchText& out) {
   if (!within(file, message, offset) || !count_text(file, message, offset)) return false;
-  if (needle.empty()) return true;
   Renderer r(file, message, offset);
-  const Extent& x = r.message();
-  std::uint64_t s = scope == TextScope::body ? x.body : x.start;
-  // The plain text in pieces, each searched with the end of the one before.
-  std::string window;
-  bool at_start = true;
-  for (std::uint64_t pos = s; pos < x.end;) {
-    std::string_view v = file.view(pos, kWindow);
-    if (v.empty()) return false;
-    v = v.substr(0, static_cast<std::size_t>(std::min<std::uint64_t>(v.size(), x.end - pos)));
-    pos += v.size();
-    for (char c : v) {
-      if (!(at_start && c == '.')) window += c;
-      at_start = c == '\n';
-    }
-    if (str_casestr(window, needle)) return true;
-    window.erase(0, window.size() - std::min(window.size(), needle.size() - 1));
+  if (!out.header_read) {
+    r.header_fields(out);
+    out.header_read = true;
   }
-  return false;
+  if (with_body && !out.body_read) {
+    r.body_text(out.body, kSearchBodyKeep, out.cost);
+    out.cost += out.body.size();
+    out.body_read = true;
+  }
+  return !file.failed();
 }
 
 }  // namespace velmor

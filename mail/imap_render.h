@@ -2,8 +2,8 @@
 // FETCH response built from its overview record and the mailbox file. It
 // knows no sockets: the response goes to an ImapSink as text and as ranges
 // of the mailbox file, so a large literal is streamed from the file rather
-// than copied into memory. It also answers what SEARCH asks of a message's
-// text, and renders IMAP strings and flag lists for the session.
+// than copied into memory. It also reads a message's text for SEARCH, and
+// renders IMAP strings and flag lists for the session.
 //
 // The text a client is given is the stored message behind its "From "
 // separator line, without the "." line that ends it (the last line keeps its
@@ -15,6 +15,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "mail/mailbox.h"
@@ -160,14 +161,23 @@ FetchResult imap_fetch_render(const FetchRequest& request, FetchTarget& target, 
 // RFC822.SIZE: the length of the text a client is given (LARGER, SMALLER).
 // nullopt when the message cannot be read.
 std::optional<std::uint64_t> imap_message_size(ByteSource& file, MessageRecord& message, std::uint64_t offset);
-// Whether the message has a header field `name` whose value (unfolded)
-// holds `needle`, ignoring case; an empty needle matches any such field
-// (HEADER, CC, BCC).
-bool imap_header_contains(ByteSource& file, const MessageRecord& message, std::uint64_t offset,
-                          std::string_view name, std::string_view needle);
-// Whether the body (BODY) or the whole text (TEXT) holds `needle`, ignoring case.
-enum class TextScope { body, whole };
-bool imap_text_contains(ByteSource& file, MessageRecord& message, std::uint64_t offset,
-                        std::string_view needle, TextScope scope);
+// A message's text as SEARCH compares it, folded to one case (utf8_fold):
+// its header fields with the values unfolded and their encoded words
+// decoded, and the text of its body (the text parts and attached messages,
+// their transfer encoding undone, in UTF-8). Bounded: kSearchHeaderKeep of
+// the header and kSearchBodyKeep of the body are kept; attachments that are
+// not text are not read at all.
+inline constexpr std::size_t kSearchHeaderKeep = 256 * 1024;
+inline constexpr std::size_t kSearchBodyKeep = 2 * 1024 * 1024;
+struct SearchText {
+  std::vector<std::pair<std::string, std::string>> fields;  // name as written, value folded
+  std::string body;
+  bool header_read = false, body_read = false;
+  std::uint64_t cost = 0;  // bytes read and made so far
+};
+// Reads what `out` lacks: the header fields, and with `with_body` the body
+// text. False when the message cannot be read.
+bool imap_search_text(ByteSource& file, MessageRecord& message, std::uint64_t offset, bool with_body,
+                      SearchText& out);
 
 }  // namespace velmor

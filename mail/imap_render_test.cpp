@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
+
 #include "mail/imap_address.h"
 #include "mail/imap_check.h"
 #include "mail/mailfile.h"
@@ -366,20 +368,68 @@ TEST(ImapAddress, TokensAndLists) {
   EXPECT_EQ(at, longer.size());
 }
 
-TEST(ImapSearch, HeaderAndTextLookups) {
-  Box b("Subject: Hello\r\nCc: Carl <carl@example.com>,\r\n dora@example.com\r\n\r\n.dotted Word\r\nmore\r\n");
+TEST(ImapRender, StructuresAreBoundedInPartsAndDepth) {
+  // Past the part count the body is one opaque part, shown and fetched so.
+  std::string flat_body;
+  for (int i = 0; i < 1500; ++i) flat_body += "--b\r\n\r\npart\r\n";
+  flat_body += "--b--\r\n";
+  Box flat("Content-Type: multipart/mixed; boundary=b\r\n\r\n" + flat_body);
+  EXPECT_EQ(structure(flat, "BODY"),
+            "(\"APPLICATION\" \"OCTET-STREAM\" NIL NIL NIL \"7BIT\" " + std::to_string(flat_body.size()) + ")");
+  EXPECT_EQ(flat.item("BODY.PEEK[1]", "BODY[1]"), flat_body);
+  EXPECT_EQ(flat.fetch("BODY.PEEK[2]"), "* 7 FETCH (BODY[2] {0}\r\n UID 1)\r\n");
+  // Within the count, the multipart that would pass it is the one shown
+  // as one part: the parts before and after it keep their structure.
+  std::string big;
+  for (int i = 0; i < 998; ++i) big += "--in\r\n\r\nx\r\n";
+  Box nested("Content-Type: multipart/mixed; boundary=out\r\n\r\n--out\r\n\r\nfirst\r\n"
+             "--out\r\nContent-Type: multipart/mixed; boundary=in\r\n\r\n" + big + "--in--\r\n"
+             "--out\r\n\r\nlast\r\n--out--\r\n");
+  EXPECT_EQ(structure(nested, "BODY"),
+            "((\"TEXT\" \"PLAIN\" (\"CHARSET\" \"US-ASCII\") NIL NIL \"7BIT\" 5 1)"
+            "(\"APPLICATION\" \"OCTET-STREAM\" NIL NIL NIL \"7BIT\" " + std::to_string(big.size() + 6) + ")"
+            "(\"TEXT\" \"PLAIN\" (\"CHARSET\" \"US-ASCII\") NIL NIL \"7BIT\" 4 1) \"MIXED\")");
+  EXPECT_EQ(nested.item("BODY.PEEK[3]", "BODY[3]"), "last");
+  EXPECT_EQ(nested.fetch("BODY.PEEK[2.1]"), "* 7 FETCH (BODY[2.1] {0}\r\n UID 1)\r\n");
+  // Nested too deep: the deepest multipart shown is one part.
+  std::string deep = "Content-Type: multipart/mixed; boundary=b0\r\n\r\n";
+  for (int i = 1; i <= 40; ++i)
+    deep += "--b" + std::to_string(i - 1) + "\r\nContent-Type: multipart/mixed; boundary=b" + std::to_string(i) +
+            "\r\n\r\n";
+  deep += "--b40\r\n\r\nleaf\r\n";
+  Box d(deep);
+  std::string s = structure(d, "BODY");
+  EXPECT_EQ(s.find("\"TEXT\""), std::string::npos) << s;
+  EXPECT_EQ(s.find("(\"APPLICATION\" \"OCTET-STREAM\""), s.rfind('(')) << s;
+  EXPECT_EQ(std::count(s.begin(), s.end(), '('), 33) << s;
+}
+
+TEST(ImapSearch, TextIsDecodedFoldedAndBounded) {
+  Box b("Subject: =?UTF-8?B?0J/RgNC40LLQtdGC?= World\r\n"
+        "Cc: Carl <CARL@example.com>,\r\n dora@example.com\r\n"
+        "Content-Type: multipart/mixed; boundary=b\r\n\r\n"
+        "--b\r\nContent-Type: text/plain; charset=koi8-r\r\nContent-Transfer-Encoding: base64\r\n\r\n8NLJ18XU\r\n"
+        "--b\r\nContent-Type: text/plain; charset=utf-8\r\nContent-Transfer-Encoding: quoted-printable\r\n\r\n"
+        ".Dotted CAF=C3=89 soft=\r\nbreak\r\n"
+        "--b\r\nContent-Type: application/octet-stream\r\n\r\nattached words\r\n"
+        "--b--\r\n");
   TextSource in(b.text);
   MessageRecord& m = b.last();
-  EXPECT_TRUE(imap_header_contains(in, m, b.offset(), "cc", "DORA@"));
-  EXPECT_TRUE(imap_header_contains(in, m, b.offset(), "CC", ""));
-  EXPECT_FALSE(imap_header_contains(in, m, b.offset(), "Bcc", ""));
-  EXPECT_FALSE(imap_header_contains(in, m, b.offset(), "Subject", "dotted"));
-  EXPECT_TRUE(imap_text_contains(in, m, b.offset(), "\n.DOTTED w", TextScope::whole));
-  EXPECT_TRUE(imap_text_contains(in, m, b.offset(), ".DOTTED w", TextScope::body));
-  EXPECT_FALSE(imap_text_contains(in, m, b.offset(), "..dotted", TextScope::whole));
-  EXPECT_FALSE(imap_text_contains(in, m, b.offset(), "hello", TextScope::body));
-  EXPECT_TRUE(imap_text_contains(in, m, b.offset(), "hello", TextScope::whole));
-  EXPECT_FALSE(imap_text_contains(in, m, b.offset(), "more\r\n.", TextScope::whole));  // not the "." line
+  SearchText t;
+  ASSERT_TRUE(imap_search_text(in, m, b.offset(), false, t));
+  EXPECT_EQ(t.fields, (std::vector<std::pair<std::string, std::string>>{
+                          {"Subject", "привет world"},
+                          {"Cc", "carl <carl@example.com>, dora@example.com"},
+                          {"Content-Type", "multipart/mixed; boundary=b"}}));
+  EXPECT_FALSE(t.body_read);
+  ASSERT_TRUE(imap_search_text(in, m, b.offset(), true, t));
+  EXPECT_EQ(t.body, "привет\n.dotted café softbreak\n");  // not the attachment
+  // A long body is cut at the bound.
+  Box big("Subject: big\r\n\r\n" + std::string(kSearchBodyKeep + 1000, 'A') + "\r\n");
+  TextSource big_in(big.text);
+  SearchText u;
+  ASSERT_TRUE(imap_search_text(big_in, big.last(), big.offset(), true, u));
+  EXPECT_EQ(u.body, std::string(kSearchBodyKeep, 'a') + "\n");
   EXPECT_EQ(imap_message_size(in, m, b.offset()), b.item("BODY.PEEK[]", "BODY[]").size());
 }
 

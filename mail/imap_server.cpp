@@ -29,6 +29,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/background.h"
 #include "core/config.h"
 #include "core/globals.h"
 #include "core/log.h"
@@ -38,6 +39,8 @@
 #include "core/tls.h"
 #include "core/util.h"
 #include "mail/imap_render.h"
+#include "mail/imap_search.h"
+#include "mail/imap_subscriptions.h"
 #include "mail/mailbox.h"
 #include "mail/mailfile.h"
 #include "mail/queue_text.h"
@@ -54,15 +57,16 @@ constexpr std::size_t kCommandLimit = 64 * 1024;
 constexpr std::uint64_t kMessageCap = 64ull * 1024 * 1024;
 constexpr std::chrono::milliseconds kFailedLoginDelay{1000};
 constexpr int kFailedLoginLimit = 3;
+// Commands one connection runs in a pass of the loop before the others are
+// served (a client may pipeline thousands).
+constexpr int kCommandsPerTurn = 16;
+// What one slice of a SEARCH reads and compares, in bytes.
+constexpr std::uint64_t kSearchSlice = 1024 * 1024;
 // An APPEND or COPY that finds delivery writing into its mailbox tries again.
 constexpr std::chrono::milliseconds kStoreRetry{50};
 constexpr std::size_t kWriteChunk = 1024 * 1024;
 constexpr int kListDepth = 16;
 constexpr std::size_t kListEntries = 10000;
-// Where a user's subscriptions are kept, below the home (a dot file, so
-// never taken for a mailbox), and the most of it that is read.
-constexpr std::string_view kSubscriptionFile = "mail/.subscriptions";
-constexpr std::size_t kSubscriptionBytes = 1024 * 1024;
 constexpr std::uint32_t kKept =
     msgflag::seen | msgflag::answered | msgflag::flagged | msgflag::deleted | msgflag::draft;
 const char* const kCapabilities = "IMAP4rev1 IDLE UIDPLUS MOVE NAMESPACE SPECIAL-USE";
@@ -158,9 +162,7 @@ class Args {
 
 // ---- sequence sets ----------------------------------------------------------------
 
-struct Range {
-  std::uint32_t low = 0, high = 0;
-};
+using Range = SearchRange;
 
 // A sequence set, "*" standing for `star`; the ranges sorted and joined.
 // nullopt when malformed.
@@ -218,17 +220,6 @@ std::string uid_text(const std::vector<std::uint32_t>& uids) {
 
 // ---- dates ----------------------------------------------------------------------------
 
-// Days from 1 Jan 1970 to a calendar date (month from 0).
-std::int64_t day_number(int year, int month, int day) {
-  int y = year - (month < 2 ? 1 : 0);
-  int era = (y >= 0 ? y : y - 399) / 400;
-  int yoe = y - era * 400;
-  int mp = (month + 10) % 12;
-  int doy = (153 * mp + 2) / 5 + day - 1;
-  int doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
-  return static_cast<std::int64_t>(era) * 146097 + doe - 719468;
-}
-
 // "1-Feb-2026" as a day number (days since 1970 of that calendar date).
 std::optional<std::int64_t> parse_day(std::string_view s) {
   static const char* const kMonths[] = {"jan", "feb", "mar", "apr", "may", "jun",
@@ -246,14 +237,7 @@ std::optional<std::int64_t> parse_day(std::string_view s) {
     if (str_iequals(mon, kMonths[m])) month = m;
   }
   if (month < 0 || day < 1 || day > 31 || year < 1900 || year > 9999) return std::nullopt;
-  return day_number(year, month, day);
-}
-
-// The local calendar day of a time, on the same scale.
-std::int64_t day_of(std::time_t t) {
-  std::tm tm{};
-  if (!localtime_r(&t, &tm)) return 0;
-  return day_number(tm.tm_year + 1900, tm.tm_mon, tm.tm_mday);
+  return imap_day_number(year, month, day);
 }
 
 // An APPEND date-time "dd-Mon-yyyy hh:mm:ss +zzzz"; nullopt when malformed.
@@ -550,12 +534,6 @@ class ImapSession final : public Session {
   // The one argument of a command that takes a mailbox name; BAD otherwise.
   static std::optional<std::string> one_name(Connection& c, const std::string& tag, Args& a);
   Mailbox* open_box(std::string_view name, bool create_inbox);
-  // The names subscribed to, kept in the home's mail folder (one a line),
-  // read afresh each time so every session of the user sees the same.
-  std::vector<std::string> subscriptions() const;
-  int save_subscriptions(const std::vector<std::string>& names) const;
-  // A mailbox (or folder) renamed or deleted takes its subscriptions along.
-  void resubscribe(std::string_view from, std::optional<std::string_view> to) const;
 
   // Commands.
   void cmd_capability(Connection&, const std::string&, Args&, bool);
@@ -598,16 +576,28 @@ class ImapSession final : public Session {
   void finish_append(Connection& c);
   void finish_copy(Connection& c);
 
-  // Search.
-  struct SearchKey;
-  bool search_keys(Args& a, std::vector<SearchKey>& out, int depth);
-  bool search_key(Args& a, SearchKey& out, int depth);
-  bool matches(const SearchKey& k, std::size_t i);
+  // Search: the keys read into a query (counted against the limits), then
+  // run a slice at a time; one that is not done in its first slice goes on
+  // in the background while the connection's input waits.
+  struct SearchBuild {
+    SearchQuery query;
+    std::size_t keys = 0;
+    bool over_limit = false;
+  };
+  struct SearchJob {
+    std::string tag;
+    bool uid_mode = false;
+    SearchRun run;
+  };
+  bool search_keys(Args& a, std::vector<SearchKey>& out, int depth, SearchBuild& b);
+  bool search_key(Args& a, SearchKey& out, int depth, SearchBuild& b);
+  bool search_step(Connection& c);
 
   // Who.
   Auth auth_ = Auth::none;
   std::string user_, home_;
   int failed_logins_ = 0;
+  std::optional<Subscriptions> subscriptions_;  // the user's, from login on
 
   // The command being read.
   std::string cmd_;  // in wire form, literals included
@@ -620,6 +610,7 @@ class ImapSession final : public Session {
   std::string append_rest_;  // and what followed it
   Wait wait_ = Wait::none;
   std::string wait_tag_;
+  int turn_commands_ = 0;  // lines read in this pass of the loop
 
   // The selected mailbox.
   Mailbox* box_ = nullptr;
@@ -634,6 +625,8 @@ class ImapSession final : public Session {
   std::size_t announced_ = 0;         // the count the client was last told (EXISTS)
   std::size_t announced_recent_ = 0;  // ... and of recent messages
   std::unique_ptr<Stream> stream_;
+  std::unique_ptr<SearchJob> search_;
+  BackgroundWork search_work_;
 
   // COPY (or MOVE) waiting for delivery to finish writing.
   std::string copy_target_;
@@ -686,11 +679,14 @@ void ImapSession::on_open(Connection& c) {
 }
 
 void ImapSession::on_close(Connection& c, CloseReason) {
+  search_work_ = BackgroundWork();
+  search_.reset();
   deselect(c);
   append_file_.close();
 }
 
 void ImapSession::on_input(Connection& c) {
+  turn_commands_ = 0;  // a new pass of the loop
   if (stream_) stream_more(c);
   read_commands(c);
 }
@@ -772,6 +768,10 @@ void ImapSession::read_commands(Connection& c) {
       gated(c);
       return;
     }
+    if (cmd_.empty() && turn_commands_ >= kCommandsPerTurn) {
+      c.yield_turn();  // the others have their turn; this goes on at the next pass
+      return;
+    }
     // The tag of the line, should the line turn out too long.
     std::string tag;
     if (cmd_.empty()) {
@@ -783,6 +783,7 @@ void ImapSession::read_commands(Connection& c) {
     std::string_view line;
     LineResult r = c.read_line(line);
     if (r == LineResult::need_more) return;
+    ++turn_commands_;
     if (r == LineResult::overlong) {
       c.send((tag.empty() ? std::string("*") : tag) + " BAD command line too long\r\n");
       reset_command();
@@ -1118,45 +1119,6 @@ Mailbox* ImapSession::open_box(std::string_view name, bool create_inbox) {
   return mailbox_lookup(path_of(name), home_);
 }
 
-std::vector<std::string> ImapSession::subscriptions() const {
-  std::vector<std::string> names;
-  SafeDir root;
-  UniqueFd fd;
-  if (!SafeDir::open_root(home_, root).ok() || !root.open_file(kSubscriptionFile, O_RDONLY, fd).ok()) return names;
-  std::string text;
-  char buf[4096];
-  for (;;) {
-    ssize_t n = ::read(fd.get(), buf, sizeof buf);
-    if (n <= 0 || text.size() > kSubscriptionBytes) break;
-    text.append(buf, static_cast<std::size_t>(n));
-  }
-  return imap_subscriptions_parse(text);
-}
-
-int ImapSession::save_subscriptions(const std::vector<std::string>& names) const {
-  std::string text = imap_subscriptions_text(names);
-  SafeDir root, mail;
-  SafeResult r = SafeDir::open_root(home_, root);
-  if (r.ok()) r = root.open_dir(path_dir(kSubscriptionFile), true, mail);
-  if (!r.ok()) return r.error ? r.error : EACCES;
-  return mail.replace_file(path_leaf(kSubscriptionFile), text);
-}
-
-void ImapSession::resubscribe(std::string_view from, std::optional<std::string_view> to) const {
-  std::vector<std::string> names = subscriptions(), kept;
-  bool changed = false;
-  for (std::string& n : names) {
-    bool under = n.size() > from.size() && n.starts_with(from) && n[from.size()] == '/';
-    if (n != from && !under) {
-      kept.push_back(std::move(n));
-      continue;
-    }
-    changed = true;
-    if (to) kept.push_back(std::string(*to) + n.substr(from.size()));
-  }
-  if (changed) save_subscriptions(kept);
-}
-
 // ---- commands: any state --------------------------------------------------------------
 
 // STARTTLS before login while TLS can be had; LOGINDISABLED where a
@@ -1276,6 +1238,7 @@ void ImapSession::cmd_login(Connection& c, const std::string& tag, Args& a, bool
   auth_ = Auth::authenticated;
   user_ = user->login;
   home_ = user->home;
+  subscriptions_.emplace(home_);
   c.set_user(user->login);
   c.set_group(group);
   log_message("Login:", user->login, logfac::imap);
@@ -1392,7 +1355,7 @@ void ImapSession::cmd_delete(Connection& c, const std::string& tag, Args& a, boo
     if (dir.open_dir("overview", false, overviews).ok()) overviews.remove(leaf);
   }
   dir.sync();
-  resubscribe(*name, std::nullopt);
+  subscriptions_->carry(*name, std::nullopt);
   c.send(tag + " OK delete completed\r\n");
 }
 
@@ -1451,7 +1414,7 @@ void ImapSession::cmd_rename(Connection& c, const std::string& tag, Args& a, boo
   }
   old_dir.sync();
   new_dir.sync();
-  if (!str_iequals(*from, "INBOX")) resubscribe(*from, *to);  // INBOX stays, empty
+  if (!str_iequals(*from, "INBOX")) subscriptions_->carry(*from, *to);  // INBOX stays, empty
   c.send(tag + " OK rename completed\r\n");
 }
 
@@ -1460,13 +1423,10 @@ void ImapSession::cmd_subscribe(Connection& c, const std::string& tag, Args& a, 
   if (!name) return;
   if (!name_checked(c, tag, *name)) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
-  std::vector<std::string> names = subscriptions();
-  if (std::find(names.begin(), names.end(), n) == names.end()) {
-    names.push_back(n);
-    if (int rc = save_subscriptions(names)) {
-      c.send(tag + " NO SUBSCRIBE failed: " + error_text(rc) + "\r\n");
-      return;
-    }
+  if (int rc = subscriptions_->add(n)) {
+    c.send(tag + (rc == E2BIG ? " NO [LIMIT] SUBSCRIBE failed: too many subscriptions\r\n"
+                              : " NO SUBSCRIBE failed: " + error_text(rc) + "\r\n"));
+    return;
   }
   c.send(tag + " OK SUBSCRIBE " + printable(n) + " completed\r\n");
 }
@@ -1475,15 +1435,9 @@ void ImapSession::cmd_unsubscribe(Connection& c, const std::string& tag, Args& a
   auto name = one_name(c, tag, a);
   if (!name) return;
   std::string n = str_iequals(*name, "INBOX") ? "INBOX" : *name;
-  std::vector<std::string> names = subscriptions();
-  auto it = std::find(names.begin(), names.end(), n);
-  if (it == names.end()) {
-    c.send(tag + " NO Mailbox not in subscribe list\r\n");
-    return;
-  }
-  names.erase(it);
-  if (int rc = save_subscriptions(names)) {
-    c.send(tag + " NO UNSUBSCRIBE failed: " + error_text(rc) + "\r\n");
+  if (int rc = subscriptions_->remove(n)) {
+    c.send(tag + (rc == ENOENT ? " NO Mailbox not in subscribe list\r\n"
+                               : " NO UNSUBSCRIBE failed: " + error_text(rc) + "\r\n"));
     return;
   }
   c.send(tag + " OK UNSUBSCRIBE " + printable(n) + " completed\r\n");
@@ -1579,7 +1533,7 @@ void ImapSession::cmd_lsub(Connection& c, const std::string& tag, Args& a, bool)
     return;
   }
   std::string out;
-  for (const std::string& n : subscriptions()) {
+  for (const std::string& n : subscriptions_->names()) {
     if (!list_match(n, *reference + *pattern)) continue;
     out += "* LSUB () \"/\" ";
     imap_append_string(out, n);
@@ -2037,57 +1991,25 @@ void ImapSession::stream_more(Connection& c) {
 
 // ---- SEARCH -------------------------------------------------------------------------
 
-struct ImapSession::SearchKey {
-  enum class Kind {
-    all,
-    set,
-    uid,
-    flag_on,
-    flag_off,
-    recent,
-    new_,
-    old,
-    keyword,
-    unkeyword,
-    before,
-    on,
-    since,
-    sent_before,
-    sent_on,
-    sent_since,
-    larger,
-    smaller,
-    header,
-    body,
-    text,
-    not_,
-    or_,
-    group
-  } kind = Kind::all;
-  std::uint32_t flag = 0;
-  std::vector<Range> set;
-  bool uid_star = false;
-  std::int64_t number = 0;
-  std::string field, value;
-  std::vector<SearchKey> sub;
-};
-
-bool ImapSession::search_keys(Args& a, std::vector<SearchKey>& out, int depth) {
+bool ImapSession::search_keys(Args& a, std::vector<SearchKey>& out, int depth, SearchBuild& b) {
   for (;;) {
     SearchKey k;
-    if (!search_key(a, k, depth)) return false;
+    if (!search_key(a, k, depth, b)) return false;
     out.push_back(std::move(k));
     if (a.end() || a.peek(')')) return true;
     if (!a.space()) return false;
   }
 }
 
-bool ImapSession::search_key(Args& a, SearchKey& k, int depth) {
+bool ImapSession::search_key(Args& a, SearchKey& k, int depth, SearchBuild& b) {
   using K = SearchKey::Kind;
-  if (depth > 32) return false;
+  if (depth > kSearchDepthLimit || ++b.keys > kSearchKeyLimit) {
+    b.over_limit = true;
+    return false;
+  }
   if (a.eat('(')) {
     k.kind = K::group;
-    if (!search_keys(a, k.sub, depth + 1)) return false;
+    if (!search_keys(a, k.sub, depth + 1, b)) return false;
     return a.eat(')');
   }
   std::string_view w = a.atom();
@@ -2142,39 +2064,27 @@ bool ImapSession::search_key(Args& a, SearchKey& k, int depth) {
     k.number = static_cast<std::int64_t>(std::min<std::uint64_t>(v, 1ULL << 62));
     return true;
   }
-  if (is("FROM") || is("TO") || is("CC") || is("BCC") || is("SUBJECT")) {
-    k.kind = K::header;
-    k.field = std::string(w);
-    auto v = arg();
+  auto text = [&](SearchAtom::Scope scope, std::optional<std::string> field) {
+    auto v = field ? arg() : std::nullopt;
     if (!v) return false;
-    k.value = *v;
+    k.kind = K::text;
+    k.atom = b.query.atom({.scope = scope, .field = std::move(*field), .needle = std::move(*v)});
     return true;
-  }
-  if (is("HEADER")) {
-    k.kind = K::header;
-    auto f = arg();
-    auto v = f ? arg() : std::nullopt;
-    if (!v) return false;
-    k.field = *f;
-    k.value = *v;
-    return true;
-  }
-  if (is("BODY") || is("TEXT")) {
-    k.kind = is("BODY") ? K::body : K::text;
-    auto v = arg();
-    if (!v) return false;
-    k.value = *v;
-    return true;
-  }
+  };
+  if (is("FROM") || is("TO") || is("CC") || is("BCC") || is("SUBJECT"))
+    return text(SearchAtom::Scope::header, std::string(w));
+  if (is("HEADER")) return text(SearchAtom::Scope::header, arg());
+  if (is("BODY")) return text(SearchAtom::Scope::body, std::string());
+  if (is("TEXT")) return text(SearchAtom::Scope::text, std::string());
   if (is("NOT")) {
     k.kind = K::not_;
     k.sub.resize(1);
-    return a.space() && search_key(a, k.sub[0], depth + 1);
+    return a.space() && search_key(a, k.sub[0], depth + 1, b);
   }
   if (is("OR")) {
     k.kind = K::or_;
     k.sub.resize(2);
-    return a.space() && search_key(a, k.sub[0], depth + 1) && a.space() && search_key(a, k.sub[1], depth + 1);
+    return a.space() && search_key(a, k.sub[0], depth + 1, b) && a.space() && search_key(a, k.sub[1], depth + 1, b);
   }
   if (is("UID")) {
     k.kind = K::uid;
@@ -2190,73 +2100,6 @@ bool ImapSession::search_key(Args& a, SearchKey& k, int depth) {
   k.kind = K::set;
   k.set = std::move(*set);
   return true;
-}
-
-bool ImapSession::matches(const SearchKey& k, std::size_t i) {
-  using K = SearchKey::Kind;
-  Entry& e = view_[i];
-  MessageRecord& m = *e.rec;
-  switch (k.kind) {
-    case K::all:
-      return true;
-    case K::set:
-      return in_set(k.set, static_cast<std::uint32_t>(i + 1));
-    case K::uid:
-      return in_set(k.set, e.uid);
-    case K::flag_on:
-      return (m.flags & k.flag) != 0;
-    case K::flag_off:
-      return (m.flags & k.flag) == 0;
-    case K::recent:
-      return e.recent;
-    case K::new_:
-      return e.recent && !(m.flags & msgflag::seen);
-    case K::old:
-      return !e.recent;
-    case K::keyword:
-      return false;
-    case K::unkeyword:
-      return true;
-    case K::before:
-      return day_of(m.internal_date) < k.number;
-    case K::on:
-      return day_of(m.internal_date) == k.number;
-    case K::since:
-      return day_of(m.internal_date) >= k.number;
-    case K::sent_before:
-      return m.sent_date && day_of(m.sent_date) < k.number;
-    case K::sent_on:
-      return m.sent_date && day_of(m.sent_date) == k.number;
-    case K::sent_since:
-      return m.sent_date && day_of(m.sent_date) >= k.number;
-    case K::larger:
-    case K::smaller: {
-      auto size = imap_message_size(*source_, m, e.offset);
-      if (!size) return false;
-      return k.kind == K::larger ? *size > static_cast<std::uint64_t>(k.number)
-                                 : *size < static_cast<std::uint64_t>(k.number);
-    }
-    case K::header: {
-      // The overview's first line of From, To and Subject answers most searches.
-      const std::string* known = str_iequals(k.field, "FROM")      ? &m.from
-                                 : str_iequals(k.field, "TO")      ? &m.to
-                                 : str_iequals(k.field, "SUBJECT") ? &m.subject
-                                                                   : nullptr;
-      if (known && !k.value.empty() && str_casestr(*known, k.value)) return true;
-      return imap_header_contains(*source_, m, e.offset, k.field, k.value);
-    }
-    case K::body:
-      return imap_text_contains(*source_, m, e.offset, k.value, TextScope::body);
-    case K::text:
-      return imap_text_contains(*source_, m, e.offset, k.value, TextScope::whole);
-    case K::not_:
-      return !matches(k.sub[0], i);
-    case K::or_:
-      return matches(k.sub[0], i) || matches(k.sub[1], i);
-    case K::group:
-      return std::all_of(k.sub.begin(), k.sub.end(), [&](const SearchKey& s) { return matches(s, i); });
-  }
-  return false;
 }
 
 void ImapSession::cmd_search(Connection& c, const std::string& tag, Args& a, bool uid) {
@@ -2276,18 +2119,42 @@ void ImapSession::cmd_search(Connection& c, const std::string& tag, Args& a, boo
       }
     }
   }
-  std::vector<SearchKey> keys;
-  if (!search_keys(a, keys, 0) || !a.end()) {
-    c.send(tag + " BAD SEARCH arguments invalid\r\n");
+  SearchBuild b;
+  if (!search_keys(a, b.query.keys, 0, b) || !a.end()) {
+    c.send(tag + (b.over_limit ? strprintf(" NO [LIMIT] SEARCH takes at most %zu keys, nested at most %d deep\r\n",
+                                           kSearchKeyLimit, kSearchDepthLimit)
+                               : std::string(" BAD SEARCH arguments invalid\r\n")));
     return;
   }
+  search_ = std::make_unique<SearchJob>(SearchJob{tag, uid, SearchRun(std::move(b.query), view_.size())});
+  if (search_step(c)) return;
+  // More than a slice: the rest runs in the background, and the next
+  // command waits for the answer.
+  c.pause_input();
+  search_work_ = BackgroundWork("IMAP search", [this] {
+    if (!search_ || !conn_ || conn_->closed()) return false;
+    if (!search_step(*conn_)) return true;
+    conn_->resume_input();
+    search_work_ = BackgroundWork();  // leaves the list (this slice runs on a copy)
+    return false;
+  });
+}
+
+// One slice of the SEARCH in hand; true (and the answer sent) once done.
+bool ImapSession::search_step(Connection& c) {
+  if (stale_) remerge();  // positions hold; records and offsets are refreshed
+  auto at = [this](std::size_t i) -> std::optional<SearchMessage> {
+    if (i >= view_.size() || !view_[i].rec) return std::nullopt;
+    const Entry& e = view_[i];
+    return SearchMessage{e.rec, e.offset, static_cast<std::uint32_t>(i + 1), e.uid, e.recent};
+  };
+  if (!search_->run.work(at, source_.get(), kSearchSlice)) return false;
   std::string out = "* SEARCH";
-  for (std::size_t i = 0; i < view_.size(); ++i) {
-    if (!view_[i].rec) continue;
-    if (std::all_of(keys.begin(), keys.end(), [&](const SearchKey& k) { return matches(k, i); }))
-      strappendf(out, " %u", uid ? view_[i].uid : static_cast<std::uint32_t>(i + 1));
-  }
-  c.send(out + "\r\n" + tag + " OK SEARCH completed\r\n");
+  for (std::size_t i : search_->run.matched())
+    strappendf(out, " %u", search_->uid_mode ? view_[i].uid : static_cast<std::uint32_t>(i + 1));
+  c.send(out + "\r\n" + search_->tag + " OK SEARCH completed\r\n");
+  search_.reset();
+  return true;
 }
 
 }  // namespace
@@ -2307,25 +2174,6 @@ bool imap_name_allowed(std::string_view name, bool pattern, bool folder) {
     if (slash == std::string_view::npos) return part.back() != '~';
     from = slash + 1;
   }
-}
-
-std::vector<std::string> imap_subscriptions_parse(std::string_view text) {
-  std::vector<std::string> names;
-  for (std::size_t from = 0; from < text.size();) {
-    std::size_t nl = text.find('\n', from);
-    if (nl == std::string_view::npos) break;  // a cut last line is not a name
-    std::string name(text.substr(from, nl - from));
-    if ((name == "INBOX" || imap_name_allowed(name)) && std::find(names.begin(), names.end(), name) == names.end())
-      names.push_back(std::move(name));
-    from = nl + 1;
-  }
-  return names;
-}
-
-std::string imap_subscriptions_text(const std::vector<std::string>& names) {
-  std::string text;
-  for (const std::string& n : names) text += n + "\n";
-  return text;
 }
 
 void imap_register() {

@@ -6,7 +6,6 @@
 
 #include <string>
 #include <string_view>
-#include <vector>
 
 namespace velmor {
 
@@ -19,11 +18,5 @@ void imap_register();
 // component, no last component ending in "~" (an expunge's temporary file).
 // `folder` allows one trailing "/" (CREATE of a folder).
 bool imap_name_allowed(std::string_view name, bool pattern = false, bool folder = false);
-
-// A user's subscriptions file: one name a line. Names that are not allowed,
-// repeats and a cut last line are dropped; imap_subscriptions_text writes
-// the names back in the same form.
-std::vector<std::string> imap_subscriptions_parse(std::string_view text);
-std::string imap_subscriptions_text(const std::vector<std::string>& names);
 
 }  // namespace velmor

@@ -6,12 +6,14 @@
 
 #include <filesystem>
 
+#include "core/background.h"
 #include "core/log.h"
 #include "core/network.h"
 #include "core/test_link.h"
 #include "core/tls.h"
 #include "core/util.h"
 #include "mail/imap_check.h"
+#include "mail/imap_subscriptions.h"
 #include "mail/mailbox.h"
 #include "mail/pop_server.h"
 #include "mail/queue_test_fixture.h"
@@ -299,6 +301,94 @@ TEST_F(ImapSessionTest, SearchAnswersTruly) {
   EXPECT_EQ(say(*link, "d SEARCH BEFORE 1-Jan-2024 (SUBJECT m1 UID 1:*)\r\n"),
             "* SEARCH 1\r\nd OK SEARCH completed\r\n");
   EXPECT_EQ(say(*link, "e SEARCH SINCE Feb-2026\r\n"), "e BAD SEARCH arguments invalid\r\n");
+  // A command holds at most 256 keys, nested at most 32 deep;
+  // two charsets are known.
+  std::string keys;
+  for (int i = 0; i < 256; ++i) keys += " 1";
+  auto nested = [](int depth) { return std::string(depth, '(') + "ALL" + std::string(depth, ')'); };
+  const std::string limit = "f NO [LIMIT] SEARCH takes at most 256 keys, nested at most 32 deep\r\n";
+  const std::string all = "* SEARCH 1 2 3\r\nf OK SEARCH completed\r\n";
+  const struct {
+    std::string command, reply;
+  } kLimits[] = {
+      {"SEARCH" + keys, "* SEARCH 1\r\nf OK SEARCH completed\r\n"},
+      {"SEARCH" + keys + " ALL", limit},
+      {"SEARCH " + nested(32), all},
+      {"SEARCH " + nested(33), limit},
+      {"SEARCH CHARSET UTF-8 SUBJECT m2", "* SEARCH 2\r\nf OK SEARCH completed\r\n"},
+      {"SEARCH CHARSET KOI8-R ALL", "f NO [BADCHARSET (US-ASCII UTF-8)] unknown charset\r\n"},
+  };
+  for (const auto& row : kLimits)
+    EXPECT_EQ(say(*link, "f " + row.command + "\r\n"), row.reply) << row.command.substr(0, 40);
+}
+
+// A SEARCH that reads message text runs a slice at a time in the
+// background: the session answers when it is done, its next command waits,
+// other sessions are served meanwhile, and a message another session
+// expunges in between is simply not found.
+TEST_F(ImapSessionTest, ABodySearchRunsInSlicesWhileOthersAreServed) {
+  std::vector<std::string> box;
+  for (int n = 1; n <= 24; ++n) box.push_back(message(n, std::string(100000, 'x') + (n % 5 ? "\r\n" : " Needle\r\n")));
+  inbox(box);
+  auto a = login();
+  auto b = login();
+  EXPECT_EQ(say(*a, "a1 SEARCH BODY nEEDLE\r\na2 NOOP\r\n"), "");
+  EXPECT_EQ(background_count(), 1u);
+  EXPECT_EQ(say(*b, "b1 NOOP\r\nb2 STORE 5 +FLAGS.SILENT (\\Deleted)\r\nb3 EXPUNGE\r\n"),
+            "b1 OK NOOP completed\r\nb2 OK STORE completed\r\n* 5 EXPUNGE\r\n* 23 EXISTS\r\nb3 OK EXPUNGE completed\r\n");
+  int rounds = 1;
+  while (background_round()) ++rounds;
+  EXPECT_GE(rounds, 4);
+  a->turn();
+  EXPECT_EQ(a->take(), "* SEARCH 10 15 20\r\na1 OK SEARCH completed\r\n* 5 EXPUNGE\r\na2 OK NOOP completed\r\n");
+  // A client gone in the middle of its search takes the work with it.
+  EXPECT_EQ(say(*b, "b4 UID SEARCH TEXT needle\r\n"), "");
+  b->vanish();
+  EXPECT_EQ(background_count(), 0u);
+}
+
+// A client pipelining a thousand SUBSCRIBEs gets sixteen answered per pass
+// of the loop, while others are served; each one appends a line to the
+// subscriptions file, which nothing rewrites until the lines that take
+// names out outnumber the names.
+TEST_F(ImapSessionTest, PipelinedCommandsTakeTurnsAndSubscriptionsAreAppended) {
+  auto a = login("");
+  auto b = login("");
+  a->hold_passes();
+  std::string subscribe, unsubscribe, names;
+  for (int i = 0; i < 1000; ++i) {
+    subscribe += "s" + std::to_string(i) + " SUBSCRIBE box" + std::to_string(i) + "\r\n";
+    if (i < 400) unsubscribe += "u" + std::to_string(i) + " UNSUBSCRIBE box" + std::to_string(i) + "\r\n";
+    names += "box" + std::to_string(i) + "\n";
+  }
+  sysio::reset();
+  a->feed(subscribe);
+  auto answered = [](const std::string& out) { return std::count(out.begin(), out.end(), '\n'); };
+  EXPECT_EQ(answered(a->take()), 16);
+  EXPECT_EQ(say(*b, "n NOOP\r\n"), "n OK NOOP completed\r\n");
+  int passes = 0;
+  while (a->pass()) ++passes;
+  EXPECT_EQ(passes, 62);
+  std::string rest = a->take();
+  EXPECT_EQ(answered(rest), 984);
+  EXPECT_TRUE(rest.ends_with("s999 OK SUBSCRIBE box999 completed\r\n"));
+  EXPECT_EQ(read_file(home + "/mail/.subscriptions"), names);
+  EXPECT_EQ(sysio::count(sysio::Op::rename) + sysio::count(sysio::Op::sync), 0u);
+  // Taking names out appends too, until the file is compacted once.
+  a->feed(unsubscribe);
+  while (a->pass()) {
+  }
+  EXPECT_EQ(answered(a->take()), 400);
+  EXPECT_EQ(sysio::count(sysio::Op::rename), 1u);
+  std::string file = read_file(home + "/mail/.subscriptions");
+  EXPECT_LT(file.size(), names.size());
+  EXPECT_EQ(imap_subscriptions_text(imap_subscriptions_parse(file)), names.substr(names.find("box400")));
+  EXPECT_EQ(say(*b, "l LSUB \"\" box99*\r\n"),
+            "* LSUB () \"/\" \"box990\"\r\n* LSUB () \"/\" \"box991\"\r\n* LSUB () \"/\" \"box992\"\r\n"
+            "* LSUB () \"/\" \"box993\"\r\n* LSUB () \"/\" \"box994\"\r\n* LSUB () \"/\" \"box995\"\r\n"
+            "* LSUB () \"/\" \"box996\"\r\n* LSUB () \"/\" \"box997\"\r\n* LSUB () \"/\" \"box998\"\r\n"
+            "* LSUB () \"/\" \"box999\"\r\nl OK LSUB completed\r\n");
+  EXPECT_EQ(say(*b, "m UNSUBSCRIBE box0\r\n"), "m NO Mailbox not in subscribe list\r\n");
 }
 
 TEST_F(ImapSessionTest, UidValidityIsKeptAndNewOnlyForALostOverviewAndFlagsOutliveARebuild) {

@@ -6,6 +6,7 @@
 #include <string_view>
 
 #include "mail/imap_server.h"
+#include "mail/imap_subscriptions.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   using namespace velmor;

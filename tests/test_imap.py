@@ -1,6 +1,7 @@
 """Mail kept on the server: SMTP in, maildebatch, and IMAP out, with real
 clients (imaplib, curl, mbsync, offlineimap) and with bad input."""
 
+import base64
 import email
 import imaplib
 import os
@@ -236,6 +237,46 @@ class Extensions(ImapSuite):
         self.assertIn(b'Subject: two', fetch_one(m, '2', 'BODY.PEEK[HEADER]'))
         self.assertEqual(m.namespace(), ('OK', [b'(("" "/")) NIL NIL']))
         self.assertIn(b'(\\Trash) "/" "Trash"', b' '.join(m.list('""', '%')[1]))
+
+
+def encoded_words(text):
+    return '=?UTF-8?B?' + base64.b64encode(text.encode()).decode() + '?='
+
+
+class Searching(ImapSuite):
+    def search(self, m, key, text, charset='UTF-8'):
+        """SEARCH CHARSET UTF-8 <key> with the text as a literal, as clients send non-ASCII words."""
+        m.literal = text.encode()
+        typ, data = m.search(charset, key)
+        self.assertEqual(typ, 'OK')
+        return data[0].split()
+
+    def test_what_people_type_finds_decoded_headers_and_bodies(self):
+        self.send(
+            make_message(encoded_words('Встреча в пятницу'), body=b'see you\r\n'),
+            make_message('report', body=base64.encodebytes('Большой ОТЧЁТ готов\r\n'.encode()).replace(b'\n', b'\r\n'),
+                         extra=b'Content-Type: text/plain; charset=utf-8\r\nContent-Transfer-Encoding: base64\r\n'),
+            make_message('latin', body=b'Gr=FC=DFe aus M=FCn=\r\nchen\r\n',
+                         extra=b'Content-Type: text/plain; charset=iso-8859-1\r\n'
+                               b'Content-Transfer-Encoding: quoted-printable\r\n'),
+            make_message('koi8', body='Привет'.encode('koi8-r') + b'\r\n',
+                         extra=b'Content-Type: text/plain; charset=koi8-r\r\nContent-Transfer-Encoding: 8bit\r\n'))
+        m = self.imap()
+        m.select('INBOX')
+        for key, text, found in [
+                ('SUBJECT', 'пятниц', [b'1']),
+                ('SUBJECT', 'ПЯТНИЦУ', [b'1']),
+                ('TEXT', 'встреча', [b'1']),
+                ('BODY', 'отчёт', [b'2']),
+                ('BODY', 'ОТЧЁТ ГОТОВ', [b'2']),
+                ('BODY', 'münchen', [b'3']),
+                ('BODY', 'ПРИВЕТ', [b'4']),
+                ('TEXT', '0JLRgdGC', []),  # the encoded forms are not what is searched
+                ('BODY', '0JHQvtC7', []),
+                ('BODY', 'M=FCn', [])]:
+            self.assertEqual(self.search(m, key, text), found, (key, text))
+        self.assertEqual(m.search('US-ASCII', 'SUBJECT', 'report'), ('OK', [b'2']))
+        self.assertEqual(m.search('KOI8-R', 'ALL'), ('NO', [b'[BADCHARSET (US-ASCII UTF-8)] unknown charset']))
 
 
 class OtherClients(ImapSuite):
@@ -529,6 +570,9 @@ class BadInput(ImapSuite):
         self.assertEqual(m.store('5:*', '+FLAGS.SILENT', '(\\Deleted)')[0], 'OK')
         self.assertEqual(m.search(None, 'UNDELETED'), ('OK', [b'1 2 3 4']))
         self.assertEqual(m.uid('SEARCH', 'SINCE', '14-Nov-2023', 'UNDELETED'), ('OK', [b'1 2 3 4']))
+        # Reading every body takes more than one slice of the loop.
+        self.assertEqual(m.search(None, 'OR', 'BODY', '"body 4999"', 'SUBJECT', '"number 4998"'),
+                         ('OK', [b'4998 4999']))
 
 if __name__ == '__main__':
     unittest.main()
