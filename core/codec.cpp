@@ -11,15 +11,6 @@ namespace {
 
 constexpr char kBase64[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 
-int base64_value(char c) {
-  if (c >= 'A' && c <= 'Z') return c - 'A';
-  if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-  if (c >= '0' && c <= '9') return c - '0' + 52;
-  if (c == '+') return 62;
-  if (c == '/') return 63;
-  return -1;
-}
-
 // Three bytes (zero-padded) as four 6-bit values.
 void split_group(std::string_view data, std::size_t i, int out[4]) {
   unsigned v = static_cast<unsigned char>(data[i]) << 16;
@@ -30,6 +21,15 @@ void split_group(std::string_view data, std::size_t i, int out[4]) {
 
 }  // namespace
 
+int base64_digit(char c) {
+  if (c >= 'A' && c <= 'Z') return c - 'A';
+  if (c >= 'a' && c <= 'z') return c - 'a' + 26;
+  if (c >= '0' && c <= '9') return c - '0' + 52;
+  if (c == '+') return 62;
+  if (c == '/') return 63;
+  return -1;
+}
+
 std::string base64_decode(std::string_view text) {
   std::size_t i = 0;
   while (i < text.size() && (text[i] == ' ' || text[i] == '\t')) ++i;
@@ -38,7 +38,7 @@ std::string base64_decode(std::string_view text) {
   unsigned acc = 0;
   int bits = 0;
   for (; i < text.size(); ++i) {
-    int v = base64_value(text[i]);
+    int v = base64_digit(text[i]);
     if (v < 0) break;  // "=" padding or anything else ends the data
     acc = (acc << 6) | static_cast<unsigned>(v);
     bits += 6;

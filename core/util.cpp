@@ -23,12 +23,6 @@ inline bool is_alpha(char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <
 inline bool is_blank(char c) { return c == ' ' || c == '\t'; }
 inline bool is_separator(char c) { return c == ',' || is_blank(c); }
 
-int hex_value(char c) {
-  if (is_digit(c)) return c - '0';
-  unsigned char l = lower(c);
-  return (l >= 'a' && l <= 'f') ? l - 'a' + 10 : -1;
-}
-
 // Calls `f` for each item of a list separated by commas, blanks or tabs;
 // stops early when `f` returns true, and returns whether one did.
 template <class F>
@@ -72,6 +66,12 @@ std::string format_time(std::time_t t, const char* format) {
 }
 
 }  // namespace
+
+int hex_digit(char c) {
+  if (is_digit(c)) return c - '0';
+  unsigned char l = lower(c);
+  return (l >= 'a' && l <= 'f') ? l - 'a' + 10 : -1;
+}
 
 // ---- comparison ----------------------------------------------------------------
 
@@ -570,8 +570,8 @@ int url_decode(std::string& text) {
     if (c == '+') {
       c = ' ';
     } else if (c == '%') {
-      int hi = i + 2 < text.size() ? hex_value(text[i + 1]) : -1;
-      int lo = i + 2 < text.size() ? hex_value(text[i + 2]) : -1;
+      int hi = i + 2 < text.size() ? hex_digit(text[i + 1]) : -1;
+      int lo = i + 2 < text.size() ? hex_digit(text[i + 2]) : -1;
       if (hi >= 0 && lo >= 0) {
         c = static_cast<char>(hi * 16 + lo);
         if (c == '\0') result = 2;

@@ -87,6 +87,10 @@ int form_file_copy(CacheFile& file, std::string_view name, CacheFile& destinatio
 std::string form_text(std::string_view text);
 
 // ---- encodings ------------------------------------------------------------
+// The value of one hexadecimal digit (either case) or Base64 character; -1
+// for any other character.
+int hex_digit(char c);
+int base64_digit(char c);
 std::string base64_decode(std::string_view text);
 std::string base64_encode(std::string_view data);
 std::string uu_encode(std::string_view data);

@@ -751,10 +751,9 @@ class Renderer {
     return h + "\r\n";
   }
 
-  // One part's text (see body_text); a part that is not text adds nothing.
-  void part_text(std::uint64_t hs, std::uint64_t he, const Span& body, const MimePart* record, std::string& out,
-                 std::size_t cap, std::uint64_t& read) {
-    Fields h{"Content-Type", "Content-Transfer-Encoding"};
+  // A part's header fields [hs, he); where its header could not be found,
+  // what the record knows of it.
+  void part_fields(Fields& h, std::uint64_t hs, std::uint64_t he, const MimePart* record) {
     if (hs == he && record) {
       std::string made = part_header_text(*record);
       TextSource t(made);
@@ -762,6 +761,13 @@ class Renderer {
     } else {
       h.read(f_, hs, he);
     }
+  }
+
+  // One part's text (see body_text); a part that is not text adds nothing.
+  void part_text(std::uint64_t hs, std::uint64_t he, const Span& body, const MimePart* record, std::string& out,
+                 std::size_t cap, std::uint64_t& read) {
+    Fields h{"Content-Type", "Content-Transfer-Encoding"};
+    part_fields(h, hs, he, record);
     std::optional<MediaType> mt = h["Content-Type"] ? parse_media(*h["Content-Type"]) : std::nullopt;
     // (A multipart reaches here only when its parts could not be told apart.)
     if (mt && mt->type != "TEXT" && mt->type != "MESSAGE" && mt->type != "MULTIPART") return;
@@ -846,14 +852,7 @@ class Renderer {
   void leaf(std::string& o, std::uint64_t hs, std::uint64_t he, Span body, std::uint64_t lines, bool ext, int depth,
             bool in_digest, const MimePart* record = nullptr, bool opaque = false) {
     Fields h{"Content-Type", "Content-ID", "Content-Description", "Content-Transfer-Encoding"};
-    if (hs == he && record) {
-      // No header found: what the record knows of it.
-      std::string made = part_header_text(*record);
-      TextSource t(made);
-      h.read(t, 0, t.size());
-    } else {
-      h.read(f_, hs, he);
-    }
+    part_fields(h, hs, he, record);
     std::optional<MediaType> parsed = h["Content-Type"] ? parse_media(*h["Content-Type"]) : std::nullopt;
     MediaType mt = parsed ? *parsed : default_media(in_digest);
     bool message = mt.type == "MESSAGE" && mt.subtype == "RFC822";

@@ -48,22 +48,6 @@ void put_utf8(std::string& out, char32_t c) {
   }
 }
 
-int hex_value(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  return -1;
-}
-
-int base64_digit(char c) {
-  if (c >= 'A' && c <= 'Z') return c - 'A';
-  if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-  if (c >= '0' && c <= '9') return c - '0' + 52;
-  if (c == '+') return 62;
-  if (c == '/') return 63;
-  return -1;
-}
-
 // A charset's name as iconv is asked for it: lower case, its RFC 2231
 // language cut off; empty when it holds anything but letters, digits and
 // "-_.:+", so a sender's text never reaches iconv's module loader as a path.
@@ -185,8 +169,8 @@ std::string header_words_decode(std::string_view value) {
             TransferDecoder(TransferDecoder::Kind::base64).feed(text, run);
           } else {
             for (std::size_t k = 0; k < text.size(); ++k) {
-              int hi = k + 2 < text.size() && text[k] == '=' ? hex_value(text[k + 1]) : -1;
-              int lo = hi >= 0 ? hex_value(text[k + 2]) : -1;
+              int hi = k + 2 < text.size() && text[k] == '=' ? hex_digit(text[k + 1]) : -1;
+              int lo = hi >= 0 ? hex_digit(text[k + 2]) : -1;
               if (lo >= 0) {
                 run += static_cast<char>(hi * 16 + lo);
                 k += 2;
@@ -276,7 +260,7 @@ void TransferDecoder::feed(std::string_view in, std::string& out) {
       pending_ = std::string(in.substr(i));
       return;
     }
-    int hi = hex_value(in[i + 1]), lo = hex_value(in[i + 2]);
+    int hi = hex_digit(in[i + 1]), lo = hex_digit(in[i + 2]);
     if (hi < 0 || lo < 0) {
       out += '=';  // not an escape: kept as it is
       continue;
