@@ -8,24 +8,29 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <charconv>
 #include <chrono>
 #include <ctime>
 #include <deque>
 #include <map>
+#include <set>
 #include <unordered_map>
 #include <utility>
 
 #include "core/config.h"
 #include "core/connection.h"
+#include "core/filecache.h"
 #include "core/globals.h"
 #include "core/hooks.h"
 #include "core/log.h"
 #include "core/network.h"
 #include "core/strfmt.h"
+#include "core/textfile.h"
 #include "core/util.h"
 #include "mail/queue.h"
 #include "mail/queue_internal.h"
 #include "mail/queue_text.h"
+#include "mail/recipient.h"
 
 namespace velmor {
 
@@ -41,14 +46,28 @@ constexpr std::size_t kBatch = 32;
 constexpr auto kBatchWait = std::chrono::milliseconds(500);
 // Messages received and not yet committed: no more are asked for.
 constexpr std::size_t kMaxUnsettled = 64;
+// The largest message fetched when the default group sets no mail.msg.size.
+constexpr std::uint64_t kMessageCeiling = 64ull * 1024 * 1024;
 
 class PopClientSession;
+
+// What the client knows of an account's messages between sessions. A
+// message is known by its UIDL, or, on a server without UIDL, by " <number>"
+// (no UIDL holds a blank), which holds only for a session that follows one
+// cut short (it deleted nothing, so the numbers stand) and is never saved.
+struct Memory {
+  std::set<std::string> done;     // in the queue: skipped, and deleted unless kept
+  std::set<std::string> too_big;  // left on the server as over the limit
+  std::string path;                // the state file `done` is kept in
+  bool dirty = false;              // `done` is not yet in the state file
+};
 
 struct PopClient {
   // Accounts with a connection (user, host and port): the serial of the
   // session that holds each, which alone may free it.
   std::map<std::string, std::uint64_t> busy;
   std::unordered_map<std::uint64_t, PopClientSession*> live;  // by serial, for the commits
+  std::map<std::string, Memory> memory;                       // by account
   std::uint64_t next_serial = 1;
   std::time_t next_run = 0;
 };
@@ -61,11 +80,56 @@ std::string account_key(const PopAccount& a) {
   return a.user + '\n' + a.host + ':' + std::to_string(a.port);
 }
 
+bool number_key(std::string_view id) { return !id.empty() && id.front() == ' '; }
+
+// The account's state file: beside the incoming folder, named by a digest
+// of the account, so any user or host name makes a plain file name.
+std::string state_path(const std::string& key) {
+  return path_join(path_join(path_dir(queue_incoming_dir()), "pop"), md5_hex(key));
+}
+
+Memory& memory_of(const std::string& key) { return client().memory[key]; }
+
+// Writes the account's record of queued messages when it changed: a
+// temporary file, synced and renamed into place (an empty record removes
+// the file).
+void save_memory(const std::string& key, const PopAccount& account) {
+  Memory& m = memory_of(key);
+  if (!m.dirty) return;
+  std::string text = pop_state_text(account, m.done);
+  int rc = 0;
+  if (text.empty()) {
+    if (rc = filecache_delete(m.path); rc == ENOENT) rc = 0;
+  } else {
+    make_path(std::string(path_dir(m.path)));
+    rc = file_write_atomic(m.path, text, false, 0600);
+  }
+  if (rc != 0) {
+    log_write(strprintf("POP client: the record of %s's fetched messages could not be saved: %s",
+                        account.address().c_str(), error_text(rc).c_str()),
+              logchan::errors);
+    return;
+  }
+  m.dirty = false;
+}
+
 class PopClientSession final : public Session {
  public:
-  explicit PopClientSession(PopAccount account)
+  // `follows_cut` for the session that carries on a run cut short.
+  PopClientSession(PopAccount account, bool follows_cut)
       : account_(std::move(account)), key_(account_key(account_)), serial_(client().next_serial++) {
     client().live[serial_] = this;
+    const std::uint32_t limit = group_message_limit(group_of_sender(account_.address()));
+    limit_ = limit ? limit : kMessageCeiling;
+    if (!follows_cut) {
+      // The state file is what counts (whoever changed it meanwhile).
+      Memory& m = memory_of(key_);
+      m.path = state_path(key_);
+      auto text = read_text_file(m.path);
+      m.done = text ? pop_state_parse(*text) : std::set<std::string>{};
+      m.dirty = false;
+      std::erase_if(m.too_big, number_key);
+    }
   }
   ~PopClientSession() override { release(); }
 
@@ -78,11 +142,11 @@ class PopClientSession final : public Session {
   std::uint64_t serial() const { return serial_; }
 
  private:
-  enum class Command { greeting, stls, user, pass, capa, stat, retr, dele, quit };
+  enum class Command { greeting, stls, user, pass, capa, stat, list, uidl, retr, dele, quit };
   enum class Reading {
-    reply,         // status lines
-    capabilities,  // the lines of a CAPA answer, up to "."
-    message,       // a message, up to its terminator line
+    reply,    // status lines
+    listing,  // the lines of a CAPA, LIST or UIDL answer, up to "."
+    message,  // a message, up to its terminator line
   };
   struct Finished {
     std::string path, hidden;
@@ -91,10 +155,18 @@ class PopClientSession final : public Session {
 
   void send(Connection& c, Command command, std::string_view text, std::uint32_t number = 0);
   void reply(Connection& c, std::string_view line);
+  void listing_line(std::string_view line);
+  void listing_done(Connection& c, Command done);
+  static const char* command_name(Command command);
   void stat(Connection& c, std::string_view line);
+  void plan();
+  std::string id_of(std::uint32_t number) const {
+    return uids_.size() >= number && !uids_[number - 1].empty() ? uids_[number - 1] : " " + std::to_string(number);
+  }
   void start_message(std::uint32_t number);
   bool read_message(Connection& c);
   void finish_message(Connection& c);
+  void over_limit(Connection& c);
   void hand_over();
   void pump(Connection& c);
   void give_up(Connection& c) {
@@ -108,21 +180,32 @@ class PopClientSession final : public Session {
   const PopAccount account_;
   const std::string key_;
   const std::uint64_t serial_;
+  std::uint64_t limit_ = kMessageCeiling;  // the largest message taken
   Connection* conn_ = nullptr;
   std::string trace_;  // the Received: lines before their date
 
   std::deque<std::pair<Command, std::uint32_t>> sent_;  // awaiting their replies, in order
   Reading reading_ = Reading::reply;
+  Command listing_ = Command::capa;  // what the lines being read answer
   bool pipelining_ = false;
-  bool counted_ = false;       // STAT has answered: messages may be asked for
-  std::uint32_t next_ = 0;     // the next message to ask for (0: none left)
+  // STAT's count, then what LIST and UIDL said of each message (by number - 1).
+  std::uint32_t count_ = 0;
+  std::vector<std::uint64_t> sizes_;
+  std::vector<std::string> uids_;
+  bool uidl_listed_ = false;
+  std::deque<Command> listings_;  // LIST and UIDL, still to send
+  int listings_out_ = 0;          // sent, not yet answered in full
+  bool planned_ = false;          // the listings are in: messages may be asked for
+  std::deque<std::uint32_t> to_fetch_;  // highest first
   int retrs_out_ = 0;          // RETR commands not yet answered in full
   bool stopping_ = false;      // ask for nothing more; settle and QUIT
   bool quit_sent_ = false;
+  bool cut_ = false;           // ended over a message too large: the run goes on without it
   bool released_ = false;
 
   // The message arriving.
   std::uint32_t number_ = 0;
+  std::uint64_t received_ = 0;
   PendingIncoming file_;
   bool write_failed_ = false;
   MessageReceiver receiver_;
@@ -142,6 +225,7 @@ void PopClientSession::release() {
   client().live.erase(serial_);
   if (auto it = client().busy.find(key_); it != client().busy.end() && it->second == serial_) client().busy.erase(it);
   discard_unsettled();
+  save_memory(key_, account_);
   if (client().live.empty() && (status_bits & status::pop_client_running))
     status_bits = (status_bits & ~status::pop_client_running) | status::pop_client_ended | status::changed;
 }
@@ -170,6 +254,12 @@ void PopClientSession::on_open(Connection& c) {
   log_message("POP3 client connected to: ", c.peer().text, logfac::house);
 }
 
+const char* PopClientSession::command_name(Command command) {
+  static const char* const names[] = {"the greeting", "STLS", "USER", "PASS", "CAPA", "STAT",
+                                      "LIST",         "UIDL", "RETR", "DELE", "QUIT"};
+  return names[static_cast<int>(command)];
+}
+
 void PopClientSession::on_close(Connection&, CloseReason reason) {
   if (reason == CloseReason::lookup_failed || reason == CloseReason::connect_failed) {
     log_message("POP client fail", {}, logfac::pop);
@@ -179,11 +269,28 @@ void PopClientSession::on_close(Connection&, CloseReason reason) {
                           "password is not sent",
                           account_.host.c_str()));
   } else if (!quit_sent_ && reason != CloseReason::requested) {
-    log_message(strprintf("POP client - connection to %s ended (%s) after %u messages", account_.host.c_str(),
-                          close_reason_text(reason), fetched_));
+    // Where it stood: what a silent or confused server left it waiting for.
+    std::string waiting;
+    if (reading_ == Reading::message) {
+      waiting = strprintf(", in the middle of message %u", number_);
+    } else if (reading_ == Reading::listing) {
+      waiting = strprintf(", waiting for the end of the answer to %s", command_name(listing_));
+    } else if (!sent_.empty()) {
+      waiting = strprintf(", waiting for the answer to %s", command_name(sent_.front().first));
+      if (sent_.front().second) waiting += " " + std::to_string(sent_.front().second);
+    }
+    log_message(strprintf("POP client - connection to %s ended (%s) after %u messages%s", account_.host.c_str(),
+                          close_reason_text(reason), fetched_, waiting.c_str()));
   }
   log_message("POP client dispose", {}, logfac::pop);
   conn_ = nullptr;
+  if (cut_) {
+    // The rest of the run goes on over a new connection, which skips the
+    // message too large and deletes what this one queued.
+    auto next = std::make_unique<PopClientSession>(account_, true);
+    client().busy[key_] = next->serial();
+    connect_to(svc::pop_client, account_.host, account_.port, std::move(next));
+  }
   release();
 }
 
@@ -208,12 +315,13 @@ void PopClientSession::on_input(Connection& c) {
       c.close_now();
       return;
     }
-    if (reading_ == Reading::capabilities) {
+    if (reading_ == Reading::listing) {
       if (line == ".") {
         reading_ = Reading::reply;
-        send(c, Command::stat, "STAT\r\n");
-      } else if (str_iequals(trim_blanks(line), "PIPELINING")) {
-        pipelining_ = true;
+        listing_done(c, listing_);
+        pump(c);
+      } else {
+        listing_line(line);
       }
       continue;
     }
@@ -277,10 +385,13 @@ void PopClientSession::reply(Connection& c, std::string_view line) {
       send(c, Command::capa, "CAPA\r\n");
       break;
     case Command::capa:
+    case Command::list:
+    case Command::uidl:
       if (positive) {
-        reading_ = Reading::capabilities;
+        reading_ = Reading::listing;
+        listing_ = command;
       } else {
-        send(c, Command::stat, "STAT\r\n");
+        listing_done(c, command);  // a server without it
       }
       break;
     case Command::stat:
@@ -304,6 +415,39 @@ void PopClientSession::reply(Connection& c, std::string_view line) {
   }
 }
 
+// A line of a listing: a capability, or "<number> <size>" (LIST) or
+// "<number> <uidl>" (UIDL, 1 to 70 visible characters). Lines that are
+// none of these are passed over.
+void PopClientSession::listing_line(std::string_view line) {
+  if (listing_ == Command::capa) {
+    if (str_iequals(trim_blanks(line), "PIPELINING")) pipelining_ = true;
+    return;
+  }
+  std::size_t blank = line.find(' ');
+  if (blank == std::string_view::npos) return;
+  std::uint64_t n = 0;
+  auto r = std::from_chars(line.data(), line.data() + blank, n);
+  if (r.ec != std::errc() || r.ptr != line.data() + blank || n == 0 || n > count_) return;
+  std::string_view value = trim_blanks(line.substr(blank + 1));
+  if (listing_ == Command::list) {
+    std::uint64_t size = 0;
+    auto s = std::from_chars(value.data(), value.data() + value.size(), size);
+    if (s.ec == std::errc()) sizes_[n - 1] = size;
+  } else if (pop_uidl_valid(value)) {
+    uids_[n - 1] = std::string(value);
+    uidl_listed_ = true;
+  }
+}
+
+// The answer to CAPA, LIST or UIDL is complete (or was a refusal).
+void PopClientSession::listing_done(Connection& c, Command done) {
+  if (done == Command::capa) {
+    send(c, Command::stat, "STAT\r\n");
+  } else if (--listings_out_ == 0 && listings_.empty()) {
+    plan();
+  }
+}
+
 void PopClientSession::stat(Connection& c, std::string_view line) {
   std::string_view rest = line.size() > 3 ? trim_blanks(line.substr(3)) : std::string_view();
   std::size_t digits = 0;
@@ -316,15 +460,57 @@ void PopClientSession::stat(Connection& c, std::string_view line) {
     return;
   }
   log_message("POP client fetching articles: ", line.substr(1, 128), logfac::house);
-  // The last message first, as the queue has always received them.
-  next_ = static_cast<std::uint32_t>(count);
-  counted_ = true;
+  count_ = static_cast<std::uint32_t>(count);
+  if (count_ == 0) {
+    uidl_listed_ = true;  // an empty maildrop lists nothing: everything remembered is gone
+    plan();
+    return;
+  }
+  // The sizes (a message announced over the limit is not fetched) and the
+  // identifiers (a message queued before is not fetched again).
+  sizes_.assign(count_, 0);
+  uids_.assign(count_, {});
+  listings_ = {Command::list, Command::uidl};
+}
+
+// What to do with each message, the last one first, as the queue has always
+// received them: fetch it, delete it (queued before), or leave it (too large).
+void PopClientSession::plan() {
+  Memory& m = memory_of(key_);
+  if (uidl_listed_) {
+    // Messages no longer on the server are forgotten.
+    std::set<std::string> listed(uids_.begin(), uids_.end());
+    auto gone = [&listed](const std::string& id) { return !number_key(id) && !listed.count(id); };
+    if (std::erase_if(m.done, gone)) m.dirty = true;
+    std::erase_if(m.too_big, gone);
+  }
+  std::uint32_t known = 0;
+  for (std::uint32_t n = count_; n > 0; --n) {
+    std::string id = id_of(n);
+    if (m.done.count(id)) {
+      ++known;
+      if (!account_.keep) to_delete_.push_back(n);
+    } else if (m.too_big.count(id)) {
+      continue;
+    } else if (sizes_[n - 1] > limit_) {
+      m.too_big.insert(id);
+      log_message(strprintf("POP client - message %u of %s is %llu bytes, over the limit of %llu: left on the server",
+                            n, account_.address().c_str(), static_cast<unsigned long long>(sizes_[n - 1]),
+                            static_cast<unsigned long long>(limit_)));
+    } else {
+      to_fetch_.push_back(n);
+    }
+  }
+  if (known) log_message(strprintf("POP client - %u messages of %s were fetched before", known, account_.address().c_str()),
+                         {}, logfac::house);
+  planned_ = true;
 }
 
 // A positive answer to RETR: the message follows, into a hidden incoming
 // file behind its envelope and trace.
 void PopClientSession::start_message(std::uint32_t number) {
   number_ = number;
+  received_ = 0;
   reading_ = Reading::message;
   write_failed_ = false;
   receiver_ = MessageReceiver{};
@@ -352,12 +538,28 @@ bool PopClientSession::read_message(Connection& c) {
   // A line longer than the whole buffer is taken in parts.
   if (used == 0 && c.input_full()) used = receiver_.feed(in, true, chunk_, &headers_);
   c.consume(used);
+  received_ += used;
+  if (received_ > limit_) {
+    over_limit(c);
+    return false;
+  }
   if (!headers_.empty()) log_header_summary(static_cast<int>(c.id()), headers_);
   if (file_.file && !write_failed_ && !chunk_.empty() && filecache_write(file_.file, chunk_) != 0)
     write_failed_ = true;
   if (!receiver_.done()) return false;
   finish_message(c);
   return true;
+}
+
+// A message longer than the limit (whatever its size was said to be): it
+// is dropped and stays on the server, and since its end cannot be waited
+// for, the connection ends; a new one carries on with the rest.
+void PopClientSession::over_limit(Connection& c) {
+  log_message(strprintf("POP client - message %u of %s is over the limit of %llu bytes: dropped, left on the server",
+                        number_, account_.address().c_str(), static_cast<unsigned long long>(limit_)));
+  memory_of(key_).too_big.insert(id_of(number_));
+  cut_ = true;
+  c.close_now();
 }
 
 void PopClientSession::finish_message(Connection& c) {
@@ -390,11 +592,22 @@ void PopClientSession::hand_over() {
   if (conn_) conn_->wake_after(std::chrono::milliseconds(0));
   for (Finished& f : finished_) {
     ++committing_;
-    queue_commit_later(std::move(f.path), std::move(f.hidden), [serial = serial_, number = f.number](int error) {
-      auto& live = client().live;
-      auto it = live.find(serial);
-      if (it != live.end()) it->second->committed(number, error);
-    });
+    queue_commit_later(std::move(f.path), std::move(f.hidden),
+                       [serial = serial_, number = f.number, key = key_, account = account_, id = id_of(f.number)](
+                           int error) {
+                         auto& live = client().live;
+                         auto it = live.find(serial);
+                         if (it != live.end()) {
+                           it->second->committed(number, error);
+                         } else if (error == 0) {
+                           // The session has gone: the message is queued all
+                           // the same, and must not be fetched again.
+                           Memory& m = memory_of(key);
+                           m.done.insert(id);
+                           m.dirty = true;
+                           save_memory(key, account);
+                         }
+                       });
   }
   finished_.clear();
 }
@@ -403,8 +616,11 @@ void PopClientSession::committed(std::uint32_t number, int error) {
   --committing_;
   if (error != 0) {
     stop("an incoming file could not be committed");
-  } else if (!account_.keep) {
-    to_delete_.push_back(number);
+  } else {
+    Memory& m = memory_of(key_);
+    m.done.insert(id_of(number));
+    m.dirty = true;
+    if (!account_.keep) to_delete_.push_back(number);
   }
   if (conn_ && !conn_->closed()) pump(*conn_);
 }
@@ -415,28 +631,39 @@ void PopClientSession::stop(std::string_view why) {
   stopping_ = true;
 }
 
-// Sends what may go now: the DELEs of committed messages, the next RETRs,
-// and QUIT once everything asked for is settled.
+// Sends what may go now: the listings, the DELEs of committed messages, the
+// next RETRs, and QUIT once everything asked for is settled.
 void PopClientSession::pump(Connection& c) {
-  if (!counted_ || quit_sent_ || c.closed()) return;
-  const bool last = retrs_out_ == 0 && (next_ == 0 || stopping_);
-  if (finished_.size() >= kBatch || (last && !finished_.empty())) hand_over();
+  if (quit_sent_ || c.closed()) return;
   // Without pipelining a command waits for the whole answer to the last
   // one, a message included.
   auto room = [&] { return pipelining_ ? sent_.size() < kWindow : sent_.empty() && reading_ == Reading::reply; };
+  while (!listings_.empty() && room()) {
+    Command l = listings_.front();
+    listings_.pop_front();
+    ++listings_out_;
+    send(c, l, l == Command::list ? "LIST\r\n" : "UIDL\r\n");
+  }
+  if (!planned_) return;
+  const bool last = retrs_out_ == 0 && (to_fetch_.empty() || stopping_);
+  if (finished_.size() >= kBatch || (last && !finished_.empty())) hand_over();
   while (!to_delete_.empty() && room()) {
     std::uint32_t n = to_delete_.front();
     to_delete_.pop_front();
     send(c, Command::dele, strprintf("DELE %u\r\n", n), n);
   }
-  while (!stopping_ && next_ > 0 && room() && retrs_out_ < kRetrAhead &&
+  while (!stopping_ && !to_fetch_.empty() && room() && retrs_out_ < kRetrAhead &&
          finished_.size() + committing_ < kMaxUnsettled) {
-    send(c, Command::retr, strprintf("RETR %u\r\n", next_), next_);
-    --next_;
+    std::uint32_t n = to_fetch_.front();
+    to_fetch_.pop_front();
+    send(c, Command::retr, strprintf("RETR %u\r\n", n), n);
     ++retrs_out_;
   }
-  if ((next_ == 0 || stopping_) && retrs_out_ == 0 && finished_.empty() && committing_ == 0 &&
+  if ((to_fetch_.empty() || stopping_) && retrs_out_ == 0 && finished_.empty() && committing_ == 0 &&
       to_delete_.empty() && room()) {
+    // Recorded before QUIT lets the server delete: a session cut before
+    // QUIT's answer leaves the messages there, and the next one knows them.
+    save_memory(key_, account_);
     quit_sent_ = true;
     send(c, Command::quit, "QUIT\r\n");
   }
@@ -509,10 +736,38 @@ std::string pop_accounts_show(const std::vector<PopAccount>& accounts) {
   return out;
 }
 
+// ---- the record of fetched messages ------------------------------------------------
+
+bool pop_uidl_valid(std::string_view uidl) {
+  if (uidl.empty() || uidl.size() > 70) return false;
+  for (char ch : uidl) {
+    if (ch < 0x21 || ch > 0x7e) return false;
+  }
+  return true;
+}
+
+std::set<std::string> pop_state_parse(std::string_view text) {
+  std::set<std::string> ids;
+  for_each_line(text, [&](std::string_view line) {
+    if (pop_uidl_valid(line)) ids.emplace(line);
+  });
+  return ids;
+}
+
+std::string pop_state_text(const PopAccount& account, const std::set<std::string>& ids) {
+  std::string text;
+  for (const std::string& id : ids) {
+    if (!pop_uidl_valid(id)) continue;  // a number stands for one session only
+    if (text.empty()) text = strprintf("# messages of %s:%u already queued\n", account.address().c_str(), account.port);
+    text += id + "\n";
+  }
+  return text;
+}
+
 // ---- runs -----------------------------------------------------------------------
 
 std::unique_ptr<Session> pop_client_session(PopAccount account) {
-  return std::make_unique<PopClientSession>(std::move(account));
+  return std::make_unique<PopClientSession>(std::move(account), false);
 }
 
 int pop_fetch_run() {
@@ -532,7 +787,7 @@ int pop_fetch_run() {
     }
     std::string host = a.host;
     std::uint16_t port = a.port;
-    auto session = std::make_unique<PopClientSession>(std::move(a));
+    auto session = std::make_unique<PopClientSession>(std::move(a), false);
     pc.busy[key] = session->serial();
     if (connect_to(svc::pop_client, host, port, std::move(session))) ++started;
   }

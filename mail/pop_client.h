@@ -16,6 +16,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -58,6 +59,18 @@ std::vector<PopAccount> pop_accounts_parse(std::string_view text);
 // per account (the port when it is not the scheme's own); it parses back to
 // the same list.
 std::string pop_accounts_show(const std::vector<PopAccount>& accounts);
+
+// What the client remembers of an account: the UIDLs of the messages it
+// has queued, so that a session cut short (before QUIT's answer, which
+// lets the server delete them) never fetches them again. A UIDL is 1 to 70
+// visible characters. The state file holds one per line behind a comment
+// line that names the account; a line that is no UIDL (the comment holds
+// blanks) is passed over. An identifier the server no longer lists is
+// forgotten at the next session.
+bool pop_uidl_valid(std::string_view uidl);
+std::set<std::string> pop_state_parse(std::string_view text);
+// The file's text; empty when nothing is to be remembered.
+std::string pop_state_text(const PopAccount& account, const std::set<std::string>& ids);
 
 // Registers service 31 and fills hooks.popkick and hooks.pop_client_count.
 void pop_client_register();

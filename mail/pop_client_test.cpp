@@ -4,11 +4,13 @@
 #include "mail/pop_client.h"
 
 #include <algorithm>
+#include <filesystem>
 
 #include "core/connection.h"
 #include "core/hooks.h"
 #include "core/network.h"
 #include "core/test_link.h"
+#include "core/util.h"
 #include "mail/queue_test_fixture.h"
 #include "mail/queue_text.h"
 
@@ -60,11 +62,22 @@ TEST(PopAccounts, SchemesAskForTls) {
   EXPECT_EQ(pop_accounts_show(pop_accounts_parse(shown)), shown);
 }
 
-// The server's side of a login; with `pipelining` its CAPA offers it.
-std::string login(bool pipelining, int messages) {
-  return "+OK ready\r\n+OK\r\n+OK\r\n" + std::string(pipelining ? "+OK\r\nUIDL\r\nPIPELINING\r\n.\r\n" : "-ERR\r\n") +
-         "+OK " + std::to_string(messages) + " 999\r\n";
+// The server's side of a login; with `pipelining` its CAPA offers it. Its
+// messages are listed as 10 bytes each, with the UIDLs u<first>, u<first + 1> ...
+std::string login(bool pipelining, int messages, int first = 1) {
+  std::string out = "+OK ready\r\n+OK\r\n+OK\r\n" +
+                    std::string(pipelining ? "+OK\r\nUIDL\r\nPIPELINING\r\n.\r\n" : "-ERR\r\n") + "+OK " +
+                    std::to_string(messages) + " 999\r\n";
+  if (messages == 0) return out;
+  std::string list = "+OK\r\n", uidl = "+OK\r\n";
+  for (int n = 1; n <= messages; ++n) {
+    list += std::to_string(n) + " 10\r\n";
+    uidl += std::to_string(n) + " u" + std::to_string(first + n - 1) + "\r\n";
+  }
+  return out + list + ".\r\n" + uidl + ".\r\n";
 }
+// What the client says up to its listings.
+const std::string kLoggedIn = "USER acct\r\nPASS secret\r\nCAPA\r\nSTAT\r\nLIST\r\nUIDL\r\n";
 
 class PopClientTest : public QueueFixture {
  protected:
@@ -91,7 +104,7 @@ class PopClientTest : public QueueFixture {
 TEST_F(PopClientTest, MessagesEndAtTheirTerminatorAndAreDeletedOnlyOnceCommitted) {
   auto link = connect();
   link->feed(login(true, 3), 3);
-  EXPECT_EQ(link->take(), "USER acct\r\nPASS secret\r\nCAPA\r\nSTAT\r\nRETR 3\r\nRETR 2\r\nRETR 1\r\n");
+  EXPECT_EQ(link->take(), kLoggedIn + "RETR 3\r\nRETR 2\r\nRETR 1\r\n");
   // Sizes announced wrongly or not at all, a body line that looks like a
   // reply, a stuffed dot, and an empty message.
   const std::string three = "Subject: three\r\n\r\n+OK 5\r\n..dot\r\n.\r\n";
@@ -99,8 +112,9 @@ TEST_F(PopClientTest, MessagesEndAtTheirTerminatorAndAreDeletedOnlyOnceCommitted
   sysio::reset();
   link->feed("+OK 5 octets\r\n" + three + "+OK\r\n" + two + "+OK 100\r\n.\r\n", 7);
   // One commit for the three (a sync of the file system, one of the folder),
-  // then their deletions, pipelined with QUIT.
-  EXPECT_EQ(sysio::count(sysio::Op::sync), 2u);
+  // then their deletions, pipelined with QUIT behind the record of their
+  // UIDLs (its file synced, and its folder).
+  EXPECT_EQ(sysio::count(sysio::Op::sync), 4u);
   EXPECT_EQ(link->take(), "DELE 3\r\nDELE 2\r\nDELE 1\r\nQUIT\r\n");
   std::vector<std::string> files = queued();
   ASSERT_EQ(files.size(), 3u);
@@ -117,7 +131,7 @@ TEST_F(PopClientTest, MessagesEndAtTheirTerminatorAndAreDeletedOnlyOnceCommitted
 TEST_F(PopClientTest, WithoutPipeliningOneCommandAtATimeAndSeveralMessagesShareACommit) {
   auto link = connect();
   link->feed(login(false, 3));
-  EXPECT_EQ(link->take(), "USER acct\r\nPASS secret\r\nCAPA\r\nSTAT\r\nRETR 3\r\n");
+  EXPECT_EQ(link->take(), kLoggedIn + "RETR 3\r\n");
   sysio::reset();
   link->feed("+OK\r\nSubject: 3\r\n\r\n.\r\n");
   EXPECT_EQ(link->take(), "RETR 2\r\n");
@@ -183,6 +197,46 @@ TEST_F(PopClientTest, ADroppedConnectionLeavesNoPartialFileAndDeletesNothing) {
   third->connection().close_now(CloseReason::timed_out);
   EXPECT_TRUE(third->closed());
   EXPECT_TRUE(everything().empty());
+}
+
+// The UIDLs of queued messages are kept per account, so a session cut
+// before QUIT's answer (the server then deletes nothing) never brings them
+// twice: the next one deletes them unfetched, an account that keeps its
+// mail skips them, and those the server no longer lists are forgotten.
+TEST_F(PopClientTest, MessagesQueuedBeforeAreDeletedNotFetchedAndForgottenOnceGone) {
+  const std::string state_file = root + "/pop/" + md5_hex("acct\npop.isp.example:110");
+  const std::string header = "# messages of acct@pop.isp.example:110 already queued\n";
+  auto first = connect();
+  first->feed(login(true, 3));
+  first->take();
+  // The record's sync fails (the commit's two syncs come first): it is
+  // written again when the session ends.
+  sysio::fail_nth(sysio::Op::sync, 3);
+  first->feed("+OK\r\nSubject: 3\r\n\r\n.\r\n+OK\r\nSubject: 2\r\n\r\n.\r\n+OK\r\nSubject: 1\r\n\r\n.\r\n");
+  EXPECT_EQ(first->take(), "DELE 3\r\nDELE 2\r\nDELE 1\r\nQUIT\r\n");
+  EXPECT_FALSE(std::filesystem::exists(state_file));
+  first->finish();
+  EXPECT_EQ(read_file(state_file), header + "u1\nu2\nu3\n");
+
+  auto second = connect();
+  second->feed(login(true, 4));
+  EXPECT_EQ(second->take(), kLoggedIn + "DELE 3\r\nDELE 2\r\nDELE 1\r\nRETR 4\r\n");
+  second->feed("+OK\r\n+OK\r\n+OK\r\n+OK\r\nSubject: 4\r\n\r\n.\r\n");
+  EXPECT_EQ(second->take(), "DELE 4\r\nQUIT\r\n");
+  EXPECT_EQ(queued().size(), 4u);
+
+  auto kept = connect(true);
+  kept->feed(login(true, 4));
+  EXPECT_EQ(kept->take(), kLoggedIn + "QUIT\r\n");
+
+  // A message announced over the limit (64 MB when the default group sets
+  // none) is left on the server.
+  auto fourth = connect();
+  fourth->feed("+OK ready\r\n+OK\r\n+OK\r\n+OK\r\nPIPELINING\r\n.\r\n+OK 2 999\r\n+OK\r\n1 10\r\n2 67108865\r\n.\r\n"
+               "+OK\r\n1 u9\r\n2 u10\r\n.\r\n+OK\r\nSubject: 9\r\n\r\n.\r\n");
+  EXPECT_EQ(fourth->take(), kLoggedIn + "RETR 1\r\nDELE 1\r\nQUIT\r\n");
+  EXPECT_EQ(read_file(state_file), header + "u9\n");
+  EXPECT_EQ(queued().size(), 5u);
 }
 
 TEST_F(PopClientTest, RefusalsAndStrayRepliesEndTheConnection) {

@@ -167,6 +167,8 @@ CacheFile queue_create_incoming() {
   return f;
 }
 
+std::string queue_incoming_dir() { return incoming_dir(); }
+
 PendingIncoming queue_open_incoming_pending() {
   PendingIncoming p;
   p.path = queue_new_incoming_name();

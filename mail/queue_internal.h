@@ -94,6 +94,8 @@ struct PendingIncoming {
   std::string hidden;     // the name it is written under
 };
 PendingIncoming queue_open_incoming_pending();
+// The incoming folder (mail.dir.incoming).
+std::string queue_incoming_dir();
 // Queues a flushed file for the next commit; `done(error)` is called when it
 // has run (error 0: the file is in place, durable and in the incoming list;
 // otherwise the hidden file is gone). Whoever waits for `done` and may go

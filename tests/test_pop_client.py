@@ -55,15 +55,35 @@ def fetched_message(path):
 class PopServer(FakeServer):
     """A POP3 server on 127.0.0.1 for one account. `messages` is a list of
     (bytes, how): how is 'ok' ("+OK n octets"), 'bare' ("+OK" alone),
-    'wrong' (a size far too small), 'err' (RETR refused) or 'drop' (the
-    connection is cut half way through the message). Deletions apply at
-    QUIT; `commands` keeps every command line of every session."""
+    'wrong' (a size far too small), 'err' (RETR refused), 'drop' (the
+    connection is cut half way through the message), 'endless' (a message
+    that never ends, listed as small) or 'silent' (half a message, then
+    nothing). Each message has its UIDL; deletions apply at QUIT, unless
+    `cut_at_quit` (the connection is cut before QUIT's answer and nothing is
+    deleted). `short_listings` answers LIST and UIDL with one line, as if
+    they were not multi-line. `commands` keeps every command line of every
+    session."""
 
     def __init__(self, messages, pipelining=True):
-        self.messages = list(messages)
+        self.messages = []
+        self.uids = []
+        for text, how in messages:
+            self.add(text, how)
         self.pipelining = pipelining
+        self.cut_at_quit = False
+        self.short_listings = False
         self.commands = []
         super().__init__()
+
+    def add(self, text, how='ok'):
+        self.messages.append((text, how))
+        self.uids.append('uid-%d.%d' % (len(self.uids) + 1, id(self)))
+
+    def listing(self, conn, items):
+        if self.short_listings:
+            conn.sendall(b'+OK %d messages\r\n' % len(items))
+        else:
+            conn.sendall(b'+OK\r\n' + b''.join(b'%d %s\r\n' % (n, v) for n, v in enumerate(items, 1)) + b'.\r\n')
 
     def session(self, conn):
         f = conn.makefile('rb')
@@ -83,10 +103,22 @@ class PopServer(FakeServer):
                 conn.sendall(b'+OK\r\nUIDL\r\n' + (b'PIPELINING\r\n' if self.pipelining else b'') + b'.\r\n')
             elif verb == 'STAT':
                 conn.sendall(b'+OK %d %d\r\n' % (len(self.messages), sum(len(m) for m, _ in self.messages)))
+            elif verb == 'LIST':
+                self.listing(conn, [b'%d' % len(m) for m, _ in self.messages])
+            elif verb == 'UIDL':
+                self.listing(conn, [u.encode() for u in self.uids])
             elif verb == 'RETR':
                 text, how = self.messages[int(arg) - 1]
                 data = transmitted(text)
-                if how == 'err':
+                if how == 'endless':
+                    conn.sendall(b'+OK 100 octets\r\n' + text)
+                    while True:  # until the client hangs up
+                        conn.sendall((b'x' * 78 + b'\r\n') * 800)
+                elif how == 'silent':
+                    conn.sendall(b'+OK\r\n' + data[:len(data) // 2])
+                    f.read()  # nothing more, until the client hangs up
+                    return
+                elif how == 'err':
                     conn.sendall(b'-ERR message locked\r\n')
                 elif how == 'drop':
                     conn.sendall(b'+OK %d octets\r\n' % len(text) + data[:len(data) // 2])
@@ -99,7 +131,11 @@ class PopServer(FakeServer):
                 deleted.add(int(arg))
                 conn.sendall(b'+OK deleted\r\n')
             elif verb == 'QUIT':
-                self.messages = [m for n, m in enumerate(self.messages, 1) if n not in deleted]
+                if self.cut_at_quit:
+                    return
+                kept = [n for n in range(len(self.messages)) if n + 1 not in deleted]
+                self.messages = [self.messages[n] for n in kept]
+                self.uids = [self.uids[n] for n in kept]
                 conn.sendall(b'+OK bye\r\n')
                 return
             else:
@@ -182,18 +218,89 @@ class AwkwardServerTest(FetchCase):
         self.assertEqual(self.hidden(), [])
         for p in self.queued():
             self.assertNotIn(b'Subject: two', read(p))
-        # The next run fetches them all.
+        # The next run fetches the rest, each message once.
         server.messages[1] = (server.messages[1][0], 'ok')
-        before = len(self.queued())
         self.fetch_again()
-        self.assertEqual(len(self.queued()), before + 3)
+        self.assertEqual(self.subjects(), [b'one', b'three', b'two'])
         self.assertEqual(server.messages, [])
+
+    def test_an_endless_message_is_dropped_and_left_and_the_run_goes_on(self):
+        server = PopServer([(b'Subject: one\r\n\r\nbody\r\n', 'ok'), (b'Subject: endless\r\n\r\n', 'endless'),
+                            (b'Subject: three\r\n\r\nbody\r\n', 'ok')])
+        self.addCleanup(server.close)
+        self.start('acct:secret@127.0.0.1:%d' % server.port)
+        groups = self.suite.path('config/groups')
+        with open(groups) as f:
+            text = f.read()
+        with open(groups, 'w') as f:
+            f.write(re.sub(r'(?m)^%mail\.msg\.size: .*$', '%mail.msg.size: 64', text, count=1))
+        self.run_suite()
+        self.fetch()
+        self.assertEqual(self.subjects(), [b'one', b'three'])
+        self.assertEqual([m for m, _ in server.messages], [b'Subject: endless\r\n\r\n'])  # left there
+        self.assertEqual(self.hidden(), [])
+        self.assertIn('POP client - message 2 of acct@127.0.0.1 is over the limit of 65536 bytes: dropped, left on '
+                      'the server', self.suite.log('main'))
+        # Known from then on: the next run does not ask for it again.
+        retrs = server.commands.count('RETR 1')
+        self.fetch_again()
+        self.assertEqual(server.commands.count('RETR 1'), retrs)
+        self.assertEqual(len(self.queued()), 2)
+
+    def test_sessions_cut_before_quits_answer_queue_each_message_once(self):
+        server = self.serve([(b'Subject: one\r\n\r\nbody\r\n', 'ok'), (b'Subject: two\r\n\r\nbody\r\n', 'ok')])
+        server.cut_at_quit = True  # and the server deletes nothing
+        self.fetch()
+        self.fetch_again()
+        server.add(b'Subject: three\r\n\r\nbody\r\n')
+        self.fetch_again()
+        self.assertEqual(self.subjects(), [b'one', b'three', b'two'])
+        self.assertEqual([c for c in server.commands if c.startswith('RETR')], ['RETR 2', 'RETR 1', 'RETR 3'])
+        self.assertEqual(server.commands.count('DELE 1'), 3)
+        # Once the server has deleted them, they are forgotten.
+        record = [os.path.join(self.suite.path('mail/pop'), n) for n in os.listdir(self.suite.path('mail/pop'))]
+        self.assertEqual(len(record), 1)
+        self.assertEqual(read(record[0]).split(b'\n')[1:], [u.encode() for u in server.uids] + [b''])
+        server.cut_at_quit = False
+        self.fetch_again()
+        self.assertEqual(server.messages, [])
+        self.fetch_again()
+        self.assertFalse(os.path.exists(record[0]))
+        self.assertEqual(len(self.queued()), 3)
+
+    def subjects(self):
+        return sorted(re.search(rb'Subject: (\w+)', read(p)).group(1) for p in self.queued())
 
     def fetch_again(self):
         log = self.suite.log('main')
         self.suite.ctl('popkick')
         self.assertTrue(wait_for(lambda: self.suite.log('main').count('POP client dispose') > log.count(
             'POP client dispose')))
+
+
+class SilentServerTest(FetchCase):
+    """A server that goes silent half way through a message, and one that
+    answers LIST and UIDL with a single line: each connection gives up at
+    the time-out and says where it stood."""
+
+    def test_each_gives_up_at_its_time_out_and_logs_it(self):
+        silent = PopServer([(b'Subject: one\r\n\r\n' + b'body line\r\n' * 100, 'silent')])
+        short = PopServer([(b'Subject: two\r\n\r\nbody\r\n', 'ok')])
+        short.short_listings = True
+        for server in (silent, short):
+            self.addCleanup(server.close)
+        self.start('a:x@127.0.0.1:%d, b:y@127.0.0.1:%d' % (silent.port, short.port), **{'pop.sock.timeout': '2'})
+        self.run_suite()
+        self.suite.ctl('popkick')
+        log = lambda: self.suite.log('main')
+        self.assertTrue(wait_for(lambda: log().count('POP client dispose') == 2), log())
+        self.assertIn('POP client - connection to 127.0.0.1 ended (timed out) after 0 messages, in the middle of '
+                      'message 1', log())
+        self.assertIn('POP client - connection to 127.0.0.1 ended (timed out) after 0 messages, waiting for the end '
+                      'of the answer to LIST', log())
+        self.assertEqual(self.queued(), [])
+        self.assertEqual(self.hidden(), [])
+        self.assertEqual(len(silent.messages) + len(short.messages), 2)
 
 
 class FetchedMailDeliveryTest(FetchCase):
