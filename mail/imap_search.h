@@ -70,9 +70,9 @@ struct SearchKey {
 // field is there), the body's text, or either (TEXT).
 struct SearchAtom {
   enum class Scope { header, body, text } scope = Scope::body;
-  std::string field;   // for header
-  std::string needle;  // as the client wrote it
-  std::string folded;  // utf8_fold(needle)
+  std::string field{};   // for header
+  std::string needle{};  // as the client wrote it
+  std::string folded{};  // utf8_fold(needle)
   bool operator==(const SearchAtom& o) const { return scope == o.scope && field == o.field && needle == o.needle; }
 };
 
