@@ -375,6 +375,8 @@ struct Tree {
 
   explicit Tree(const std::list<MimePart>& list) {
     std::vector<std::size_t> stack;
+    parts.reserve(list.size());
+    children.reserve(list.size());
     for (const MimePart& p : list) {
       std::size_t i = parts.size();
       parts.push_back(&p);
