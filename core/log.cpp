@@ -227,7 +227,10 @@ void log_flush_all() {
   for (auto& f : files) flush(*f);
 }
 
+// One write for the whole block, however the channel is buffered: a
+// message's lines cost one append, not one each.
 void log_header_summary(std::string_view tag, std::string_view header_text) {
+  std::string block;
   std::string_view rest = header_text;
   while (!rest.empty()) {
     std::size_t end = rest.find('\n');
@@ -241,9 +244,10 @@ void log_header_summary(std::string_view tag, std::string_view header_text) {
       out += " - ";
       out += line;
       if (out.size() > 254) out.resize(254);
-      log_write(out, logchan::mail);
+      block += stamp() + out + '\n';
     }
   }
+  if (!block.empty()) log_write(block, logchan::mail, kLogNoStamp | kLogNoNewline);
 }
 
 }  // namespace velmor

@@ -162,6 +162,8 @@ TEST_F(LogTest, HeaderSummary) {
   EXPECT_EQ(text.find("lower"), std::string::npos);
   EXPECT_EQ(text.find("body line"), std::string::npos);
   EXPECT_NE(text.find("42 192.0.2.9 - To: " + std::string(254 - 19, 'z') + "\n"), std::string::npos);
+  EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), 5);  // a time stamp on each line
+  EXPECT_EQ(text.find("\n42"), std::string::npos) << text;
 }
 
 TEST_F(LogTest, MissingConfiguration) {
