@@ -7,6 +7,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <chrono>
@@ -160,8 +161,10 @@ class PopClientSession final : public Session {
   static const char* command_name(Command command);
   void stat(Connection& c, std::string_view line);
   void plan();
+  bool skipped(std::uint32_t number) const;
   std::string id_of(std::uint32_t number) const {
-    return uids_.size() >= number && !uids_[number - 1].empty() ? uids_[number - 1] : " " + std::to_string(number);
+    auto it = uids_.find(number);
+    return it != uids_.end() ? it->second : " " + std::to_string(number);
   }
   void start_message(std::uint32_t number);
   bool read_message(Connection& c);
@@ -188,15 +191,16 @@ class PopClientSession final : public Session {
   Reading reading_ = Reading::reply;
   Command listing_ = Command::capa;  // what the lines being read answer
   bool pipelining_ = false;
-  // STAT's count, then what LIST and UIDL said of each message (by number - 1).
+  // STAT's count, then what LIST and UIDL said of the messages (by number;
+  // only what the server sent, so a count it made up costs no memory).
   std::uint32_t count_ = 0;
-  std::vector<std::uint64_t> sizes_;
-  std::vector<std::string> uids_;
+  std::unordered_map<std::uint32_t, std::uint64_t> sizes_;
+  std::unordered_map<std::uint32_t, std::string> uids_;
   bool uidl_listed_ = false;
   std::deque<Command> listings_;  // LIST and UIDL, still to send
   int listings_out_ = 0;          // sent, not yet answered in full
   bool planned_ = false;          // the listings are in: messages may be asked for
-  std::deque<std::uint32_t> to_fetch_;  // highest first
+  std::uint32_t next_ = 0;     // the next message to consider, downwards (0: none left)
   int retrs_out_ = 0;          // RETR commands not yet answered in full
   bool stopping_ = false;      // ask for nothing more; settle and QUIT
   bool quit_sent_ = false;
@@ -432,9 +436,9 @@ void PopClientSession::listing_line(std::string_view line) {
   if (listing_ == Command::list) {
     std::uint64_t size = 0;
     auto s = std::from_chars(value.data(), value.data() + value.size(), size);
-    if (s.ec == std::errc()) sizes_[n - 1] = size;
+    if (s.ec == std::errc()) sizes_[static_cast<std::uint32_t>(n)] = size;
   } else if (pop_uidl_valid(value)) {
-    uids_[n - 1] = std::string(value);
+    uids_[static_cast<std::uint32_t>(n)] = std::string(value);
     uidl_listed_ = true;
   }
 }
@@ -468,42 +472,55 @@ void PopClientSession::stat(Connection& c, std::string_view line) {
   }
   // The sizes (a message announced over the limit is not fetched) and the
   // identifiers (a message queued before is not fetched again).
-  sizes_.assign(count_, 0);
-  uids_.assign(count_, {});
   listings_ = {Command::list, Command::uidl};
 }
 
 // What to do with each message, the last one first, as the queue has always
-// received them: fetch it, delete it (queued before), or leave it (too large).
+// received them: delete it unfetched (queued before), leave it (too large),
+// or fetch it. The first two are found from the listings and the record
+// (so this costs what they hold, whatever count STAT gave); pump asks for
+// the others as it counts down.
 void PopClientSession::plan() {
   Memory& m = memory_of(key_);
   if (uidl_listed_) {
     // Messages no longer on the server are forgotten.
-    std::set<std::string> listed(uids_.begin(), uids_.end());
+    std::set<std::string> listed;
+    for (const auto& [n, id] : uids_) listed.insert(id);
     auto gone = [&listed](const std::string& id) { return !number_key(id) && !listed.count(id); };
     if (std::erase_if(m.done, gone)) m.dirty = true;
     std::erase_if(m.too_big, gone);
   }
-  std::uint32_t known = 0;
-  for (std::uint32_t n = count_; n > 0; --n) {
-    std::string id = id_of(n);
-    if (m.done.count(id)) {
-      ++known;
-      if (!account_.keep) to_delete_.push_back(n);
-    } else if (m.too_big.count(id)) {
-      continue;
-    } else if (sizes_[n - 1] > limit_) {
-      m.too_big.insert(id);
-      log_message(strprintf("POP client - message %u of %s is %llu bytes, over the limit of %llu: left on the server",
-                            n, account_.address().c_str(), static_cast<unsigned long long>(sizes_[n - 1]),
-                            static_cast<unsigned long long>(limit_)));
-    } else {
-      to_fetch_.push_back(n);
-    }
+  std::vector<std::uint32_t> known;
+  for (const auto& [n, id] : uids_) {
+    if (m.done.count(id)) known.push_back(n);
   }
-  if (known) log_message(strprintf("POP client - %u messages of %s were fetched before", known, account_.address().c_str()),
-                         {}, logfac::house);
+  for (const std::string& id : m.done) {
+    if (!number_key(id)) continue;
+    std::uint32_t n = static_cast<std::uint32_t>(std::stoul(id.substr(1)));
+    if (n <= count_ && !uids_.count(n)) known.push_back(n);
+  }
+  std::sort(known.rbegin(), known.rend());
+  if (!account_.keep) to_delete_.insert(to_delete_.end(), known.begin(), known.end());
+  if (!known.empty())
+    log_message(strprintf("POP client - %zu messages of %s were fetched before", known.size(),
+                          account_.address().c_str()),
+                {}, logfac::house);
+  for (const auto& [n, size] : sizes_) {
+    if (size <= limit_ || skipped(n)) continue;
+    m.too_big.insert(id_of(n));
+    log_message(strprintf("POP client - message %u of %s is %llu bytes, over the limit of %llu: left on the server", n,
+                          account_.address().c_str(), static_cast<unsigned long long>(size),
+                          static_cast<unsigned long long>(limit_)));
+  }
+  next_ = count_;
   planned_ = true;
+}
+
+// A message not to be fetched: queued before, or too large.
+bool PopClientSession::skipped(std::uint32_t number) const {
+  const Memory& m = client().memory[key_];
+  std::string id = id_of(number);
+  return m.done.count(id) || m.too_big.count(id);
 }
 
 // A positive answer to RETR: the message follows, into a hidden incoming
@@ -645,21 +662,22 @@ void PopClientSession::pump(Connection& c) {
     send(c, l, l == Command::list ? "LIST\r\n" : "UIDL\r\n");
   }
   if (!planned_) return;
-  const bool last = retrs_out_ == 0 && (to_fetch_.empty() || stopping_);
+  while (next_ > 0 && skipped(next_)) --next_;
+  const bool last = retrs_out_ == 0 && (next_ == 0 || stopping_);
   if (finished_.size() >= kBatch || (last && !finished_.empty())) hand_over();
   while (!to_delete_.empty() && room()) {
     std::uint32_t n = to_delete_.front();
     to_delete_.pop_front();
     send(c, Command::dele, strprintf("DELE %u\r\n", n), n);
   }
-  while (!stopping_ && !to_fetch_.empty() && room() && retrs_out_ < kRetrAhead &&
+  while (!stopping_ && next_ > 0 && room() && retrs_out_ < kRetrAhead &&
          finished_.size() + committing_ < kMaxUnsettled) {
-    std::uint32_t n = to_fetch_.front();
-    to_fetch_.pop_front();
-    send(c, Command::retr, strprintf("RETR %u\r\n", n), n);
+    send(c, Command::retr, strprintf("RETR %u\r\n", next_), next_);
     ++retrs_out_;
+    --next_;
+    while (next_ > 0 && skipped(next_)) --next_;
   }
-  if ((to_fetch_.empty() || stopping_) && retrs_out_ == 0 && finished_.empty() && committing_ == 0 &&
+  if ((next_ == 0 || stopping_) && retrs_out_ == 0 && finished_.empty() && committing_ == 0 &&
       to_delete_.empty() && room()) {
     // Recorded before QUIT lets the server delete: a session cut before
     // QUIT's answer leaves the messages there, and the next one knows them.
