@@ -1,7 +1,7 @@
 // Small shared routines whose exact behaviour the services rely on:
 // comparison and search without regard to case, wildcard pattern lists,
-// access-time windows, formatting, the date parser, URL splitting and
-// escaping, form fields, Base64 and uuencode, MD5 and the "$1$" crypt.
+// access-time windows, formatting, the date parser, Base64 and uuencode,
+// MD5 and the "$1$" crypt. URLs, forms, HTML and HTTP dates are in http/.
 // Everything that builds text returns a std::string.
 #pragma once
 
@@ -12,8 +12,6 @@
 #include <string_view>
 
 namespace velmor {
-
-class CacheFile;
 
 // ---- comparison (characters lower-cased in the C locale) ------------------
 int str_casecmp(std::string_view a, std::string_view b);                 // -1, 0, 1
@@ -48,7 +46,7 @@ std::string date_text(std::time_t t, std::string_view format = {});
 // The classic message for an error number (see the table), else the number.
 std::string error_text(int error_number);
 inline constexpr std::time_t kBadDate = static_cast<std::time_t>(-1);
-// Dates of mail separator lines, headers, news and HTTP; kBadDate on failure.
+// Dates of mail separator lines, headers and news; kBadDate on failure.
 // Two-digit years: 00-49 are 20xx, 50-99 are 19xx.
 std::time_t parse_date(std::string_view text);
 
@@ -56,35 +54,9 @@ std::time_t parse_date(std::string_view text);
 std::string_view line_cut(std::string_view text);  // up to the first CR or LF
 std::string_view trim_blanks(std::string_view text);
 
-// ---- URLs ---------------------------------------------------------------------
-std::optional<std::string> url_scheme(std::string_view url);
-int url_scheme_code(std::string_view url);  // http 1, ftp 2, gopher 3, wais/telnet 4, else 0
-std::optional<std::string> url_host(std::string_view url);
-// The port after the host's ":" (host order), 0 when none or outside 1-65535.
-int url_port(std::string_view url);
 // A port written as decimal digits alone (host order), 0 when it is not
 // one from 1 to 65535.
 int port_number(std::string_view digits);
-std::string url_path(std::string_view url);
-std::optional<std::string> url_user(std::string_view url);
-std::optional<std::string> url_password(std::string_view url);
-std::string_view header_value(std::string_view line);
-
-// ---- escaping -------------------------------------------------------------
-// In place: "+" to a blank, "%xx" to its byte. 0; 1 when a "%" lacks two hex
-// digits (it stays); 2 when a NUL was decoded.
-int url_decode(std::string& text);
-std::string url_escape(std::string_view text);
-// "&", "\"", "<", ">" and (when `blanks`) a blank become entities.
-std::string html_escape(std::string_view text, bool blanks = false);
-int html_escape_to(CacheFile& file, std::string_view text, bool blanks = false);
-
-// ---- form fields (application/x-www-form-urlencoded) ---------------------
-std::optional<std::string> form_value(std::string_view query, std::string_view name);
-std::int64_t form_file_offset(CacheFile& file, std::string_view name);
-std::optional<std::string> form_file_value(CacheFile& file, std::string_view name);
-int form_file_copy(CacheFile& file, std::string_view name, CacheFile& destination);
-std::string form_text(std::string_view text);
 
 // ---- encodings ------------------------------------------------------------
 // The value of one hexadecimal digit (either case) or Base64 character; -1
