@@ -158,7 +158,8 @@ TEST(Strings, LinesBlanksAndPorts) {
   EXPECT_EQ(line_cut("one\r\ntwo"), "one");
   EXPECT_EQ(trim_blanks(" \t x y \r\n"), "x y");
   // Ports are 1-65535 in decimal digits alone.
-  for (const char* bad : {"", "0", "65536", "99999999999999", "80x", "+80", " 80"}) EXPECT_EQ(port_number(bad), 0) << bad;
+  for (const char* bad : {"", "0", "65536", "99999999999999", "80x", "+80", " 80"})
+    EXPECT_EQ(port_number(bad), 0) << bad;
   EXPECT_EQ(port_number("65535"), 65535);
   EXPECT_EQ(port_number("00080"), 80);
 }

@@ -62,7 +62,8 @@ TEST(ChunkedDecoder, WholeBodiesGoodAndBad) {
     ChunkStep step = d.feed(c.text, &body);
     EXPECT_STREQ(name(step.result), name(c.result)) << c.text;
     if (step.result == ChunkResult::done) EXPECT_EQ(body, c.body) << c.text;
-    if (step.result == ChunkResult::done || step.result == ChunkResult::need_more) EXPECT_EQ(step.used, c.used) << c.text;
+    if (step.result == ChunkResult::done || step.result == ChunkResult::need_more)
+      EXPECT_EQ(step.used, c.used) << c.text;
     if (step.result == ChunkResult::bad) EXPECT_FALSE(d.error().empty());
   }
 }

@@ -24,7 +24,8 @@ TEST(FormFields, QueryStrings) {
   EXPECT_EQ(form_text("a%20b+c&rest"), "a b c");
   EXPECT_EQ(form_text(std::string(300, 'q')).size(), 254u);
   using Fields = std::vector<std::pair<std::string, std::string>>;
-  EXPECT_EQ(form_fields("a=1&&B%26=x+y&flag&=v&c=%3D="), (Fields{{"a", "1"}, {"B&", "x y"}, {"flag", ""}, {"", "v"}, {"c", "=="}}));
+  EXPECT_EQ(form_fields("a=1&&B%26=x+y&flag&=v&c=%3D="),
+            (Fields{{"a", "1"}, {"B&", "x y"}, {"flag", ""}, {"", "v"}, {"c", "=="}}));
 }
 
 TEST(FormFields, PostedBodiesInFiles) {

@@ -58,7 +58,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   if (response.parse(text) == HeadResult::complete && response.head.version >= 10) {
     response_framing(response.head, "GET");
     ResponseParser reread;
-    if (reread.parse(write_head(response.head)) != HeadResult::complete || reread.head.headers != response.head.headers ||
+    HeadResult again = reread.parse(write_head(response.head));
+    if (again != HeadResult::complete || reread.head.headers != response.head.headers ||
         reread.head.status != response.head.status ||
         (!response.head.reason.empty() && reread.head.reason != response.head.reason))
       std::abort();

@@ -78,7 +78,8 @@ TEST(RequestHead, ResumesOneByteAtATimeAndStopsAtTheBlankLine) {
   const std::string head = "POST /f HTTP/1.1\r\nHost: h\r\nContent-Length: 3\r\n\r\n";
   const std::string text = head + "abcGET / HTTP/1.1\r\n";
   RequestParser p;
-  for (std::size_t n = 1; n < head.size(); ++n) ASSERT_EQ(p.parse(std::string_view(text).substr(0, n)), HeadResult::need_more) << n;
+  for (std::size_t n = 1; n < head.size(); ++n)
+    ASSERT_EQ(p.parse(std::string_view(text).substr(0, n)), HeadResult::need_more) << n;
   ASSERT_EQ(p.parse(text), HeadResult::complete);
   EXPECT_EQ(p.used(), head.size());
   EXPECT_EQ(p.head.headers.get("content-length"), "3");
@@ -161,7 +162,8 @@ TEST(Framing, RequestsThatCouldSmuggleAreBad) {
   } cases[] = {
       {request(11, {{"Host", "h"}}), true, BodyKind::none, 0, true},
       {request(11, {{"Host", "h"}, {"Content-Length", "5"}}), true, BodyKind::length, 5, true},
-      {request(11, {{"Host", "h"}, {"Content-Length", "5, 5"}, {"Content-Length", "5"}}), true, BodyKind::length, 5, true},
+      {request(11, {{"Host", "h"}, {"Content-Length", "5, 5"}, {"Content-Length", "5"}}), true, BodyKind::length, 5,
+       true},
       {request(11, {{"Host", "h"}, {"Content-Length", "0"}}), true, BodyKind::none, 0, true},
       {request(11, {{"Host", "h"}, {"Transfer-Encoding", "Chunked"}}), true, BodyKind::chunked, 0, true},
       {request(11, {{"Host", "h"}, {"Connection", "close"}}), true, BodyKind::none, 0, false},
@@ -184,7 +186,8 @@ TEST(Framing, RequestsThatCouldSmuggleAreBad) {
       {request(10, {{"Transfer-Encoding", "chunked"}}), false, {}, 0, false},
       {request(11, {{"Host", "h"}, {"Transfer-Encoding", "gzip, chunked"}}), false, {}, 0, false},
       {request(11, {{"Host", "h"}, {"Transfer-Encoding", "chunked, chunked"}}), false, {}, 0, false},
-      {request(11, {{"Host", "h"}, {"Transfer-Encoding", "gzip"}, {"Transfer-Encoding", "chunked"}}), false, {}, 0, false},
+      {request(11, {{"Host", "h"}, {"Transfer-Encoding", "gzip"}, {"Transfer-Encoding", "chunked"}}), false, {}, 0,
+       false},
       {request(11, {{"Host", "h"}, {"Transfer-Encoding", ""}}), false, {}, 0, false},
       // Not one Host.
       {request(11, {}), false, {}, 0, false},

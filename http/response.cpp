@@ -1,9 +1,6 @@
 #include "http/response.h"
 
-#include <algorithm>
-
 #include "core/strfmt.h"
-#include "http/chars.h"
 
 namespace velmor::http {
 

@@ -64,7 +64,8 @@ bool read_authority(std::string_view text, Url& url) {
   return url.port != 0;
 }
 
-constexpr std::pair<std::string_view, int> kDefaultPorts[] = {{"http", 80}, {"https", 443}, {"ftp", 21}, {"gopher", 70}};
+constexpr std::pair<std::string_view, int> kDefaultPorts[] = {
+    {"http", 80}, {"https", 443}, {"ftp", 21}, {"gopher", 70}};
 
 }  // namespace
 
@@ -128,8 +129,8 @@ std::optional<Url> parse_url(std::string_view text) {
   std::size_t colon = text.find(':');
   if (colon != std::string_view::npos && colon < text.find_first_of("/?#")) {
     std::string_view scheme = text.substr(0, colon);
-    if (scheme.empty() || !is_alpha(scheme[0]) ||
-        !std::all_of(scheme.begin(), scheme.end(), [](char c) { return is_alpha(c) || is_digit(c) || c == '+' || c == '-' || c == '.'; }))
+    auto scheme_char = [](char c) { return is_alpha(c) || is_digit(c) || c == '+' || c == '-' || c == '.'; };
+    if (scheme.empty() || !is_alpha(scheme[0]) || !std::all_of(scheme.begin(), scheme.end(), scheme_char))
       return std::nullopt;
     url.scheme = str_lower(scheme);
     text.remove_prefix(colon + 1);
