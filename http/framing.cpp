@@ -54,7 +54,11 @@ std::vector<std::string> codings(const HeaderList& fields) {
   return out;
 }
 
-Framing bad(std::string_view why) { return {.error = why}; }
+Framing bad(std::string_view why) {
+  Framing f;
+  f.error = why;
+  return f;
+}
 
 }  // namespace
 
@@ -64,7 +68,8 @@ Framing request_framing(const RequestHead& request) {
   if (hosts > 1 || (request.version >= 11 && hosts == 0)) return bad("not one Host field");
   bool length_ok = true;
   std::optional<std::uint64_t> length = content_length(fields, length_ok);
-  Framing f{.keep_alive = wants_keep_alive(request.version, fields)};
+  Framing f;
+  f.keep_alive = wants_keep_alive(request.version, fields);
   if (fields.has("Transfer-Encoding")) {
     if (length || !length_ok) return bad("both Transfer-Encoding and Content-Length");
     if (request.version < 11) return bad("Transfer-Encoding before HTTP/1.1");
@@ -81,7 +86,8 @@ Framing request_framing(const RequestHead& request) {
 
 Framing response_framing(const ResponseHead& response, std::string_view request_method) {
   const HeaderList& fields = response.headers;
-  Framing f{.keep_alive = wants_keep_alive(response.version, fields)};
+  Framing f;
+  f.keep_alive = wants_keep_alive(response.version, fields);
   int status = response.status;
   if (request_method == "HEAD" || (request_method == "CONNECT" && status / 100 == 2) || status / 100 == 1 ||
       status == 204 || status == 304)
