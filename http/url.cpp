@@ -33,6 +33,9 @@ bool visible(std::string_view s) {
   return std::none_of(s.begin(), s.end(), [](char c) { return c == ' ' || is_control(c); });
 }
 
+// Longer than any name the resolver can look up.
+constexpr std::size_t kMaxHost = 255;
+
 bool read_authority(std::string_view text, Url& url) {
   url.has_authority = true;
   std::size_t at = text.find('@');
@@ -53,7 +56,7 @@ bool read_authority(std::string_view text, Url& url) {
   } else {
     host_end = std::min(text.find(':'), text.size());
     url.host = str_lower(text.substr(0, host_end));
-    if (!only(url.host, "")) return false;
+    if (url.host.size() > kMaxHost || !only(url.host, "")) return false;
   }
   std::string_view port = text.substr(host_end);
   if (port.empty()) return true;

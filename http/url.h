@@ -41,7 +41,8 @@ struct Url {
 };
 
 // Any URI reference, absolute or relative; nullopt when it holds a blank or
-// control byte, a bad scheme, userinfo, host or port (1 to 65535).
+// control byte, a bad scheme, userinfo, host (or one over 255 characters)
+// or port (1 to 65535).
 std::optional<Url> parse_url(std::string_view text);
 
 // A request's target: the origin-form ("/path?query"), the absolute-form

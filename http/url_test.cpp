@@ -15,6 +15,7 @@ std::string parts(const Url& u) {
 }
 
 TEST(Url, SplitsReferencesAndGivesThemBack) {
+  const std::string long_host = "http://" + std::string(256, 'h') + "/";
   struct Case {
     const char* text;
     const char* parts;  // nullptr: not a URL
@@ -40,6 +41,7 @@ TEST(Url, SplitsReferencesAndGivesThemBack) {
       {"http://[zz]/", nullptr},
       {"http://[v1.x]/", nullptr},
       {"http://ho st/", nullptr},
+      {long_host.c_str(), nullptr},
       {"http://h%zz/", nullptr},
       {"http://u\"@h/", nullptr},
       {"http://h/\x01", nullptr},
@@ -62,6 +64,7 @@ TEST(Url, SplitsReferencesAndGivesThemBack) {
   EXPECT_EQ(u.host_port(), "[::1]:8080");
   EXPECT_EQ(u.target(), "/a?b");
   EXPECT_EQ(parse_url("ftp://anonymous@h")->password(), std::nullopt);
+  EXPECT_EQ(parse_url("http://" + std::string(255, 'h'))->host.size(), 255u);
   EXPECT_EQ(parse_url("http://h")->target(), "/");
   EXPECT_EQ(parse_url("ftp://h")->effective_port(), 21);
   EXPECT_EQ(parse_url("gopher://h:7070")->effective_port(), 7070);
