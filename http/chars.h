@@ -1,4 +1,5 @@
-// Character classes of HTTP and URLs, shared by the parsers of this folder.
+// Character classes of HTTP and URLs, shared by the parsers of this folder
+// (hexadecimal digits are core's hex_digit).
 #pragma once
 
 namespace velmor::http {
@@ -21,12 +22,6 @@ inline bool is_tchar(char c) {
     default:
       return false;
   }
-}
-inline int hex_value(char c) {
-  if (is_digit(c)) return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
 }
 
 }  // namespace velmor::http

@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "core/strfmt.h"
+#include "core/util.h"
 #include "http/chars.h"
 
 namespace velmor::http {
@@ -17,11 +18,11 @@ SizeLine read_size_line(std::string_view line, std::uint64_t& size) {
   std::size_t i = 0;
   while (i < line.size() && line[i] == '0') ++i;
   std::size_t first = i;
-  while (i < line.size() && hex_value(line[i]) >= 0) ++i;
+  while (i < line.size() && hex_digit(line[i]) >= 0) ++i;
   if (i == 0) return SizeLine::bad;
   if (i - first > 15) return SizeLine::too_big;
   size = 0;
-  for (std::size_t k = first; k < i; ++k) size = size * 16 + static_cast<std::uint64_t>(hex_value(line[k]));
+  for (std::size_t k = first; k < i; ++k) size = size * 16 + static_cast<std::uint64_t>(hex_digit(line[k]));
   std::string_view rest = line.substr(i);
   while (!rest.empty() && is_blank(rest.front())) rest.remove_prefix(1);
   if (rest.empty()) return SizeLine::ok;

@@ -20,7 +20,7 @@ bool only(std::string_view s, std::string_view extra) {
   for (std::size_t i = 0; i < s.size(); ++i) {
     char c = s[i];
     if (c == '%') {
-      if (i + 2 >= s.size() || hex_value(s[i + 1]) < 0 || hex_value(s[i + 2]) < 0) return false;
+      if (i + 2 >= s.size() || hex_digit(s[i + 1]) < 0 || hex_digit(s[i + 2]) < 0) return false;
       i += 2;
     } else if (!is_unreserved(c) && !is_sub_delim(c) && extra.find(c) == std::string_view::npos) {
       return false;
@@ -259,8 +259,8 @@ DecodeResult url_decode(std::string& text, bool plus_as_blank) {
     if (c == '+' && plus_as_blank) {
       c = ' ';
     } else if (c == '%') {
-      int hi = i + 2 < text.size() ? hex_value(text[i + 1]) : -1;
-      int lo = i + 2 < text.size() ? hex_value(text[i + 2]) : -1;
+      int hi = i + 2 < text.size() ? hex_digit(text[i + 1]) : -1;
+      int lo = i + 2 < text.size() ? hex_digit(text[i + 2]) : -1;
       if (hi >= 0 && lo >= 0) {
         c = static_cast<char>(hi * 16 + lo);
         if (c == '\0') result = DecodeResult::nul;
